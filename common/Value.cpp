@@ -1,0 +1,324 @@
+#include "common/Value.h"
+
+#include <cctype>
+#include <charconv>
+#include <cmath>
+#include <cstdio>
+#include <ctime>
+#include <functional>
+
+namespace qn {
+
+Date Date::Now() {
+  using namespace std::chrono;
+  return Date{duration<double>(system_clock::now().time_since_epoch()).count()};
+}
+
+Value::Value(Array a) : v_(std::make_shared<const Array>(std::move(a))) {}
+Value::Value(Dictionary d) : v_(std::make_shared<const Dictionary>(std::move(d))) {}
+Value::Value(std::shared_ptr<const Array> a) {
+  if (a) v_ = std::move(a);
+}
+Value::Value(std::shared_ptr<const Dictionary> d) {
+  if (d) v_ = std::move(d);
+}
+
+const Array* Value::as_array() const {
+  auto p = std::get_if<std::shared_ptr<const Array>>(&v_);
+  return p ? p->get() : nullptr;
+}
+
+const Dictionary* Value::as_dictionary() const {
+  auto p = std::get_if<std::shared_ptr<const Dictionary>>(&v_);
+  return p ? p->get() : nullptr;
+}
+
+std::shared_ptr<const Array> Value::shared_array() const {
+  auto p = std::get_if<std::shared_ptr<const Array>>(&v_);
+  return p ? *p : nullptr;
+}
+
+std::shared_ptr<const Dictionary> Value::shared_dictionary() const {
+  auto p = std::get_if<std::shared_ptr<const Dictionary>>(&v_);
+  return p ? *p : nullptr;
+}
+
+std::optional<std::int64_t> Value::as_int64() const {
+  if (auto i = std::get_if<std::int64_t>(&v_)) return *i;
+  return std::nullopt;  // a uint64 alternative is always above INT64_MAX
+}
+
+std::optional<std::uint64_t> Value::as_uint64() const {
+  if (auto i = std::get_if<std::int64_t>(&v_)) {
+    if (*i >= 0) return static_cast<std::uint64_t>(*i);
+    return std::nullopt;
+  }
+  if (auto u = std::get_if<std::uint64_t>(&v_)) return *u;
+  return std::nullopt;
+}
+
+std::optional<double> Value::as_double() const {
+  switch (kind()) {
+    case Kind::kBool:
+      return *as_bool() ? 1.0 : 0.0;
+    case Kind::kInt:
+      return static_cast<double>(std::get<std::int64_t>(v_));
+    case Kind::kUInt:
+      return static_cast<double>(std::get<std::uint64_t>(v_));
+    case Kind::kDouble:
+      return std::get<double>(v_);
+    default:
+      return std::nullopt;
+  }
+}
+
+namespace {
+
+void AppendDouble(std::string& out, double d) {
+  if (std::isnan(d)) {
+    out += "nan";
+    return;
+  }
+  if (std::isinf(d)) {
+    out += d > 0 ? "inf" : "-inf";
+    return;
+  }
+  char buf[64];
+  auto r = std::to_chars(buf, buf + sizeof buf, d);
+  out.append(buf, r.ptr);
+}
+
+// Strings inside collections are quoted unless they are a plain word, so that the printed
+// form of a collection stays unambiguous.
+bool IsPlainWord(const std::string& s) {
+  if (s.empty()) return false;
+  for (unsigned char c : s) {
+    if (!(std::isalnum(c) || c == '_' || c == '.' || c == '/' || c == '-')) return false;
+  }
+  return true;
+}
+
+void AppendQuoted(std::string& out, const std::string& s) {
+  out += '"';
+  for (char c : s) {
+    switch (c) {
+      case '"':
+        out += "\\\"";
+        break;
+      case '\\':
+        out += "\\\\";
+        break;
+      case '\n':
+        out += "\\n";
+        break;
+      default:
+        out += c;
+    }
+  }
+  out += '"';
+}
+
+void Indent(std::string& out, int indent) { out.append(static_cast<std::size_t>(indent) * 4, ' '); }
+
+}  // namespace
+
+void Value::Describe(std::string& out, int indent, bool nested) const {
+  switch (kind()) {
+    case Kind::kNull:
+      out += "<null>";
+      break;
+    case Kind::kBool:
+      out += *as_bool() ? "1" : "0";
+      break;
+    case Kind::kInt:
+      out += std::to_string(std::get<std::int64_t>(v_));
+      break;
+    case Kind::kUInt:
+      out += std::to_string(std::get<std::uint64_t>(v_));
+      break;
+    case Kind::kDouble:
+      AppendDouble(out, std::get<double>(v_));
+      break;
+    case Kind::kString: {
+      const std::string& s = std::get<std::string>(v_);
+      if (nested && !IsPlainWord(s)) {
+        AppendQuoted(out, s);
+      } else {
+        out += s;
+      }
+      break;
+    }
+    case Kind::kData: {
+      static const char* kHex = "0123456789abcdef";
+      out += '<';
+      for (std::uint8_t b : as_data()->bytes) {
+        out += kHex[b >> 4];
+        out += kHex[b & 15];
+      }
+      out += '>';
+      break;
+    }
+    case Kind::kDate: {
+      std::time_t t = static_cast<std::time_t>(std::floor(as_date()->seconds_since_1970));
+      std::tm tm{};
+      gmtime_r(&t, &tm);
+      char buf[40];
+      std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
+      out += buf;
+      break;
+    }
+    case Kind::kArray: {
+      const Array& a = *as_array();
+      out += "(\n";
+      for (std::size_t i = 0; i < a.size(); ++i) {
+        Indent(out, indent + 1);
+        a[i].Describe(out, indent + 1, true);
+        out += i + 1 < a.size() ? ",\n" : "\n";
+      }
+      Indent(out, indent);
+      out += ')';
+      break;
+    }
+    case Kind::kDictionary: {
+      out += "{\n";
+      for (const auto& [k, v] : *as_dictionary()) {
+        Indent(out, indent + 1);
+        k.Describe(out, indent + 1, true);
+        out += " = ";
+        v.Describe(out, indent + 1, true);
+        out += ";\n";
+      }
+      Indent(out, indent);
+      out += '}';
+      break;
+    }
+  }
+}
+
+std::string Value::Description() const {
+  std::string out;
+  Describe(out, 0, false);
+  return out;
+}
+
+bool Value::operator==(const Value& other) const {
+  if (is_number() && other.is_number()) {
+    if (kind() == Kind::kDouble || other.kind() == Kind::kDouble) {
+      return *as_double() == *other.as_double();
+    }
+    return v_ == other.v_;  // int64 and uint64 ranges never overlap
+  }
+  if (kind() != other.kind()) return false;
+  switch (kind()) {
+    case Kind::kArray:
+      return *as_array() == *other.as_array();
+    case Kind::kDictionary:
+      return *as_dictionary() == *other.as_dictionary();
+    default:
+      return v_ == other.v_;
+  }
+}
+
+std::size_t Value::Hash() const {
+  auto mix = [](std::size_t seed, std::size_t h) {
+    return seed ^ (h + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2));
+  };
+  switch (kind()) {
+    case Kind::kNull:
+      return 0;
+    case Kind::kBool:
+      return *as_bool() ? 0x51 : 0x50;
+    case Kind::kInt:
+      return std::hash<std::int64_t>()(std::get<std::int64_t>(v_));
+    case Kind::kUInt:
+      return std::hash<std::uint64_t>()(std::get<std::uint64_t>(v_));
+    case Kind::kDouble: {
+      // Integral doubles hash like the equal integer, so that 1.0 finds the key 1.
+      double d = std::get<double>(v_);
+      if (d >= -9.2e18 && d <= 9.2e18 && d == std::trunc(d)) {
+        return std::hash<std::int64_t>()(static_cast<std::int64_t>(d));
+      }
+      return std::hash<double>()(d);
+    }
+    case Kind::kString:
+      return std::hash<std::string>()(std::get<std::string>(v_));
+    case Kind::kData: {
+      const auto& b = as_data()->bytes;
+      return std::hash<std::string_view>()(
+          std::string_view(reinterpret_cast<const char*>(b.data()), b.size()));
+    }
+    case Kind::kDate:
+      return std::hash<double>()(as_date()->seconds_since_1970);
+    case Kind::kArray: {
+      std::size_t h = 0xa77a;
+      for (const Value& v : *as_array()) h = mix(h, v.Hash());
+      return h;
+    }
+    case Kind::kDictionary: {
+      std::size_t h = 0xd1c7;  // order-independent, like equality
+      for (const auto& [k, v] : *as_dictionary()) h += mix(k.Hash(), v.Hash());
+      return h;
+    }
+  }
+  return 0;
+}
+
+Dictionary::Dictionary(std::initializer_list<Entry> entries) {
+  for (const auto& [k, v] : entries) Set(k, v);
+}
+
+const Value* Dictionary::Find(const Value& key) const {
+  if (!index_.empty()) {
+    auto it = index_.find(key);
+    return it == index_.end() ? nullptr : &entries_[it->second].second;
+  }
+  for (const auto& e : entries_) {
+    if (e.first == key) return &e.second;
+  }
+  return nullptr;
+}
+
+void Dictionary::Set(Value key, Value value) {
+  if (const Value* existing = Find(key)) {
+    const_cast<Value&>(*existing) = std::move(value);
+    return;
+  }
+  entries_.emplace_back(std::move(key), std::move(value));
+  if (entries_.size() == kIndexThreshold) {
+    Reindex();
+  } else if (!index_.empty()) {
+    index_.emplace(entries_.back().first, entries_.size() - 1);
+  }
+}
+
+bool Dictionary::Erase(const Value& key) {
+  for (auto it = entries_.begin(); it != entries_.end(); ++it) {
+    if (it->first == key) {
+      entries_.erase(it);
+      Reindex();
+      return true;
+    }
+  }
+  return false;
+}
+
+void Dictionary::Merge(const Dictionary& other) {
+  for (const auto& [k, v] : other) Set(k, v);
+}
+
+void Dictionary::Reindex() {
+  index_.clear();
+  if (entries_.size() < kIndexThreshold) return;
+  for (std::size_t i = 0; i < entries_.size(); ++i) index_.emplace(entries_[i].first, i);
+}
+
+bool Dictionary::operator==(const Dictionary& other) const {
+  if (size() != other.size()) return false;
+  for (const auto& [k, v] : entries_) {
+    const Value* o = other.Find(k);
+    if (!o || !(*o == v)) return false;
+  }
+  return true;
+}
+
+}  // namespace qn

@@ -1,0 +1,49 @@
+#pragma once
+
+#include <atomic>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "platform/analytics.h"
+#include "platform/defaults.h"
+#include "platform/device_info.h"
+#include "platform/dispatch.h"
+#include "platform/enerdex.h"
+#include "platform/livo_reporting.h"
+#include "platform/log.h"
+#include "platform/notify.h"
+#include "platform/orientation.h"
+#include "platform/ostrel.h"
+#include "platform/process.h"
+#include "platform/trace.h"
+
+namespace qn {
+
+// Every platform service the service logic uses, in one place (like LevelDB's Env): the
+// daemon fills it with the Linux implementations, tests with fakes. Members are set once,
+// before the service starts, and only read afterwards.
+struct Platform {
+  std::shared_ptr<Log> log;
+  std::shared_ptr<Trace> trace;
+  std::shared_ptr<Dispatcher> dispatcher;
+  std::shared_ptr<Notify> notify;
+  std::shared_ptr<Defaults> defaults;
+  std::shared_ptr<Process> process;
+  std::shared_ptr<DeviceInfo> device_info;
+  std::shared_ptr<LivoReporting> livo_reporting;
+  std::shared_ptr<Orientation> orientation;
+  std::shared_ptr<Ostrel> ostrel;
+  std::shared_ptr<Enerdex> enerdex;
+  std::shared_ptr<Analytics> analytics;
+
+  // The diagnostic-log directory for audio reporting (summary files).
+  std::string diagnostic_logs_dir = "/var/log/quenta/DiagnosticLogs/Audio/Reporting";
+
+  // Process-wide state that is computed once (the internal-build flag). It lives here so
+  // that each test's Platform starts afresh.
+  mutable std::once_flag internal_build_once;
+  mutable bool internal_build = false;
+};
+
+}  // namespace qn
