@@ -135,8 +135,12 @@ class Dictionary {
   // The value stored under key, or nullptr.
   const Value* Find(const Value& key) const;
   const Value* Find(std::string_view key) const { return Find(Value(key)); }
+  const Value* Find(const std::string& key) const { return Find(Value(key)); }
+  const Value* Find(const char* key) const { return Find(Value(key)); }
   bool Contains(const Value& key) const { return Find(key) != nullptr; }
   bool Contains(std::string_view key) const { return Find(key) != nullptr; }
+  bool Contains(const std::string& key) const { return Find(key) != nullptr; }
+  bool Contains(const char* key) const { return Find(key) != nullptr; }
 
   // Stores value under key: replaces in place when the key exists, else appends.
   void Set(Value key, Value value);
@@ -144,6 +148,8 @@ class Dictionary {
   bool Erase(const Value& key);
   // Adds every entry of other, in its order (later values replace earlier ones).
   void Merge(const Dictionary& other);
+  // Makes room for n entries in all (a hint; does not change the contents).
+  void Reserve(std::size_t n);
 
   bool operator==(const Dictionary& other) const;  // same entries, order ignored
 
