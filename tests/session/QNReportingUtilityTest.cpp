@@ -1,0 +1,202 @@
+#include "Statistics/QNReportingUtility.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <optional>
+#include <thread>
+#include <vector>
+
+#include "tests/session/SessionTestPlatform.h"
+
+namespace qn {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::MatchesRegex;
+using testing::SessionTestPlatform;
+using namespace std::chrono_literals;
+
+TEST(QNReportingUtilityTest, CategoryNames) {
+  EXPECT_EQ(QNReportingCategoryName(11), "Volume");
+  EXPECT_EQ(QNReportingCategoryName(0), "Undefined");
+  EXPECT_EQ(QNReportingCategoryName(1), "Generic");
+  EXPECT_EQ(QNReportingCategoryName(4), "PlaybackAndRecord");
+  EXPECT_EQ(QNReportingCategoryName(9), "Ostreling");
+  EXPECT_EQ(QNReportingCategoryName(10), "Performance");
+  EXPECT_EQ(QNReportingCategoryName(12), "Undefined");
+  EXPECT_EQ(QNReportingCategoryName(0xFFFF), "Undefined");
+  // Origins: one flag word each; anything else gives only the separator.
+  EXPECT_EQ(QNReportingCategoryName(0x80000009), "Toolbox_Ostreling");
+  EXPECT_EQ(QNReportingCategoryName(0x40000007), "Routing_RouteChange");
+  EXPECT_EQ(QNReportingCategoryName(0x20000003), "HAL_Playback");
+  EXPECT_EQ(QNReportingCategoryName(0x10000008), "DSP_Error");
+  EXPECT_EQ(QNReportingCategoryName(0x08000006), "Session_ClientRequest");
+  EXPECT_EQ(QNReportingCategoryName(0x30000001), "_Generic");
+  EXPECT_EQ(QNReportingCategoryName(0x00010002), "_Record");
+  EXPECT_EQ(QNReportingCategoryName(0x00FF0005), "_Setup");
+  EXPECT_EQ(QNReportingCategoryName(0x8000000C), "Toolbox_Undefined");
+  // All ones is not an origin: no prefix.
+  EXPECT_EQ(QNReportingCategoryName(0xFFFFFFFF), "Undefined");
+  EXPECT_EQ(QNReportingCategoryName(0xFFFFFFFE), "_Undefined");
+}
+
+TEST(QNReportingUtilityTest, TypeNames) {
+  const char* expected[] = {"Generic", "Start", "Stop", "Setup", "Error", "IssueDetector"};
+  for (std::uint16_t t = 0; t < 6; ++t) EXPECT_EQ(QNReportingTypeName(t), expected[t]);
+  EXPECT_EQ(QNReportingTypeName(6), "Undefined");
+  EXPECT_EQ(QNReportingTypeName(65534), "Undefined");
+  EXPECT_EQ(QNReportingTypeName(65535), "Unknown");
+}
+
+TEST(QNReportingUtilityTest, ServiceTypeNames) {
+  const char* expected[] = {"generic",          "vessa",         "telephony",
+                            "haptics",          "alarms",        "standalone",
+                            "soundautoconfig",  "longformaudio", "nonlongformaudio",
+                            "audiodeviceusage", "alerts",        "test",
+                            "apiusage"};
+  for (std::uint32_t t = 0; t < 13; ++t) EXPECT_EQ(QNReportingServiceTypeName(t), expected[t]);
+  EXPECT_EQ(QNReportingServiceTypeName(13), "telephony");
+  EXPECT_EQ(QNReportingServiceTypeName(65534), "telephony");
+  EXPECT_EQ(QNReportingServiceTypeName(65535), "unknown");
+  EXPECT_EQ(QNReportingServiceTypeName(65536), "telephony");
+  EXPECT_EQ(QNReportingServiceTypeName(0xFFFFFFFF), "telephony");
+}
+
+TEST(QNReportingUtilityTest, HostApplicationName) {
+  EXPECT_EQ(QNReportingHostApplicationName(static_cast<const Dictionary*>(nullptr)), "Unknown");
+  Dictionary empty;
+  EXPECT_EQ(QNReportingHostApplicationName(&empty), "Unknown");
+  Dictionary info{{"HostApplicationDisplayID", "org.example.player"}, {"other", 1}};
+  EXPECT_EQ(QNReportingHostApplicationName(&info), "org.example.player");
+  auto shared = std::make_shared<const Dictionary>(info);
+  EXPECT_EQ(QNReportingHostApplicationName(shared), "org.example.player");
+}
+
+TEST(QNReportingUtilityTest, InternalBuildAnswerReadAsBoolean) {
+  struct Case {
+    std::optional<Value> answer;
+    bool expected;
+  };
+  const Case cases[] = {{std::nullopt, false}, {Value(true), true},  {Value(false), false},
+                        {Value(1), true},      {Value(0), false},    {Value("YES"), true},
+                        {Value("true"), true}, {Value("no"), false}, {Value(""), false}};
+  for (const Case& c : cases) {
+    SessionTestPlatform t;
+    if (c.answer) t.device_info->SetAnswer("InternalBuild", *c.answer);
+    EXPECT_EQ(QNReportingIsInternalBuild(*t.platform), c.expected)
+        << (c.answer ? c.answer->Description() : "(none)");
+  }
+  auto bare = std::make_shared<Platform>();  // no device information at all
+  EXPECT_FALSE(QNReportingIsInternalBuild(*bare));
+}
+
+TEST(QNReportingUtilityTest, InternalBuildAskedOncePerPlatformEvenWhenRacing) {
+  SessionTestPlatform t;
+  t.device_info->SetAnswer("InternalBuild", true);
+  std::vector<std::thread> threads;
+  std::atomic<int> yes{0};
+  for (int i = 0; i < 8; ++i) {
+    threads.emplace_back([&] { yes += QNReportingIsInternalBuild(*t.platform); });
+  }
+  for (auto& th : threads) th.join();
+  EXPECT_EQ(yes.load(), 8);
+  // Later changes of the answer are not seen: the flag is kept.
+  t.device_info->SetAnswer("InternalBuild", false);
+  EXPECT_TRUE(QNReportingIsInternalBuild(*t.platform));
+  EXPECT_EQ(t.device_info->Asked("InternalBuild"), 1);
+}
+
+class WaitTest : public ::testing::Test {
+ protected:
+  void StartWait(double timeout = 9.0) {
+    QNReportingUtilityWait(*t_.platform, condition_, done_, "waiting for the thing",
+                           "the thing never came", scope_, timeout,
+                           [this](bool ok) { results_.push_back(ok); });
+  }
+  std::vector<std::string> Texts() const {
+    std::vector<std::string> out;
+    for (const auto& l : t_.log->Lines()) out.push_back(l.text);
+    return out;
+  }
+
+  SessionTestPlatform t_;
+  std::shared_ptr<const LogScope> scope_ = t_.log->RegisterScope(
+      true, 0x716E7272, "qnrr", "com.norvel.quenta", "reporting_session_verbose", 31);
+  std::shared_ptr<Condition> condition_ = t_.dispatcher->CreateCondition();
+  std::shared_ptr<bool> done_ = std::make_shared<bool>(false);
+  std::vector<bool> results_;
+};
+
+TEST_F(WaitTest, FlagAlreadySetCompletesAtOnceWithoutLogging) {
+  *done_ = true;
+  StartWait();
+  EXPECT_THAT(results_, ElementsAre(true));
+  EXPECT_TRUE(t_.log->Lines().empty());
+  EXPECT_EQ(t_.dispatcher->PendingTimers(), 0);
+}
+
+TEST_F(WaitTest, TimesOutWithErrorLine) {
+  StartWait();
+  EXPECT_TRUE(results_.empty());
+  t_.dispatcher->AdvanceBy(8999ms);
+  EXPECT_TRUE(results_.empty());
+  t_.dispatcher->AdvanceBy(1ms);
+  EXPECT_THAT(results_, ElementsAre(false));
+  auto lines = t_.log->Lines();
+  ASSERT_EQ(lines.size(), 2u);
+  EXPECT_THAT(lines[0].text, MatchesRegex("QNReportingUtility\\.cpp:[0-9]+:QNReportingUtilityWait: "
+                                          "waiting for the thing"));
+  EXPECT_EQ(lines[0].level, LogLevel::kDefault);
+  EXPECT_EQ(lines[0].scope, "qnrr");
+  EXPECT_THAT(lines[1].text, MatchesRegex("QNReportingUtility\\.cpp:[0-9]+:QNReportingUtilityWait: "
+                                          "the thing never came"));
+  EXPECT_EQ(lines[1].level, LogLevel::kError);
+}
+
+TEST_F(WaitTest, SignalWithFlagSetCompletesTrue) {
+  StartWait();
+  std::thread signaller([this] {
+    condition_->lock();
+    *done_ = true;
+    condition_->Signal();
+    condition_->unlock();
+  });
+  signaller.join();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_THAT(results_, ElementsAre(true));
+  EXPECT_THAT(Texts(), ElementsAre(::testing::HasSubstr(": waiting for the thing"),
+                                   MatchesRegex(".*:QNReportingUtilityWait: continuing")));
+  // The deadline of the finished wait no longer fires anything.
+  t_.dispatcher->AdvanceBy(20s);
+  EXPECT_EQ(results_.size(), 1u);
+}
+
+TEST_F(WaitTest, WakeWithoutFlagWaitsAFullNewPeriod) {
+  StartWait();
+  t_.dispatcher->AdvanceBy(5s);
+  t_.dispatcher->WakeAllConditions();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_TRUE(results_.empty());
+  EXPECT_EQ(t_.log->Count(": continuing"), 1);
+  EXPECT_EQ(t_.log->Count(": waiting for the thing"), 2);
+  // The first deadline (9 s after the start) has no effect any more.
+  t_.dispatcher->AdvanceBy(8999ms);
+  EXPECT_TRUE(results_.empty());
+  t_.dispatcher->AdvanceBy(1ms);
+  EXPECT_THAT(results_, ElementsAre(false));
+  EXPECT_EQ(t_.log->Count("the thing never came"), 1);
+}
+
+TEST_F(WaitTest, NullLogGoesToDefaultLog) {
+  QNReportingUtilityWait(*t_.platform, condition_, done_, "w", "t", nullptr, 0.5,
+                         [this](bool ok) { results_.push_back(ok); });
+  t_.dispatcher->AdvanceBy(500ms);
+  EXPECT_THAT(results_, ElementsAre(false));
+  for (const auto& l : t_.log->Lines()) EXPECT_EQ(l.scope, "");
+  EXPECT_EQ(t_.log->Lines().size(), 2u);
+}
+
+}  // namespace
+}  // namespace qn
