@@ -306,6 +306,11 @@ void Dictionary::Merge(const Dictionary& other) {
   for (const auto& [k, v] : other) Set(k, v);
 }
 
+void Dictionary::Reserve(std::size_t n) {
+  entries_.reserve(n);
+  if (n >= kIndexThreshold) index_.reserve(n);
+}
+
 void Dictionary::Reindex() {
   index_.clear();
   if (entries_.size() < kIndexThreshold) return;

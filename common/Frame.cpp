@@ -1,0 +1,64 @@
+#include "common/Frame.h"
+
+#include "common/Format.h"
+#include "common/MsgPack.h"
+
+namespace qn {
+
+bool AppendFrame(std::string& buffer, const Value& body) {
+  const std::size_t header_at = buffer.size();
+  buffer.append(kFrameHeaderBytes, '\0');
+  AppendMsgPack(buffer, body);
+  const std::size_t length = buffer.size() - header_at - kFrameHeaderBytes;
+  if (length > protocol::kMaxBodyBytes) {
+    buffer.resize(header_at);
+    return false;
+  }
+  for (std::size_t i = 0; i < kFrameHeaderBytes; ++i) {
+    buffer[header_at + i] = static_cast<char>((length >> (8 * (kFrameHeaderBytes - 1 - i))) & 0xff);
+  }
+  return true;
+}
+
+void FrameDecoder::DropConsumed() {
+  if (consumed_ == 0) return;
+  buffer_.erase(0, consumed_);
+  consumed_ = 0;
+}
+
+void FrameDecoder::Feed(std::string_view bytes) {
+  if (error_) return;
+  DropConsumed();
+  buffer_.append(bytes);
+}
+
+std::optional<std::string_view> FrameDecoder::Next() {
+  if (error_) return std::nullopt;
+  if (consumed_ == buffer_.size()) {
+    // Everything returned: release the storage of large frames, keep small buffers.
+    buffer_.clear();
+    consumed_ = 0;
+    if (buffer_.capacity() > 2 * protocol::kMaxBodyBytes) buffer_.shrink_to_fit();
+    return std::nullopt;
+  }
+  if (buffered() < kFrameHeaderBytes) return std::nullopt;
+  const auto* header = reinterpret_cast<const unsigned char*>(buffer_.data() + consumed_);
+  const std::uint32_t length = (std::uint32_t{header[0]} << 24) | (std::uint32_t{header[1]} << 16) |
+                               (std::uint32_t{header[2]} << 8) | std::uint32_t{header[3]};
+  if (length == 0 || length > protocol::kMaxBodyBytes) {
+    error_ =
+        protocol::RequestProblem{protocol::ConnectionError::kBadLength,
+                                 StringWithFormat("bad frame length %u (must be 1 to %zu bytes)",
+                                                  length, protocol::kMaxBodyBytes)};
+    buffer_.clear();
+    buffer_.shrink_to_fit();
+    consumed_ = 0;
+    return std::nullopt;
+  }
+  if (buffered() - kFrameHeaderBytes < length) return std::nullopt;
+  std::string_view body(buffer_.data() + consumed_ + kFrameHeaderBytes, length);
+  consumed_ += kFrameHeaderBytes + length;
+  return body;
+}
+
+}  // namespace qn

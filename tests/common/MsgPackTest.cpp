@@ -1,0 +1,311 @@
+#include "common/MsgPack.h"
+
+#include <gtest/gtest.h>
+
+#include <cmath>
+#include <ctime>
+#include <limits>
+#include <msgpack.hpp>
+#include <string>
+
+namespace qn {
+namespace {
+
+using protocol::ConnectionError;
+using protocol::RequestProblem;
+
+std::string Bytes(std::initializer_list<int> bytes) {
+  std::string out;
+  for (int b : bytes) out.push_back(static_cast<char>(b));
+  return out;
+}
+
+std::string Hex(std::string_view bytes) {
+  static const char* kHex = "0123456789abcdef";
+  std::string out;
+  for (unsigned char c : bytes) {
+    out += kHex[c >> 4];
+    out += kHex[c & 15];
+  }
+  return out;
+}
+
+Value MustDecode(std::string_view body) {
+  auto result = DecodeMsgPack(body);
+  if (auto* problem = std::get_if<RequestProblem>(&result)) {
+    ADD_FAILURE() << "decode failed: " << problem->message << " for " << Hex(body);
+    return Value();
+  }
+  return std::get<Value>(std::move(result));
+}
+
+RequestProblem MustFail(std::string_view body) {
+  auto result = DecodeMsgPack(body);
+  if (auto* problem = std::get_if<RequestProblem>(&result)) return *problem;
+  ADD_FAILURE() << "decode of " << Hex(body.substr(0, 64))
+                << " succeeded: " << std::get<Value>(result).Description();
+  return RequestProblem{};
+}
+
+// A value of every kind, nested, with keys of several kinds.
+Value EveryKind() {
+  Dictionary inner{{"s", "text"}, {1, 2.5}, {Value(Array{1, 2}), Value(true)}};
+  Dictionary outer;
+  outer.Set("null", Value());
+  outer.Set("bools", Array{true, false});
+  outer.Set("ints", Array{0, -1, 127, 128, -33, 65536, INT64_MIN, INT64_MAX, UINT64_MAX});
+  outer.Set("double", 0.1);
+  outer.Set("data", Data{{0, 1, 0xff}});
+  outer.Set("date", Date{1705329005.0});
+  outer.Set("nested", inner);
+  outer.Set(42, "number key");
+  return Value(outer);
+}
+
+TEST(MsgPackTest, IntegersUseTheSmallestEncoding) {
+  struct Case {
+    Value value;
+    std::string hex;
+  } cases[] = {
+      {0, "00"},
+      {127, "7f"},
+      {128, "cc80"},
+      {255, "ccff"},
+      {256, "cd0100"},
+      {65535, "cdffff"},
+      {65536, "ce00010000"},
+      {4294967295LL, "ceffffffff"},
+      {4294967296LL, "cf0000000100000000"},
+      {INT64_MAX, "cf7fffffffffffffff"},
+      {UINT64_MAX, "cfffffffffffffffff"},
+      {-1, "ff"},
+      {-32, "e0"},
+      {-33, "d0df"},
+      {-128, "d080"},
+      {-129, "d1ff7f"},
+      {-32768, "d18000"},
+      {-32769, "d2ffff7fff"},
+      {static_cast<std::int64_t>(INT32_MIN), "d280000000"},
+      {static_cast<std::int64_t>(INT32_MIN) - 1, "d3ffffffff7fffffff"},
+      {INT64_MIN, "d38000000000000000"},
+  };
+  for (const auto& c : cases) {
+    std::string encoded = EncodeMsgPack(c.value);
+    EXPECT_EQ(Hex(encoded), c.hex) << c.value.Description();
+    Value back = MustDecode(encoded);
+    EXPECT_EQ(back, c.value);
+    EXPECT_EQ(back.kind(), c.value.kind());
+  }
+}
+
+TEST(MsgPackTest, LengthPrefixesSwitchAtTheirLimits) {
+  struct Case {
+    std::size_t size;
+    std::string str_header, bin_header, array_header;
+  } cases[] = {
+      {0, "a0", "c400", "90"},
+      {15, "af", "c40f", "9f"},
+      {16, "b0", "c410", "dc0010"},
+      {31, "bf", "c41f", "dc001f"},
+      {32, "d920", "c420", "dc0020"},
+      {255, "d9ff", "c4ff", "dc00ff"},
+      {256, "da0100", "c50100", "dc0100"},
+      {65535, "daffff", "c5ffff", "dcffff"},
+      {65536, "db00010000", "c600010000", "dd00010000"},
+  };
+  for (const auto& c : cases) {
+    Value str(std::string(c.size, 'x'));
+    Value bin(Data{std::vector<std::uint8_t>(c.size, 7)});
+    Value array(Array(c.size, Value()));
+    std::string s = EncodeMsgPack(str), b = EncodeMsgPack(bin), a = EncodeMsgPack(array);
+    EXPECT_EQ(Hex(s.substr(0, c.str_header.size() / 2)), c.str_header) << c.size;
+    EXPECT_EQ(Hex(b.substr(0, c.bin_header.size() / 2)), c.bin_header) << c.size;
+    EXPECT_EQ(Hex(a.substr(0, c.array_header.size() / 2)), c.array_header) << c.size;
+    EXPECT_EQ(MustDecode(s), str);
+    EXPECT_EQ(MustDecode(b), bin);
+    EXPECT_EQ(MustDecode(a), array);
+  }
+}
+
+TEST(MsgPackTest, ScalarsRoundTrip) {
+  for (Value v : {Value(), Value(true), Value(false), Value(0.5), Value(-0.0), Value(1e300),
+                  Value(std::numeric_limits<double>::infinity()), Value(""), Value("héllo")}) {
+    std::string encoded = EncodeMsgPack(v);
+    EXPECT_EQ(MustDecode(encoded), v) << v.Description();
+    EXPECT_EQ(MustDecode(encoded).kind(), v.kind());
+  }
+  EXPECT_EQ(Hex(EncodeMsgPack(Value(1.0))), "cb3ff0000000000000");  // doubles stay float64
+  Value nan = MustDecode(EncodeMsgPack(Value(std::nan(""))));
+  ASSERT_EQ(nan.kind(), Value::Kind::kDouble);
+  EXPECT_TRUE(std::isnan(*nan.as_double()));
+  EXPECT_EQ(MustDecode(Bytes({0xca, 0x3f, 0xc0, 0, 0})), Value(1.5));  // float32
+}
+
+TEST(MsgPackTest, DatesUseTheTimestampExtension) {
+  EXPECT_EQ(Hex(EncodeMsgPack(Date{1705329005})), "d6ff65a5416d");            // timestamp 32
+  EXPECT_EQ(Hex(EncodeMsgPack(Date{0.5})), "d7ff7735940000000000");           // timestamp 64
+  EXPECT_EQ(Hex(EncodeMsgPack(Date{-1})), "c70cff00000000ffffffffffffffff");  // timestamp 96
+  for (double seconds : {0.0, 1705329005.0, 1705329005.123, 1705329005.999999, -1.5,
+                         17179869184.25 /* 2^34 + 0.25: needs 96 bits */, 4102444800.0}) {
+    Value back = MustDecode(EncodeMsgPack(Date{seconds}));
+    ASSERT_NE(back.as_date(), nullptr);
+    EXPECT_EQ(back.as_date()->seconds_since_1970, seconds) << std::to_string(seconds);
+  }
+  EXPECT_EQ(MustDecode(EncodeMsgPack(Date{std::nan("")})), Value(Date{0}));
+}
+
+TEST(MsgPackTest, NestedValuesRoundTripInOrder) {
+  Value v = EveryKind();
+  Value back = MustDecode(EncodeMsgPack(v));
+  EXPECT_EQ(back, v);
+  // Equality ignores order; the encoding keeps it.
+  std::vector<std::string> keys;
+  for (const auto& [k, unused] : *back.as_dictionary()) keys.push_back(k.Description());
+  EXPECT_EQ(keys, (std::vector<std::string>{"null", "bools", "ints", "double", "data", "date",
+                                            "nested", "42"}));
+  EXPECT_EQ(EncodeMsgPack(back), EncodeMsgPack(v));
+}
+
+TEST(MsgPackTest, ManyKeysAndRepeatedKeys) {
+  Dictionary big;
+  for (int i = 0; i < 1000; ++i) big.Set("key" + std::to_string(i), i);
+  Value back = MustDecode(EncodeMsgPack(Value(big)));
+  ASSERT_TRUE(back.is_dictionary());
+  EXPECT_EQ(back.as_dictionary()->size(), 1000u);
+  EXPECT_EQ(*back.as_dictionary()->Find("key777"), Value(777));
+
+  // {"a": 1, "b": 2, "a": 3}: the first position, the last value.
+  Value repeated = MustDecode(Bytes({0x83, 0xa1, 'a', 1, 0xa1, 'b', 2, 0xa1, 'a', 3}));
+  ASSERT_TRUE(repeated.is_dictionary());
+  ASSERT_EQ(repeated.as_dictionary()->size(), 2u);
+  EXPECT_EQ(repeated.as_dictionary()->begin()->first, Value("a"));
+  EXPECT_EQ(repeated.as_dictionary()->begin()->second, Value(3));
+}
+
+// msgpack-cxx serves as an independent encoder and decoder.
+TEST(MsgPackTest, AgreesWithAnIndependentImplementation) {
+  msgpack::sbuffer buffer;
+  msgpack::packer<msgpack::sbuffer> packer(buffer);
+  packer.pack_array(7);
+  packer.pack(std::int64_t{-5000});
+  packer.pack(std::uint64_t{UINT64_MAX});
+  packer.pack(std::string("str"));
+  packer.pack(2.25);
+  packer.pack_nil();
+  packer.pack_map(2);
+  packer.pack(std::string("k"));
+  packer.pack(true);
+  packer.pack(std::int64_t{7});
+  packer.pack_array(0);
+  packer.pack(timespec{1705329005, 500000000});
+  Value expected(Array{-5000, UINT64_MAX, "str", 2.25, Value(),
+                       Dictionary{{"k", true}, {7, Array{}}}, Date{1705329005.5}});
+  EXPECT_EQ(MustDecode(std::string_view(buffer.data(), buffer.size())), expected);
+
+  // Our bytes unpack there to the same structure, and their bytes equal ours for the
+  // values whose encoding is canonical.
+  std::string ours = EncodeMsgPack(expected);
+  msgpack::object_handle handle = msgpack::unpack(ours.data(), ours.size());
+  const msgpack::object& root = handle.get();
+  ASSERT_EQ(root.type, msgpack::type::ARRAY);
+  ASSERT_EQ(root.via.array.size, 7u);
+  EXPECT_EQ(root.via.array.ptr[0].as<std::int64_t>(), -5000);
+  EXPECT_EQ(root.via.array.ptr[1].as<std::uint64_t>(), UINT64_MAX);
+  EXPECT_EQ(root.via.array.ptr[2].as<std::string>(), "str");
+  timespec when = root.via.array.ptr[6].as<timespec>();
+  EXPECT_EQ(when.tv_sec, 1705329005);
+  EXPECT_EQ(when.tv_nsec, 500000000);
+  EXPECT_EQ(ours, std::string(buffer.data(), buffer.size()));
+}
+
+TEST(MsgPackTest, EveryTruncationFails) {
+  std::string whole = EncodeMsgPack(Value(Array{EveryKind(), Date{1705329005.25}, Date{-3}}));
+  ASSERT_TRUE(std::holds_alternative<Value>(DecodeMsgPack(whole)));
+  for (std::size_t n = 0; n < whole.size(); ++n) {
+    RequestProblem problem = MustFail(std::string_view(whole).substr(0, n));
+    EXPECT_EQ(problem.code, ConnectionError::kBadMessagePack) << "prefix " << n;
+  }
+}
+
+TEST(MsgPackTest, MalformedInputsAreRejected) {
+  struct Case {
+    const char* what;
+    std::string body;
+    ConnectionError code;
+    const char* message_part;
+  } cases[] = {
+      {"empty body", "", ConnectionError::kBadMessagePack, "at byte 0"},
+      {"reserved byte", Bytes({0xc1}), ConnectionError::kBadMessagePack, "0xc1"},
+      {"reserved byte inside an array", Bytes({0x92, 0x01, 0xc1}), ConnectionError::kBadMessagePack,
+       "at byte 2"},
+      {"trailing garbage", Bytes({0xc0, 0x00}), ConnectionError::kBadMessagePack, "trailing"},
+      {"array32 claiming 4 billion elements", Bytes({0xdd, 0xff, 0xff, 0xff, 0xff, 0xc0}),
+       ConnectionError::kBadMessagePack, "4294967295 elements"},
+      {"map32 claiming 4 billion entries", Bytes({0xdf, 0xff, 0xff, 0xff, 0xff, 0xc0}),
+       ConnectionError::kBadMessagePack, "4294967295 entries"},
+      {"map16 claiming more entries than bytes allow", Bytes({0xde, 0x00, 0x02, 0x01, 0x02, 0x03}),
+       ConnectionError::kBadMessagePack, "map of 2 entries"},
+      {"array16 claiming 65535 elements", Bytes({0xdc, 0xff, 0xff, 0xc0, 0xc0}),
+       ConnectionError::kBadMessagePack, "65535 elements"},
+      {"str32 claiming 4 GiB", Bytes({0xdb, 0xff, 0xff, 0xff, 0xff, 'x'}),
+       ConnectionError::kBadMessagePack, "string of 4294967295 bytes"},
+      {"bin32 claiming 4 GiB", Bytes({0xc6, 0xff, 0xff, 0xff, 0xff, 'x'}),
+       ConnectionError::kBadMessagePack, "binary of 4294967295 bytes"},
+      {"ext32 claiming 4 GiB", Bytes({0xc9, 0xff, 0xff, 0xff, 0xff, 0xff, 'x'}),
+       ConnectionError::kBadMessagePack, "extension of 4294967295 bytes"},
+      {"fixstr longer than the body", Bytes({0xa5, 'a', 'b'}), ConnectionError::kBadMessagePack,
+       "string of 5 bytes"},
+      {"unsupported extension", Bytes({0xd4, 0x05, 0x00}), ConnectionError::kBadMessagePack,
+       "extension type 5"},
+      {"timestamp of a wrong size", Bytes({0xd5, 0xff, 0x00, 0x00}),
+       ConnectionError::kBadMessagePack, "timestamp of 2 bytes"},
+      {"timestamp64 with 10^9 nanoseconds",
+       Bytes({0xd7, 0xff, 0xee, 0x6b, 0x28, 0x00, 0x00, 0x00, 0x00, 0x00}),
+       ConnectionError::kBadMessagePack, "nanoseconds"},
+      {"truncated uint64", Bytes({0xcf, 0x01, 0x02}), ConnectionError::kBadMessagePack,
+       "uint64 needs 8 bytes, 2 left"},
+  };
+  for (const auto& c : cases) {
+    RequestProblem problem = MustFail(c.body);
+    EXPECT_EQ(problem.code, c.code) << c.what;
+    EXPECT_NE(problem.message.find(c.message_part), std::string::npos)
+        << c.what << ": " << problem.message;
+  }
+}
+
+std::string NestedArrays(int depth) {
+  std::string body(static_cast<std::size_t>(depth), static_cast<char>(0x91));
+  body.push_back(static_cast<char>(0xc0));
+  return body;
+}
+
+std::string NestedMaps(int depth) {
+  std::string body;
+  for (int i = 0; i < depth; ++i) body += Bytes({0x81, 0x00});
+  body.push_back(static_cast<char>(0xc0));
+  return body;
+}
+
+TEST(MsgPackTest, NestingIsLimitedTo64Levels) {
+  EXPECT_TRUE(MustDecode(NestedArrays(64)).is_array());
+  EXPECT_TRUE(MustDecode(NestedMaps(64)).is_dictionary());
+  for (const std::string& body :
+       {NestedArrays(65), NestedMaps(65), NestedArrays(1000), NestedArrays(100000)}) {
+    RequestProblem problem = MustFail(body);
+    EXPECT_EQ(problem.code, ConnectionError::kTooDeep) << problem.message;
+  }
+  // Depth counts map keys too: a 64-deep array used as a key one level down.
+  std::string key_too_deep = Bytes({0x81}) + NestedArrays(64) + Bytes({0xc0});
+  EXPECT_EQ(MustFail(key_too_deep).code, ConnectionError::kTooDeep);
+}
+
+TEST(MsgPackTest, NonCanonicalIntegerEncodingsDecodeToTheirValue) {
+  EXPECT_EQ(MustDecode(Bytes({0xd3, 0, 0, 0, 0, 0, 0, 0, 5})), Value(5));
+  EXPECT_EQ(MustDecode(Bytes({0xcf, 0x7f, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0xff})).kind(),
+            Value::Kind::kInt);
+  EXPECT_EQ(MustDecode(Bytes({0xcf, 0x80, 0, 0, 0, 0, 0, 0, 0})).kind(), Value::Kind::kUInt);
+  EXPECT_EQ(MustDecode(Bytes({0xd0, 0x05})), Value(5));
+}
+
+}  // namespace
+}  // namespace qn
