@@ -5,6 +5,8 @@
 #include "platform/platform.h"
 #include "tests/fakes/FakeDeviceInfo.h"
 #include "tests/fakes/FakeDispatcher.h"
+#include "tests/fakes/FakeLivoReporting.h"
+#include "tests/fakes/FakeOrientation.h"
 #include "tests/fakes/LogCapture.h"
 #include "tests/fakes/TraceRecorder.h"
 
@@ -17,6 +19,8 @@ struct SessionTestPlatform {
   std::shared_ptr<TraceRecorder> trace = std::make_shared<TraceRecorder>();
   std::shared_ptr<FakeDispatcher> dispatcher = std::make_shared<FakeDispatcher>();
   std::shared_ptr<FakeDeviceInfo> device_info = std::make_shared<FakeDeviceInfo>();
+  std::shared_ptr<FakeLivoReporting> livo = std::make_shared<FakeLivoReporting>(dispatcher);
+  std::shared_ptr<FakeOrientation> orientation = std::make_shared<FakeOrientation>();
   std::shared_ptr<Platform> platform = Make();
 
  private:
@@ -26,6 +30,8 @@ struct SessionTestPlatform {
     p->trace = trace;
     p->dispatcher = dispatcher;
     p->device_info = device_info;
+    p->livo_reporting = livo;
+    p->orientation = orientation;
     return p;
   }
 };

@@ -1,0 +1,431 @@
+// Record, creation, configuration, service types, message identifiers, start and stop.
+#include "Statistics/Service/QNReportingSession.h"
+
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <chrono>
+
+#include "tests/session/SessionTestPlatform.h"
+
+namespace qn {
+namespace {
+
+using ::testing::ElementsAre;
+using testing::FakeLivoReporting;
+using ::testing::HasSubstr;
+using ::testing::MatchesRegex;
+using testing::SessionTestPlatform;
+using namespace std::chrono_literals;
+
+class SessionTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<QNReportingSession> NewSession(std::int64_t id = 42) {
+    return QNReportingSession::initWithID(t_.platform, id, Array{Value(1234)});
+  }
+  static std::shared_ptr<const Dictionary> Payload(Dictionary d) {
+    return std::make_shared<const Dictionary>(std::move(d));
+  }
+
+  SessionTestPlatform t_;
+};
+
+TEST_F(SessionTest, CreationSetsUpTheRecord) {
+  auto session = NewSession(-7);
+  ASSERT_TRUE(session);
+  EXPECT_EQ(session->reporterID(), -7);
+  EXPECT_EQ(session->serviceType(), 65535);
+  EXPECT_EQ(session->serviceName(), "unknown");
+  EXPECT_THAT(session->processIdentifiers(), ElementsAre(Value(1234)));
+  EXPECT_FALSE(session->started());
+  EXPECT_FALSE(session->livoReportingSessionStarted());
+  EXPECT_TRUE(session->userInfo()->empty());
+  EXPECT_TRUE(session->messageTypeCounts()->empty());
+  ASSERT_TRUE(session->aggregatedPayloadData());
+  ASSERT_TRUE(session->nestedAggregatedPayloadData());
+  EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
+  EXPECT_FALSE(session->orientationCallbackID());
+  EXPECT_FALSE(session->startDate());
+  EXPECT_FALSE(session->livoReportingSession());
+  EXPECT_FALSE(session->driverSnapShot());
+  EXPECT_FALSE(session->transactionCompleteBlock());
+
+  auto queues = t_.dispatcher->CreatedQueues();
+  ASSERT_EQ(queues.size(), 1u);
+  EXPECT_EQ(queues[0].first, "com.norvel.quenta.session.livoreporting");
+  EXPECT_EQ(queues[0].second, QualityOfService::kUtility);
+  EXPECT_EQ(session->livoReportingQueue()->label(), "com.norvel.quenta.session.livoreporting");
+
+  auto lines = t_.log->Lines();
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_THAT(lines[0].text, MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*initWithID.*: "
+                                          "created reporting session for ID: -7"));
+  EXPECT_EQ(lines[0].scope, "qnrr");
+  EXPECT_EQ(lines[0].level, LogLevel::kInfo);
+  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u));
+
+  session.reset();
+  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u, 0x21042834u));
+  EXPECT_THAT(t_.log->Matching("deallocing"),
+              ElementsAre(MatchesRegex(".*: deallocing this session -7")));
+  EXPECT_TRUE(t_.trace->AllArgumentsZero());
+}
+
+TEST_F(SessionTest, CreationNeedsLogAndDispatcher) {
+  auto bare = std::make_shared<Platform>();
+  EXPECT_FALSE(QNReportingSession::initWithID(bare, 1, {}));
+  EXPECT_FALSE(QNReportingSession::initWithID(nullptr, 1, {}));
+}
+
+TEST_F(SessionTest, SetServiceTypeStoresTypeAndName) {
+  auto session = NewSession();
+  session->setServiceType(2);
+  EXPECT_EQ(session->serviceType(), 2);
+  EXPECT_EQ(session->serviceName(), "telephony");
+  session->setServiceType(12);
+  EXPECT_EQ(session->serviceName(), "apiusage");
+  session->setServiceType(13);
+  EXPECT_EQ(session->serviceType(), 13);
+  EXPECT_EQ(session->serviceName(), "telephony");
+  session->setServiceType(65535);
+  EXPECT_EQ(session->serviceName(), "unknown");
+  EXPECT_THAT(t_.log->Matching("setting service type"),
+              ElementsAre(HasSubstr(": setting service type telephony"),
+                          HasSubstr(": setting service type apiusage"),
+                          HasSubstr(": setting service type telephony"),
+                          HasSubstr(": setting service type unknown")));
+}
+
+TEST_F(SessionTest, ConfigurationAndDefaultsMergeIntoUserInfo) {
+  auto session = NewSession();
+  session->setConfiguration(Payload({{"a", 1}, {"b", 2}}));
+  auto before = session->userInfo();
+  session->updateDefaults(Payload({{"b", 3}, {"device_name", "box"}}));
+  session->setConfiguration(static_cast<const Dictionary*>(nullptr));
+  EXPECT_EQ(*session->userInfo(), (Dictionary{{"a", 1}, {"b", 3}, {"device_name", "box"}}));
+  // Earlier snapshots are not changed under their readers.
+  EXPECT_EQ(*before, (Dictionary{{"a", 1}, {"b", 2}}));
+}
+
+TEST_F(SessionTest, MessageIdentifiersCountPerPair) {
+  auto session = NewSession();
+  EXPECT_EQ(session->messageIdForCategory(5, 1), "Setup_Start_1");
+  EXPECT_EQ(session->messageIdForCategory(5, 1), "Setup_Start_2");
+  EXPECT_EQ(session->messageIdForCategory(0x10000008, 4), "DSP_Error_Error_1");
+  EXPECT_EQ(session->messageIdForCategory(0x00000005, 1), "Setup_Start_3");
+  EXPECT_EQ(session->messageIdForCategory(0xFFFFFFFF, 0xFFFF), "Undefined_Unknown_1");
+  EXPECT_EQ(*session->messageTypeCounts(),
+            (Dictionary{{"Setup_Start", 3}, {"DSP_Error_Error", 1}, {"Undefined_Unknown", 1}}));
+}
+
+TEST_F(SessionTest, StartCreatesFrameworkSessionOnItsQueue) {
+  t_.log->EnableDebug("qnrr");
+  auto session = NewSession();
+  session->setServiceType(2);
+  session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.phone"}}));
+  session->start();
+  EXPECT_TRUE(session->started());
+  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u, 0x2104282Cu));
+  EXPECT_TRUE(t_.livo->Sessions().empty());  // the start sequence has not run yet
+
+  // Configuration that reaches the session before the start sequence copies it is kept.
+  session->setConfiguration(Payload({{"late", true}}));
+  t_.dispatcher->RunUntilIdle();
+
+  auto sessions = t_.livo->Sessions();
+  ASSERT_EQ(sessions.size(), 1u);
+  EXPECT_EQ(sessions[0].session_info,
+            (Dictionary{{kLivoReportingSessionInfoClientType, 19},
+                        {kLivoReportingSessionInfoClientVersion, 2.0},
+                        {kLivoReportingSessionInfoSessionID, 42},
+                        {kLivoReportingSessionInfoBatchEvent, true},
+                        {kLivoReportingSessionInfoHierarchyToken, 1},
+                        {kLivoReportingSessionInfoContainsRealtimeEvents, false}}));
+  EXPECT_TRUE(sessions[0].session_info.Find(kLivoReportingSessionInfoClientVersion)->kind() ==
+              Value::Kind::kDouble);
+  EXPECT_TRUE(sessions[0].session_info.Find(kLivoReportingSessionInfoBatchEvent)->is_bool());
+  EXPECT_EQ(sessions[0].user_info,
+            (Dictionary{{kLivoReportingUserInfoClientName, "com.norvel.quenta"},
+                        {kLivoReportingUserInfoServiceName, "telephony_session"},
+                        {"HostApplicationDisplayID", "org.example.phone"},
+                        {"late", true}}));
+  EXPECT_TRUE(sessions[0].frameworks_to_check.empty());
+  EXPECT_TRUE(sessions[0].configuration_started);
+  EXPECT_EQ(session->livoReportingSession() != nullptr, true);
+  ASSERT_TRUE(session->livoReportingAgentToken());
+  EXPECT_EQ(session->livoReportingAgentToken()->id, 1u);
+  EXPECT_FALSE(session->livoReportingSessionStarted());  // never set true on the record
+
+  EXPECT_EQ(t_.log->Count(": starting session owned by 42"), 1);
+  EXPECT_THAT(t_.log->Matching("List of backends"),
+              ElementsAre(MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*: List of backends "
+                                       "\\(\n    fake-backend\n\\)")));
+  // Backends answered at once: the wait saw the flag set and logged nothing.
+  EXPECT_FALSE(t_.log->Contains("waiting for livoreportingd"));
+  EXPECT_EQ(t_.dispatcher->PendingTimers(), 0);
+}
+
+TEST_F(SessionTest, ClientKeysMayReplaceFrameworkUserInfo) {
+  auto session = NewSession();
+  session->setConfiguration(Payload({{kLivoReportingUserInfoServiceName, "custom"}}));
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  ASSERT_EQ(t_.livo->Sessions().size(), 1u);
+  EXPECT_EQ(*t_.livo->Sessions()[0].user_info.Find(kLivoReportingUserInfoServiceName),
+            Value("custom"));
+}
+
+TEST_F(SessionTest, UnsetServiceTypeGivesUnknownSessionAndApiUsageFlags) {
+  auto unset = NewSession(1);
+  unset->start();
+  auto api = NewSession(2);
+  api->setServiceType(12);
+  api->start();
+  t_.dispatcher->RunUntilIdle();
+  auto sessions = t_.livo->Sessions();
+  ASSERT_EQ(sessions.size(), 2u);
+  EXPECT_EQ(*sessions[0].user_info.Find(kLivoReportingUserInfoServiceName),
+            Value("unknown_session"));
+  EXPECT_EQ(*sessions[0].session_info.Find(kLivoReportingSessionInfoBatchEvent), Value(true));
+  EXPECT_EQ(*sessions[0].session_info.Find(kLivoReportingSessionInfoContainsRealtimeEvents),
+            Value(false));
+  EXPECT_EQ(*sessions[1].user_info.Find(kLivoReportingUserInfoServiceName),
+            Value("apiusage_session"));
+  EXPECT_EQ(*sessions[1].session_info.Find(kLivoReportingSessionInfoBatchEvent), Value(false));
+  EXPECT_EQ(*sessions[1].session_info.Find(kLivoReportingSessionInfoContainsRealtimeEvents),
+            Value(true));
+  EXPECT_EQ(*sessions[1].session_info.Find(kLivoReportingSessionInfoSessionID), Value(2));
+}
+
+TEST_F(SessionTest, TestServiceTypeNeverGetsAFrameworkSession) {
+  auto session = NewSession();
+  session->setServiceType(11);
+  session->start();
+  session->sendMessage(Payload({{"k", 1}}), 1, 0, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_TRUE(t_.livo->Sessions().empty());
+  EXPECT_EQ(t_.livo->TokensMade(), 0);
+  EXPECT_TRUE(session->started());
+  // Still aggregates and summarises.
+  EXPECT_EQ(session->aggregatedPayloadData()->Snapshot().size(), 1u);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_EQ(t_.log->Count(": sending summary event for reporter 42"), 1);
+  EXPECT_EQ(t_.log->Count("transactions aren't allowed on this platform"), 2);
+  EXPECT_TRUE(t_.livo->Sessions().empty());
+  EXPECT_TRUE(t_.livo->SingleMessages().empty());
+}
+
+TEST_F(SessionTest, BackendsNeverFoundHoldsDeliveriesThenDropsThem) {
+  t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kNever);
+  auto session = NewSession();
+  session->start();
+  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
+  session->sendMessage(Payload({{"n", 2}}), 3, 2, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_THAT(t_.log->Matching("waiting for livoreportingd"),
+              ElementsAre(MatchesRegex("QNReportingUtility\\.cpp:[0-9]+:QNReportingUtilityWait: "
+                                       "waiting for livoreportingd to find backends")));
+  EXPECT_TRUE(session->livoReportingSession());  // pending
+
+  t_.dispatcher->AdvanceBy(8999ms);
+  EXPECT_FALSE(t_.log->Contains("No valid LivoReportingSession"));
+  EXPECT_FALSE(t_.log->Contains("failed to find backend"));
+
+  t_.dispatcher->AdvanceBy(1ms);
+  auto failed = t_.log->Matching("failed to find backend");
+  ASSERT_EQ(failed.size(), 1u);
+  auto nosession = t_.log->Matching("No valid LivoReportingSession");
+  EXPECT_THAT(nosession, ElementsAre(MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*: No valid "
+                                                  "LivoReportingSession"),
+                                     HasSubstr("No valid LivoReportingSession")));
+  for (const auto& line : t_.log->Lines()) {
+    if (line.text.find("No valid") != std::string::npos) {
+      EXPECT_EQ(line.level, LogLevel::kError);
+    }
+  }
+  EXPECT_FALSE(session->livoReportingSession());
+  EXPECT_FALSE(session->livoReportingSessionStarted());
+  EXPECT_TRUE(session->started());
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+
+  // A framework answer that comes after the time-out changes nothing.
+  EXPECT_EQ(t_.livo->AnswerPending(Array{Value("late")}), 1);
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_FALSE(session->livoReportingSession());
+}
+
+TEST_F(SessionTest, NoBackendsLogsAndTimesOut) {
+  t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kNoBackends);
+  auto session = NewSession();
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_THAT(t_.log->Matching("No backends"),
+              ElementsAre(MatchesRegex(".*: No backends found, this session won't get sent "
+                                       "to the server")));
+  EXPECT_TRUE(t_.log->Contains("waiting for livoreportingd to find backends"));
+  t_.dispatcher->AdvanceBy(9s);
+  EXPECT_TRUE(t_.log->Contains("failed to find backend"));
+  EXPECT_FALSE(session->livoReportingSession());
+}
+
+TEST_F(SessionTest, LateBackendsReleaseQueuedDeliveries) {
+  t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kLate, 2s);
+  auto session = NewSession();
+  session->start();
+  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
+  t_.dispatcher->AdvanceBy(1999ms);
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+  t_.dispatcher->AdvanceBy(1ms);
+  ASSERT_EQ(t_.livo->AllSessionMessages().size(), 1u);
+  EXPECT_EQ(t_.log->Count(": continuing"), 1);
+  EXPECT_TRUE(session->livoReportingSession());
+  // Later deliveries do not wait any more.
+  session->sendMessage(Payload({{"n", 2}}), 3, 1, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_EQ(t_.livo->AllSessionMessages().size(), 2u);
+  t_.dispatcher->AdvanceBy(20s);
+  EXPECT_FALSE(t_.log->Contains("failed to find backend"));
+}
+
+TEST_F(SessionTest, SpuriousWakeRestartsTheWait) {
+  t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kNever);
+  auto session = NewSession();
+  session->start();
+  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
+  t_.dispatcher->AdvanceBy(5s);
+  t_.dispatcher->WakeAllConditions();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_EQ(t_.log->Count(": continuing"), 1);
+  EXPECT_EQ(t_.log->Count("waiting for livoreportingd to find backends"), 2);
+  t_.dispatcher->AdvanceBy(8999ms);  // 13.999 s after the start
+  EXPECT_FALSE(t_.log->Contains("No valid LivoReportingSession"));
+  t_.dispatcher->AdvanceBy(1ms);
+  EXPECT_EQ(t_.log->Count("No valid LivoReportingSession"), 1);
+}
+
+TEST_F(SessionTest, StartTwiceIsRefused) {
+  auto session = NewSession();
+  session->start();
+  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
+  auto aggregated = session->aggregatedPayloadData();
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_THAT(t_.log->Matching("already started"),
+              ElementsAre(MatchesRegex(".*: 42 is already started")));
+  EXPECT_EQ(session->aggregatedPayloadData(), aggregated);
+  EXPECT_EQ(aggregated->Snapshot().size(), 1u);
+  EXPECT_EQ(t_.livo->Sessions().size(), 1u);
+  EXPECT_EQ(t_.trace->Count(0x2104282C), 1);
+}
+
+TEST_F(SessionTest, StopFlushesDropsAndClears) {
+  t_.log->EnableDebug("qnrr");
+  auto session = NewSession();
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  session->stop();
+  EXPECT_FALSE(session->started());
+  EXPECT_FALSE(session->aggregatedPayloadData());
+  EXPECT_FALSE(session->nestedAggregatedPayloadData());
+  EXPECT_TRUE(session->livoReportingSession());  // dropped on the queue
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_FALSE(session->livoReportingSession());
+  ASSERT_EQ(t_.livo->Sessions().size(), 1u);
+  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
+  EXPECT_EQ(t_.trace->Count(0x21042830), 1);
+  EXPECT_EQ(t_.log->Count(": ending session 42"), 2);
+  // Nothing was aggregated: no summary event.
+  EXPECT_FALSE(t_.log->Contains("sending summary event"));
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+}
+
+TEST_F(SessionTest, FlushErrorIsLogged) {
+  t_.livo->FailFlushes(Error{"store", 5, "disk full"});
+  auto session = NewSession();
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_THAT(t_.log->Matching("flush error"),
+              ElementsAre(MatchesRegex(".*: flush error disk full")));
+}
+
+TEST_F(SessionTest, StopTwiceAndStopUnstartedDoNothingMore) {
+  t_.log->EnableDebug("qnrr");
+  auto never = NewSession(7);
+  never->stop();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_EQ(t_.log->Count(": ending session 7"), 1);
+  EXPECT_EQ(t_.trace->Count(0x21042830), 0);
+  EXPECT_TRUE(never->aggregatedPayloadData());  // untouched
+
+  auto session = NewSession();
+  session->start();
+  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_EQ(t_.log->Count(": ending session 42"), 3);
+  EXPECT_EQ(t_.trace->Count(0x21042830), 1);
+  EXPECT_EQ(t_.log->Count("sending summary event"), 1);
+  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
+}
+
+TEST_F(SessionTest, RestartBeginsAFreshPeriodAndCountsContinue) {
+  auto session = NewSession();
+  session->start();
+  session->sendMessage(Payload({{"n", 1}}), 5, 1, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  session->stop();
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  ASSERT_TRUE(session->aggregatedPayloadData());
+  EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
+  EXPECT_TRUE(session->nestedAggregatedPayloadData()->Snapshot().empty());
+  session->sendMessage(Payload({{"n", 2}}), 5, 1, nullptr);
+  auto nested = session->nestedAggregatedPayloadData()->Snapshot();
+  ASSERT_EQ(nested.size(), 1u);
+  EXPECT_TRUE(nested[0].as_dictionary()->Contains("Setup_Start_2"));
+  EXPECT_EQ(t_.livo->Sessions().size(), 2u);
+  EXPECT_EQ(t_.livo->TokensMade(), 2);
+  EXPECT_EQ(*t_.livo->Sessions()[1].session_info.Find(kLivoReportingSessionInfoHierarchyToken),
+            Value(2));
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_EQ(t_.livo->Sessions()[1].messages.size(), 1u);
+}
+
+TEST_F(SessionTest, HeldPropertiesAreOnlyHeld) {
+  auto session = NewSession();
+  std::vector<bool> calls;
+  session->setTransactionCompleteBlock([&calls](bool ok) { calls.push_back(ok); });
+  session->setDriverSnapShot(std::make_shared<const Dictionary>(Dictionary{{"Speaker-(null)", 1}}));
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_TRUE(calls.empty());
+  ASSERT_TRUE(session->transactionCompleteBlock());
+  session->transactionCompleteBlock()(true);
+  EXPECT_THAT(calls, ElementsAre(true));
+  session->setTransactionCompleteBlock(nullptr);
+  EXPECT_FALSE(session->transactionCompleteBlock());
+  ASSERT_TRUE(session->driverSnapShot());
+  EXPECT_TRUE(session->driverSnapShot()->Contains("Speaker-(null)"));
+}
+
+TEST_F(SessionTest, QueuedWorkKeepsTheSessionAlive) {
+  t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kNever);
+  auto session = NewSession();
+  session->start();
+  session.reset();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_FALSE(t_.log->Contains("deallocing"));
+  t_.dispatcher->AdvanceBy(9s);
+  EXPECT_TRUE(t_.log->Contains("deallocing this session 42"));
+}
+
+}  // namespace
+}  // namespace qn
