@@ -1,0 +1,154 @@
+#pragma once
+
+#include <cstddef>
+#include <cstdint>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+
+#include "common/Error.h"
+#include "common/Value.h"
+#include "platform/log.h"
+
+namespace qn {
+
+class ReportingStoreWriter;
+
+// The embedded reporting store: an SQLite database (WAL journal) that keeps what the
+// framework sinks are handed (framework sessions and their messages, single messages,
+// analytics events, power-log events). Its schema is documented in
+// reporting_store_reader.h.
+//
+// Threads: one writer thread of the store owns the database connection. Every Add* call
+// only hands a record over through an in-memory queue and returns at once; it never
+// waits for a disk. The writer takes everything queued, writes it in one transaction with
+// prepared statements and commits. What a row holds is fixed at hand-over (values are
+// immutable); only an analytics payload is produced later, by its provider, when the row
+// is written. All methods are safe to call from any thread.
+//
+// Durability: the journal runs with synchronous=NORMAL. A commit reaches the operating
+// system before Drain returns, so it survives the process ending in any way (exit, _exit,
+// a signal, a crash); on power loss or a kernel crash the last commits before the loss
+// may be missing, but the database stays consistent.
+//
+// Failures: a failed write (disk full, read-only file, database locked beyond the busy
+// timeout) is logged at error level with SQLite's message and the number of records lost;
+// that batch is dropped and later batches try again. When the queue holds
+// Options::max_queued_records records, further records are dropped and counted (logged
+// by the writer), so a dead disk cannot eat memory.
+class ReportingStore {
+ public:
+  struct Options {
+    // Records beyond this many waiting in the queue are dropped (and counted).
+    std::size_t max_queued_records = 1'000'000;
+    // How long a write waits for a lock held by another connection before it fails.
+    int busy_timeout_ms = 2000;
+  };
+
+  // What the store has done so far.
+  struct Stats {
+    std::uint64_t handed_over = 0;  // records accepted into the queue
+    std::uint64_t committed = 0;    // records in committed transactions
+    std::uint64_t failed = 0;       // records lost with a failed transaction
+    std::uint64_t dropped_queue_full = 0;
+    std::uint64_t batches = 0;  // transactions attempted
+  };
+
+  // Opens (creating when missing) the database at `path`, creates or checks its schema
+  // and starts the writer thread. `log` receives the store's error lines (default log
+  // scope); it may be null (no logging).
+  // On failure (the file cannot be opened or created, it is not a database, or its schema
+  // is newer than this program's) returns null and sets *error when `error` is not null.
+  static std::shared_ptr<ReportingStore> Open(const std::string& path, std::shared_ptr<Log> log,
+                                              Options options, std::optional<Error>* error);
+  static std::shared_ptr<ReportingStore> Open(const std::string& path, std::shared_ptr<Log> log,
+                                              std::optional<Error>* error) {
+    return Open(path, std::move(log), Options{}, error);
+  }
+
+  // Drains and closes (see Close).
+  ~ReportingStore();
+  ReportingStore(const ReportingStore&) = delete;
+  ReportingStore& operator=(const ReportingStore&) = delete;
+
+  // A new framework-session row id: monotonic, above every id in the database at open.
+  // The id can be used by AddSessionMessage before the session row is written.
+  std::int64_t NewSessionId();
+
+  // Each Add* hands one record over and returns true, or returns false when the record was
+  // dropped (the queue is full, or the store is closed). `time` of every row is the wall
+  // clock at hand-over.
+
+  // A livo_sessions row. `session_info` and `user_info` are written as JSON.
+  // REQUIRES: `id` came from NewSessionId and is added once.
+  bool AddSession(std::int64_t id, Value session_info, Value user_info);
+
+  // Sets the flushed time of session `id` to now. `done` (may be empty) is called once on
+  // the writer thread after the transaction holding the update ended: with nullopt when it
+  // committed, with the error when it failed. A flush is never dropped for a full queue;
+  // when the store is closed, `done` runs on a thread of its own with an error.
+  void MarkSessionFlushed(std::int64_t id, std::function<void(std::optional<Error>)> done);
+
+  // A livo_messages row of session `session` (an id from NewSessionId).
+  bool AddSessionMessage(std::int64_t session, std::uint16_t category, std::uint16_t type,
+                         Value payload);
+
+  // A livo_messages row of no session, with the message's own session and user info.
+  bool AddSingleMessage(Value session_info, Value user_info, std::uint16_t category,
+                        std::uint16_t type, Value payload);
+
+  // An analytics_events row. `provider` (may be empty: payload null) is called once, on the
+  // writer thread, when the row is written; it is not called when the record is dropped.
+  bool AddAnalyticsEvent(std::string name, std::function<Value()> provider);
+
+  // A powerlog_events row.
+  bool AddPowerLogEvent(std::int32_t subsystem, std::string name, Value payload);
+
+  // Runs `task` once on the writer thread after the transaction that follows everything
+  // handed over before it has ended (committed or failed). Never dropped for a full queue;
+  // when the store is closed, `task` runs on a thread of its own.
+  void AfterWrite(std::function<void()> task);
+
+  // Blocks until every record handed over before the call has been written (committed or
+  // failed). Returns at once when called on the writer thread (from a flush handler, a
+  // provider or a task), as waiting there could never end, and after Close.
+  void Drain();
+
+  // A function that drains this store, for shutdown paths (the daemon's exit hook, its
+  // SIGTERM handling): it holds the store weakly, so keeping it does not keep the store
+  // open, and does nothing once the store is gone. Not async-signal-safe: call it from a
+  // normal thread, never from inside a signal handler.
+  std::function<void()> DrainHook() const;
+
+  // Drains, stops the writer thread and closes the database. Later Add* calls return false.
+  // Called on the writer thread itself (the last reference dropped in a callback), it
+  // returns without waiting and the writer finishes the queue on its own.
+  void Close();
+
+  Stats stats() const;
+  const std::string& path() const { return path_; }
+
+  // Runs `sql` on the writer's connection, in queue order, inside the transaction of the
+  // batch it lands in; a failure is logged and does not fail the batch. For fault
+  // injection in tests only (PRAGMA max_page_count to simulate a full disk).
+  void ExecuteForTesting(std::string sql);
+
+  // Private to the implementation (Open makes stores).
+  ReportingStore(std::string path, std::shared_ptr<ReportingStoreWriter> writer);
+
+ private:
+  std::string path_;
+  std::shared_ptr<ReportingStoreWriter> writer_;
+};
+
+// Drains every store of this process that is still open. For exit paths that cannot
+// reach the store object. The same runs by itself at a normal process exit (std::exit or
+// a return from main), so that a store that is still open then loses nothing; _exit and
+// signals skip it, which is what DrainHook is for. Not async-signal-safe.
+void DrainAllReportingStores();
+
+// The error domain of the store's errors.
+inline constexpr const char* kReportingStoreErrorDomain = "com.norvel.quenta.reportingstore";
+
+}  // namespace qn

@@ -1,0 +1,10 @@
+# qn_linux_store: the embedded reporting store (SQLite, one writer thread) and the platform
+# sinks on top of it (LivoReporting, analytics, power log), plus its read-only reader.
+qn_library(qn_linux_store
+  LINK qn_common PkgConfig::SQLITE3 Threads::Threads
+  FILES
+    store_json.cpp
+    reporting_store.cpp
+    reporting_store_reader.cpp
+    store_sinks.cpp
+)

@@ -1,0 +1,317 @@
+#include "platform/linux/store_sinks.h"
+
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <functional>
+#include <future>
+#include <thread>
+
+#include "platform/linux/store_json.h"
+#include "tests/fakes/FakeAnalytics.h"
+#include "tests/fakes/FakeEnerdex.h"
+#include "tests/fakes/LogCapture.h"
+#include "tests/store/store_test_util.h"
+
+namespace qn {
+namespace {
+
+using testing::LogCapture;
+using testing::ParseJson;
+using testing::ReadRows;
+using testing::TempDir;
+using Table = ReportingStoreRow::Table;
+
+std::shared_ptr<ReportingStore> OpenStore(const std::string& path) {
+  std::optional<Error> error;
+  auto store = ReportingStore::Open(path, std::make_shared<LogCapture>(), &error);
+  EXPECT_TRUE(store) << (error ? error->Description() : "");
+  return store;
+}
+
+// ---- Analytics and power log: one contract, run on the store sinks and on the fakes ----
+
+// What an event sink recorded, as (name, payload JSON) or (subsystem, name, payload JSON).
+struct RecordedEvent {
+  std::int64_t subsystem = 0;
+  std::string name;
+  std::string payload;
+  bool operator==(const RecordedEvent&) const = default;
+};
+
+void PrintTo(const RecordedEvent& e, std::ostream* os) {
+  *os << "{" << e.subsystem << ", " << e.name << ", " << e.payload << "}";
+}
+
+class EventSinkHarness {
+ public:
+  virtual ~EventSinkHarness() = default;
+  virtual qn::Analytics& analytics() = 0;
+  virtual qn::Enerdex& enerdex() = 0;
+  virtual std::vector<RecordedEvent> RecordedAnalytics() = 0;
+  virtual std::vector<RecordedEvent> RecordedPowerLog() = 0;
+};
+
+class StoreHarness final : public EventSinkHarness {
+ public:
+  StoreHarness()
+      : store_(OpenStore(dir_.File("reports.db"))),
+        analytics_(NewStoreAnalytics(store_)),
+        enerdex_(NewStoreEnerdex(store_)) {}
+  qn::Analytics& analytics() override { return *analytics_; }
+  qn::Enerdex& enerdex() override { return *enerdex_; }
+  std::vector<RecordedEvent> RecordedAnalytics() override {
+    return Rows(ReportingSink::kAnalytics);
+  }
+  std::vector<RecordedEvent> RecordedPowerLog() override { return Rows(ReportingSink::kPowerLog); }
+
+ private:
+  std::vector<RecordedEvent> Rows(ReportingSink sink) {
+    store_->Drain();
+    std::vector<RecordedEvent> events;
+    for (const auto& row : ReadRows(store_->path(), sink)) {
+      events.push_back({row.subsystem, row.name, row.payload});
+    }
+    return events;
+  }
+
+  TempDir dir_;
+  std::shared_ptr<ReportingStore> store_;
+  std::shared_ptr<qn::Analytics> analytics_;
+  std::shared_ptr<qn::Enerdex> enerdex_;
+};
+
+class FakeHarness final : public EventSinkHarness {
+ public:
+  qn::Analytics& analytics() override { return analytics_; }
+  qn::Enerdex& enerdex() override { return enerdex_; }
+  std::vector<RecordedEvent> RecordedAnalytics() override {
+    std::vector<RecordedEvent> events;
+    for (const auto& e : analytics_.Events())
+      events.push_back({0, e.name, StoreJsonText(e.payload)});
+    return events;
+  }
+  std::vector<RecordedEvent> RecordedPowerLog() override {
+    std::vector<RecordedEvent> events;
+    for (const auto& e : enerdex_.Events()) {
+      events.push_back({e.subsystem, e.name, StoreJsonText(e.payload)});
+    }
+    return events;
+  }
+
+ private:
+  testing::FakeAnalytics analytics_;
+  testing::FakeEnerdex enerdex_;
+};
+
+using HarnessFactory = std::function<std::unique_ptr<EventSinkHarness>()>;
+
+class EventSinkContractTest : public ::testing::TestWithParam<HarnessFactory> {
+ protected:
+  std::unique_ptr<EventSinkHarness> sinks_ = GetParam()();
+};
+
+TEST_P(EventSinkContractTest, AnalyticsRecordsEachEventWithItsProvidersPayloadOnce) {
+  std::atomic<int> calls{0};
+  {
+    // The payload lives only in the provider, as the analytics bridge hands it over.
+    Value payload(Dictionary{{"HostApplicationDisplayID", "Unknown"}, {"volume", 0.5}});
+    sinks_->analytics().SendEventLazy("com.norvel.quenta.Volume.Stop", [payload, &calls] {
+      ++calls;
+      return payload;
+    });
+  }
+  sinks_->analytics().SendEventLazy("com.norvel.quenta.qnreportingclientuptime", [&calls] {
+    ++calls;
+    return Value(Dictionary{{"uptime", 12}});
+  });
+  sinks_->analytics().SendEventLazy("empty", nullptr);
+
+  std::vector<RecordedEvent> expected = {
+      {0, "com.norvel.quenta.Volume.Stop",
+       R"({"HostApplicationDisplayID":"Unknown","volume":0.5})"},
+      {0, "com.norvel.quenta.qnreportingclientuptime", R"({"uptime":12})"},
+      {0, "empty", "null"},
+  };
+  EXPECT_EQ(sinks_->RecordedAnalytics(), expected);
+  EXPECT_EQ(calls.load(), 2);
+  EXPECT_TRUE(sinks_->RecordedPowerLog().empty());
+}
+
+TEST_P(EventSinkContractTest, PowerLogRecordsSubsystemNameAndPayloadInOrder) {
+  sinks_->enerdex().LogRegisteredEvent(
+      28, "Vistrel_Haptics",
+      Value(Dictionary{{"EngineOnDuration", 1.5}, {"ApplicationName", "Unknown"}}), Value());
+  sinks_->enerdex().LogRegisteredEvent(
+      28, "LeakedHapticsSessionInfo", Value(Dictionary{{"Haptic_Active_Hardware_Time_Seconds", 3}}),
+      Value());
+  std::vector<RecordedEvent> expected = {
+      {28, "Vistrel_Haptics", R"({"EngineOnDuration":1.5,"ApplicationName":"Unknown"})"},
+      {28, "LeakedHapticsSessionInfo", R"({"Haptic_Active_Hardware_Time_Seconds":3})"},
+  };
+  EXPECT_EQ(sinks_->RecordedPowerLog(), expected);
+  EXPECT_TRUE(sinks_->RecordedAnalytics().empty());
+}
+
+INSTANTIATE_TEST_SUITE_P(
+    Sinks, EventSinkContractTest,
+    ::testing::Values(HarnessFactory([] { return std::make_unique<StoreHarness>(); }),
+                      HarnessFactory([] { return std::make_unique<FakeHarness>(); })),
+    [](const auto& info) { return info.index == 0 ? std::string("Store") : std::string("Fake"); });
+
+TEST(StoreAnalyticsTest, ProviderRunsOffTheCallersThread) {
+  TempDir dir;
+  auto store = OpenStore(dir.File("reports.db"));
+  auto analytics = NewStoreAnalytics(store);
+  std::thread::id provider_thread;
+  analytics->SendEventLazy("e", [&] {
+    provider_thread = std::this_thread::get_id();
+    return Value();
+  });
+  store->Drain();
+  EXPECT_NE(provider_thread, std::thread::id());
+  EXPECT_NE(provider_thread, std::this_thread::get_id());
+}
+
+// ---- LivoReporting ----
+
+class StoreLivoReportingTest : public ::testing::Test {
+ protected:
+  TempDir dir_;
+  std::string db_path_ = dir_.File("reports.db");
+  std::shared_ptr<ReportingStore> store_ = OpenStore(db_path_);
+};
+
+TEST_F(StoreLivoReportingTest, SessionWithMessagesAndFlushLandsAsRowsInOrder) {
+  auto livo = NewStoreLivoReporting(store_);
+  auto token = livo->NewSecureHierarchyTokenFromParentToken(nullptr);
+  auto token2 = livo->NewSecureHierarchyTokenFromParentToken(token.get());
+  EXPECT_LT(token->id, token2->id);
+
+  Dictionary session_info{{kLivoReportingSessionInfoClientType, 19},
+                          {kLivoReportingSessionInfoClientVersion, 2.0},
+                          {kLivoReportingSessionInfoSessionID, 42},
+                          {kLivoReportingSessionInfoBatchEvent, true},
+                          {kLivoReportingSessionInfoHierarchyToken, token->id},
+                          {kLivoReportingSessionInfoContainsRealtimeEvents, false}};
+  Dictionary user_info{{kLivoReportingUserInfoClientName, "com.norvel.quenta"},
+                       {kLivoReportingUserInfoServiceName, "telephony_session"}};
+  auto session = livo->CreateSession(session_info, user_info, Array{});
+  auto other = livo->CreateSession(Dictionary{}, Dictionary{}, Array{});
+  EXPECT_EQ(session->Description(), "<LivoReportingSession 1>");
+  EXPECT_EQ(other->Description(), "<LivoReportingSession 2>");
+
+  std::promise<std::optional<Array>> backends;
+  std::thread::id backends_thread;
+  session->StartConfiguration([&](std::optional<Array> found) {
+    backends_thread = std::this_thread::get_id();
+    backends.set_value(found);
+  });
+  auto found = backends.get_future().get();
+  ASSERT_TRUE(found);
+  EXPECT_EQ(*found, (Array{Value("reports.db")}));
+  EXPECT_NE(backends_thread, std::this_thread::get_id());
+
+  std::optional<Error> error;
+  EXPECT_TRUE(session->SendMessage(5, 2, Value(Dictionary{{"first", 1}}), &error));
+  EXPECT_TRUE(other->SendMessage(9, 0, Value(Dictionary{{"other", true}}), &error));
+  EXPECT_TRUE(session->SendMessage(0xFFFF, 0xFFFF, Value(Dictionary{{"summary", "x"}}), &error));
+  EXPECT_FALSE(error);
+
+  std::promise<std::optional<double>> flushed;
+  session->FlushMessages([&](std::optional<Error> flush_error) {
+    EXPECT_FALSE(flush_error);
+    // The flush is committed before its handler runs.
+    auto rows = ReadRows(db_path_, ReportingSink::kReporting);
+    flushed.set_value(rows.empty() ? std::nullopt : rows[0].flushed);
+  });
+  EXPECT_TRUE(flushed.get_future().get());
+  store_->Drain();
+
+  auto rows = ReadRows(db_path_, ReportingSink::kReporting);
+  ASSERT_EQ(rows.size(), 5u);
+  EXPECT_EQ(rows[0].table, Table::kLivoSession);
+  EXPECT_EQ(rows[0].id, 1);
+  auto info = ParseJson(rows[0].session_info);
+  EXPECT_EQ(info["ClientType"], 19);
+  EXPECT_EQ(info["ClientVersion"], 2.0);
+  EXPECT_TRUE(info["ClientVersion"].is_number_float());
+  EXPECT_EQ(info["SessionID"], 42);
+  EXPECT_EQ(info["HierarchyToken"], token->id);
+  EXPECT_EQ(ParseJson(rows[0].user_info)["ServiceName"], "telephony_session");
+  EXPECT_EQ(rows[1].table, Table::kLivoSession);
+  EXPECT_FALSE(rows[1].flushed);
+
+  EXPECT_EQ(rows[2].session, 1);
+  EXPECT_EQ(rows[2].payload, R"({"first":1})");
+  EXPECT_EQ(rows[3].session, 2);
+  EXPECT_EQ(rows[4].session, 1);
+  EXPECT_EQ(rows[4].category, 0xFFFF);
+  EXPECT_EQ(rows[4].payload, R"({"summary":"x"})");
+}
+
+TEST_F(StoreLivoReportingTest, WithoutBackendsDiscoveryAnswersNone) {
+  auto livo = NewStoreLivoReporting(store_, StoreLivoReportingOptions{std::nullopt});
+  auto session = livo->CreateSession(Dictionary{}, Dictionary{}, Array{});
+  std::promise<std::optional<Array>> backends;
+  std::thread::id handler_thread;
+  session->StartConfiguration([&](std::optional<Array> found) {
+    handler_thread = std::this_thread::get_id();
+    backends.set_value(found);
+  });
+  EXPECT_FALSE(backends.get_future().get());
+  EXPECT_NE(handler_thread, std::this_thread::get_id());
+}
+
+TEST_F(StoreLivoReportingTest, SingleMessagesCarryTheirOwnSessionAndUserInfo) {
+  auto livo = NewStoreLivoReporting(store_);
+  Dictionary session_info{{kLivoReportingSessionInfoClientType, 19},
+                          {kLivoReportingSessionInfoClientVersion, 2.0},
+                          {kLivoReportingSessionInfoSessionID, -1}};
+  Dictionary user_info{{kLivoReportingUserInfoClientName, "com.norvel.quenta"},
+                       {kLivoReportingUserInfoServiceName, "standalone"}};
+  std::optional<Error> error;
+  EXPECT_TRUE(livo->SendOneMessage(session_info, user_info, 5, 3,
+                                   Value(Dictionary{{"some_key", 1}}), &error));
+  EXPECT_FALSE(error);
+  store_->Drain();
+  auto rows = ReadRows(db_path_);
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0].table, Table::kLivoMessage);
+  EXPECT_FALSE(rows[0].session);
+  EXPECT_EQ(rows[0].category, 5);
+  EXPECT_EQ(rows[0].type, 3);
+  EXPECT_EQ(rows[0].payload, R"({"some_key":1})");
+  EXPECT_EQ(rows[0].session_info, R"({"ClientType":19,"ClientVersion":2.0,"SessionID":-1})");
+  EXPECT_EQ(rows[0].user_info, R"({"ClientName":"com.norvel.quenta","ServiceName":"standalone"})");
+}
+
+TEST_F(StoreLivoReportingTest, ClosedStoreRefusesMessagesWithAnErrorAndStillAnswersFlushes) {
+  auto livo = NewStoreLivoReporting(store_);
+  auto session = livo->CreateSession(Dictionary{}, Dictionary{}, Array{});
+  store_->Close();
+
+  std::optional<Error> error;
+  EXPECT_FALSE(session->SendMessage(1, 1, Value(Dictionary{}), &error));
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->domain, kReportingStoreErrorDomain);
+  error.reset();
+  EXPECT_FALSE(livo->SendOneMessage(Dictionary{}, Dictionary{}, 1, 1, Value(), &error));
+  EXPECT_TRUE(error);
+  EXPECT_FALSE(session->SendMessage(1, 1, Value(), nullptr));  // no error slot: no crash
+
+  std::promise<std::optional<Error>> flushed;
+  session->FlushMessages([&](std::optional<Error> e) { flushed.set_value(e); });
+  EXPECT_TRUE(flushed.get_future().get());
+
+  std::promise<bool> answered;
+  session->StartConfiguration(
+      [&](std::optional<Array> found) { answered.set_value(found.has_value()); });
+  EXPECT_TRUE(answered.get_future().get());
+
+  auto rows = ReadRows(db_path_);
+  ASSERT_EQ(rows.size(), 1u);  // the session row handed over before the close
+}
+
+}  // namespace
+}  // namespace qn
