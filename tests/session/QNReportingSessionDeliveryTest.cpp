@@ -1,0 +1,250 @@
+// Message intake and delivery: through the framework session, as single messages, and the
+// cases where a message is dropped.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <regex>
+
+#include "Statistics/Service/QNReportingSession.h"
+#include "tests/session/SessionTestPlatform.h"
+
+namespace qn {
+namespace {
+
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::MatchesRegex;
+using testing::SessionTestPlatform;
+using namespace std::chrono_literals;
+
+class DeliveryTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<QNReportingSession> NewSession(std::int64_t id = 42) {
+    return QNReportingSession::initWithID(t_.platform, id, Array{});
+  }
+  static std::shared_ptr<const Dictionary> Payload(Dictionary d) {
+    return std::make_shared<const Dictionary>(std::move(d));
+  }
+  std::shared_ptr<QNReportingSession> StartedSession(std::uint16_t serviceType = 2) {
+    auto session = NewSession();
+    session->setServiceType(serviceType);
+    session->start();
+    t_.dispatcher->RunUntilIdle();
+    return session;
+  }
+
+  SessionTestPlatform t_;
+};
+
+TEST_F(DeliveryTest, StartedSessionDeliversConvertedPayloadWithCategoryCut) {
+  t_.log->EnableDebug("qnrr");
+  auto session = StartedSession();
+  std::vector<std::optional<Error>> replies;
+  session->sendMessage(Payload({{"two words", 1}, {7, "x"}, {"plain", Dictionary{{"in ner", 1}}}}),
+                       0x00010005, 2, [&](std::optional<Error> e) { replies.push_back(e); });
+  // The reply comes at once, before delivery, without an error.
+  ASSERT_EQ(replies.size(), 1u);
+  EXPECT_FALSE(replies[0]);
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+
+  t_.dispatcher->RunUntilIdle();
+  auto messages = t_.livo->AllSessionMessages();
+  ASSERT_EQ(messages.size(), 1u);
+  EXPECT_EQ(messages[0].category, 5);
+  EXPECT_EQ(messages[0].type, 2);
+  Dictionary expected{{"two_words", 1}, {7, "x"}, {"plain", Dictionary{{"in ner", 1}}}};
+  EXPECT_EQ(messages[0].payload, Value(expected));
+
+  EXPECT_THAT(session->aggregatedPayloadData()->Snapshot(), ElementsAre(Value(expected)));
+  EXPECT_THAT(session->nestedAggregatedPayloadData()->Snapshot(),
+              ElementsAre(Value(Dictionary{{"_Setup_Stop_1", expected}})));
+  EXPECT_EQ(t_.trace->Count(0x21042838), 1);
+  EXPECT_EQ(t_.log->Count(": sending message for session owned by 42"), 1);
+  // The success line prints the payload as the client sent it and the full category.
+  auto agent = t_.log->Matching("LivoReportingAgent");
+  ASSERT_EQ(agent.size(), 1u);
+  EXPECT_THAT(agent[0], HasSubstr(": LivoReportingAgent <FakeLivoReportingSession 0> : message "));
+  EXPECT_THAT(agent[0], HasSubstr("\"two words\" = 1;"));
+  EXPECT_THAT(agent[0], HasSubstr(" : category 65541 : type 2"));
+}
+
+TEST_F(DeliveryTest, KeysCollapsingIntoOneKeepTheLaterValue) {
+  auto session = StartedSession();
+  session->sendMessage(Payload({{"a b", 1}, {"a_b", 2}, {"c  d", 3}}), 1, 0, nullptr);
+  session->sendMessage(nullptr, 1, 0, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  auto messages = t_.livo->AllSessionMessages();
+  ASSERT_EQ(messages.size(), 2u);
+  const Dictionary* first = messages[0].payload.as_dictionary();
+  ASSERT_TRUE(first);
+  EXPECT_EQ(first->size(), 2u);
+  EXPECT_EQ(*first->Find("a_b"), Value(2));
+  EXPECT_EQ(*first->Find("c__d"), Value(3));
+  EXPECT_EQ(messages[1].payload, Value(Dictionary{}));
+}
+
+TEST_F(DeliveryTest, DeliveriesKeepSubmissionOrder) {
+  auto session = StartedSession();
+  for (int i = 0; i < 5; ++i) session->sendMessage(Payload({{"i", i}}), 1, 0, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  auto messages = t_.livo->AllSessionMessages();
+  ASSERT_EQ(messages.size(), 5u);
+  for (int i = 0; i < 5; ++i) EXPECT_EQ(*messages[i].payload.as_dictionary()->Find("i"), Value(i));
+}
+
+TEST_F(DeliveryTest, MessageBeforeStartIsCountedDiscardedAndSentSingle) {
+  t_.log->EnableDebug("qnrr");
+  auto session = NewSession();
+  session->setServiceType(7);
+  session->sendMessage(Payload({{"k v", 1}}), 0x00010005, 1, nullptr);
+  EXPECT_EQ(session->aggregatedPayloadData()->Snapshot().size(), 1u);
+  session->start();
+  EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
+  EXPECT_TRUE(session->nestedAggregatedPayloadData()->Snapshot().empty());
+  EXPECT_EQ(*session->messageTypeCounts(), (Dictionary{{"_Setup_Start", 1}}));
+  t_.dispatcher->RunUntilIdle();
+
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+  auto singles = t_.livo->SingleMessages();
+  ASSERT_EQ(singles.size(), 1u);
+  EXPECT_EQ(singles[0].session_info, (Dictionary{{kLivoReportingSessionInfoClientType, 19},
+                                                 {kLivoReportingSessionInfoClientVersion, 2.0},
+                                                 {kLivoReportingSessionInfoSessionID, -1}}));
+  EXPECT_EQ(singles[0].user_info,
+            (Dictionary{{kLivoReportingUserInfoClientName, "com.norvel.quenta"},
+                        {kLivoReportingUserInfoServiceName, "longformaudio"}}));
+  EXPECT_EQ(singles[0].category, 5);
+  EXPECT_EQ(singles[0].type, 1);
+  EXPECT_EQ(singles[0].payload, Value(Dictionary{{"k_v", 1}}));
+  EXPECT_EQ(t_.log->Count(": session not started, will send as a single message"), 1);
+  EXPECT_EQ(t_.log->Count(": sending single message after delta 0 for service 7"), 1);
+  EXPECT_EQ(t_.log->Count(": sending single message"), 2);
+  EXPECT_THAT(t_.log->Matching(": message {"),
+              ElementsAre(MatchesRegex(".*: message \\{\n    k_v = 1;\n\\} : category 65541 : "
+                                       "type 1")));
+  // The single send is a message trace point of its own.
+  EXPECT_EQ(t_.trace->Count(0x21042838), 2);
+}
+
+TEST_F(DeliveryTest, MessageAfterStopIsCountedNotAggregatedAndSentSingle) {
+  auto session = StartedSession(3);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  session->setServiceType(9);
+  session->sendMessage(Payload({{"late", 1}}), 2, 0, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_FALSE(session->aggregatedPayloadData());
+  EXPECT_EQ(*session->messageTypeCounts(), (Dictionary{{"Record_Generic", 1}}));
+  auto singles = t_.livo->SingleMessages();
+  ASSERT_EQ(singles.size(), 1u);
+  EXPECT_EQ(*singles[0].user_info.Find(kLivoReportingUserInfoServiceName),
+            Value("audiodeviceusage"));
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+}
+
+TEST_F(DeliveryTest, TestSessionSendsNothing) {
+  auto session = StartedSession(11);
+  session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
+  session->sendMessage(Payload({{"a", 2}}), 1, 0, nullptr);
+  t_.dispatcher->RunUntilIdle();
+  auto lines = t_.log->Matching("transactions aren't allowed");
+  EXPECT_THAT(lines, ElementsAre(MatchesRegex(".*: transactions aren't allowed on this platform"),
+                                 MatchesRegex(".*: transactions aren't allowed on this platform")));
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+  EXPECT_TRUE(t_.livo->SingleMessages().empty());
+}
+
+TEST_F(DeliveryTest, FrameworkRefusalStaysSilent) {
+  t_.log->EnableDebug("qnrr");
+  auto session = StartedSession();
+  t_.livo->FailSessionSends(true, Error{"livo", 3, "refused"});
+  std::vector<std::optional<Error>> replies;
+  session->sendMessage(Payload({{"a", 1}}), 1, 0,
+                       [&](std::optional<Error> e) { replies.push_back(e); });
+  t_.dispatcher->RunUntilIdle();
+  ASSERT_EQ(replies.size(), 1u);
+  EXPECT_FALSE(replies[0]);
+  EXPECT_FALSE(t_.log->Contains("refused"));
+  EXPECT_FALSE(t_.log->Contains("LivoReportingAgent"));
+  for (const auto& line : t_.log->Lines()) EXPECT_NE(line.level, LogLevel::kError) << line.text;
+}
+
+TEST_F(DeliveryTest, SingleMessageIgnoresUserInfoAndReportsFailures) {
+  std::vector<std::optional<Error>> replies;
+  auto reply = [&](std::optional<Error> e) { replies.push_back(e); };
+  auto userInfo = Payload({{"device_name", "box"}});
+
+  QNReportingSession::sendSingleMessage(t_.platform, Payload({{"x y", 1}}), 0xFFFFFFFF, 0xFFFF, 5,
+                                        userInfo, reply);
+  t_.dispatcher->RunUntilIdle();
+  auto singles = t_.livo->SingleMessages();
+  ASSERT_EQ(singles.size(), 1u);
+  EXPECT_EQ(singles[0].user_info,
+            (Dictionary{{kLivoReportingUserInfoClientName, "com.norvel.quenta"},
+                        {kLivoReportingUserInfoServiceName, "standalone"}}));
+  EXPECT_EQ(singles[0].category, 0xFFFF);
+  EXPECT_EQ(singles[0].payload, Value(Dictionary{{"x_y", 1}}));
+  ASSERT_EQ(replies.size(), 1u);
+  EXPECT_FALSE(replies[0]);
+
+  t_.livo->FailSingleSends(true, Error{"livo", 9, "no route"});
+  QNReportingSession::sendSingleMessage(t_.platform, nullptr, 1, 0, 5, nullptr, reply);
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_THAT(t_.log->Matching("sendOneMessageWithSessionInfo"),
+              ElementsAre(MatchesRegex(
+                  "QNReportingSession\\.cpp:[0-9]+:.*: sendOneMessageWithSessionInfo no route")));
+  ASSERT_EQ(replies.size(), 2u);
+  ASSERT_TRUE(replies[1]);
+  EXPECT_EQ(replies[1]->description, "no route");
+
+  t_.livo->FailSingleSends(true);
+  QNReportingSession::sendSingleMessage(t_.platform, nullptr, 1, 0, 5, nullptr, reply);
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_EQ(t_.log->Count("sendOneMessageWithSessionInfo"), 1);
+  ASSERT_EQ(replies.size(), 3u);
+  EXPECT_FALSE(replies[2]);
+}
+
+TEST_F(DeliveryTest, AlarmSingleMessagesWaitTheirRandomDelay) {
+  t_.log->EnableDebug("qnrr");
+  const std::regex delta("after delta ([0-9]+) for service 4");
+  for (int round = 0; round < 5; ++round) {
+    t_.log->Clear();
+    const std::size_t before = t_.livo->SingleMessages().size();
+    QNReportingSession::sendSingleMessage(t_.platform, Payload({{"r", round}}), 1, 0, 4, nullptr,
+                                          nullptr);
+    auto lines = t_.log->Matching("after delta");
+    ASSERT_EQ(lines.size(), 1u);
+    std::smatch m;
+    ASSERT_TRUE(std::regex_search(lines[0], m, delta)) << lines[0];
+    const int seconds = std::stoi(m[1]);
+    ASSERT_GE(seconds, 0);
+    ASSERT_LE(seconds, 59);
+    if (seconds > 0) {
+      t_.dispatcher->AdvanceBy(std::chrono::seconds(seconds) - 1ms);
+      EXPECT_EQ(t_.livo->SingleMessages().size(), before);
+      t_.dispatcher->AdvanceBy(1ms);
+    } else {
+      t_.dispatcher->RunUntilIdle();
+    }
+    EXPECT_EQ(t_.livo->SingleMessages().size(), before + 1);
+  }
+}
+
+TEST_F(DeliveryTest, DeliveryAfterStopQueuedBeforeFlush) {
+  auto session = StartedSession();
+  session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  // The message and the summary event were delivered through the framework session before
+  // the end sequence dropped it.
+  auto messages = t_.livo->Sessions()[0].messages;
+  ASSERT_EQ(messages.size(), 2u);
+  EXPECT_EQ(messages[1].category, 0xFFFF);
+  EXPECT_EQ(messages[1].type, 0xFFFF);
+  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
+}
+
+}  // namespace
+}  // namespace qn
