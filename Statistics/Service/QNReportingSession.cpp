@@ -8,7 +8,9 @@
 #include <vector>
 
 #include "Statistics/QNReportingUtility.h"
+#include "common/Files.h"
 #include "common/Format.h"
+#include "common/Json.h"
 #include "platform/log.h"
 
 namespace qn {
@@ -64,6 +66,15 @@ std::uint32_t RandomUniform(std::uint32_t upper_bound) {
   if (upper_bound < 2) return 0;
   thread_local std::mt19937 generator{std::random_device{}()};
   return std::uniform_int_distribution<std::uint32_t>(0, upper_bound - 1)(generator);
+}
+
+// The host application as one file-name component: a client-chosen name must not lead the
+// file out of the diagnostics directory, so "/" (and NUL) become "_".
+std::string FileNameComponent(std::string text) {
+  for (char& c : text) {
+    if (c == '/' || c == '\0') c = '_';
+  }
+  return text;
 }
 
 std::string PrintedOrNull(const std::shared_ptr<const Dictionary>& dictionary) {
@@ -461,7 +472,53 @@ std::shared_ptr<const Dictionary> QNReportingSession::createSummaryEventForSessi
 }
 
 void QNReportingSession::writeSummaryJson() {
-  // Written once the shared JSON and file helpers are in place.
+  if (!QNReportingIsInternalBuild(*platform_)) return;  // customer builds never write one
+  auto nested = nestedAggregatedPayloadData();
+  if (!nested) return;
+  auto info = userInfo();
+
+  // The text is fixed here, under the array's lock; the array keeps the inserted userInfo.
+  std::optional<std::string> output;
+  {
+    std::lock_guard guard(nested->lock);
+    if (nested->items.empty()) return;
+    nested->items.insert(nested->items.begin(), Value(info));
+    std::string text;
+    if (auto error = ToJson(Value(nested->items), JsonStyle::kPretty, text)) {
+      SESSION_LOG(LogLevel::kError, "%s:%d:%s: dataWithJSONObject: %@", error->Description());
+    } else {
+      output = std::move(text);
+    }
+  }
+
+  const std::string directory = platform_->diagnostic_logs_dir;
+  const Value* host = info->Find(kHostApplicationKey);
+  const Date now{
+      std::chrono::duration<double>(platform_->dispatcher->WallNow().time_since_epoch()).count()};
+  const std::string name =
+      StringWithFormat("%@-%@-%@-%@.json", FormatLocalTime(now, "yyyyMMdd-HHmmssZ"), "quenta",
+                       host ? FileNameComponent(host->Description()) : std::string("unknown"),
+                       QNReportingServiceTypeName(serviceType()));
+  std::string path = directory;
+  if (path.empty() || path.back() != '/') path += '/';
+  path += name;
+
+  // The disk work runs on the background queue, so the caller never waits on it.
+  platform_->dispatcher->AsyncGlobal(
+      QualityOfService::kBackground, Duration::zero(),
+      [log = platform_->log, scope = scope_, directory, path = std::move(path),
+       output = std::move(output)] {
+        if (auto error = CreateDirectories(directory, 0777)) {
+          QN_LOG(*log, scope.get(), LogLevel::kError,
+                 "%s:%d:%s: can't create logging directory at %@: %@", directory,
+                 error->Description());
+        }
+        if (!output) return;  // the serialiser refused: nothing to write
+        if (auto error = WriteFileAtomically(path, *output)) {
+          QN_LOG(*log, scope.get(), LogLevel::kError, "%s:%d:%s: jsonOutput writeToURL: %@",
+                 error->Description());
+        }
+      });
 }
 
 // ---------------------------------------------------------------------------------------

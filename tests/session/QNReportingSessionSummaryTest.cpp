@@ -1,0 +1,257 @@
+// The session summary event and the summary file written at stop.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+#include "Statistics/Service/QNReportingSession.h"
+#include "common/Json.h"
+#include "tests/session/SessionTestPlatform.h"
+
+namespace qn {
+namespace {
+
+namespace fs = std::filesystem;
+using ::testing::ElementsAre;
+using ::testing::HasSubstr;
+using ::testing::MatchesRegex;
+using testing::SessionTestPlatform;
+
+class SummaryTest : public ::testing::Test {
+ protected:
+  void SetUp() override {
+    std::string pattern = (fs::temp_directory_path() / "qn-summary-XXXXXX").string();
+    ASSERT_TRUE(mkdtemp(pattern.data()));
+    tmp_ = pattern;
+    t_.platform->diagnostic_logs_dir = (tmp_ / "DiagnosticLogs/Audio/Reporting").string();
+  }
+  void TearDown() override {
+    std::error_code ec;
+    fs::permissions(tmp_, fs::perms::owner_all, fs::perm_options::add, ec);
+    fs::remove_all(tmp_, ec);
+  }
+
+  std::shared_ptr<QNReportingSession> NewSession(std::uint16_t serviceType) {
+    auto session = QNReportingSession::initWithID(t_.platform, 42, Array{});
+    session->setServiceType(serviceType);
+    return session;
+  }
+  static std::shared_ptr<const Dictionary> Payload(Dictionary d) {
+    return std::make_shared<const Dictionary>(std::move(d));
+  }
+  void SetInternal(bool internal) { t_.device_info->SetAnswer("InternalBuild", internal); }
+  std::vector<fs::path> SummaryFiles() const {
+    std::vector<fs::path> files;
+    std::error_code ec;
+    for (const auto& e : fs::directory_iterator(t_.platform->diagnostic_logs_dir, ec)) {
+      files.push_back(e.path());
+    }
+    return files;
+  }
+  static std::string Read(const fs::path& p) {
+    std::ifstream in(p);
+    std::stringstream ss;
+    ss << in.rdbuf();
+    return ss.str();
+  }
+
+  SessionTestPlatform t_;
+  fs::path tmp_;
+};
+
+TEST_F(SummaryTest, SummaryJoinsValuesPerKeyInPayloadOrder) {
+  auto session = NewSession(3);
+  session->start();
+  session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
+  session->sendMessage(Payload({{"a", 2}, {"b", "x"}}), 1, 0, nullptr);
+  auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary);
+  EXPECT_EQ(*summary, (Dictionary{{"QN_Session_Summary_Event", "3"}, {"a", "1,2"}, {"b", "x"}}));
+  std::vector<std::string> keys;
+  for (const auto& [k, v] : *summary) keys.push_back(k.Description());
+  EXPECT_THAT(keys, ElementsAre("QN_Session_Summary_Event", "a", "b"));
+  // Reading changes nothing.
+  EXPECT_EQ(session->aggregatedPayloadData()->Snapshot().size(), 2u);
+}
+
+TEST_F(SummaryTest, ValuesAreNeitherSummedNorDeduplicated) {
+  auto session = NewSession(65535);
+  session->start();
+  session->sendMessage(Payload({{"k", 1}, {"QN_Session_Summary_Event", "mine"}}), 1, 0, nullptr);
+  session->sendMessage(Payload({{"k", 1}, {"n", Array{Value(1), Value("two")}}}), 1, 0, nullptr);
+  session->sendMessage(Payload({{"k", 2}, {5, 2.5}}), 1, 0, nullptr);
+  auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary);
+  EXPECT_EQ(*summary->Find("QN_Session_Summary_Event"), Value("65535,mine"));
+  EXPECT_EQ(*summary->Find("k"), Value("1,1,2"));
+  EXPECT_EQ(*summary->Find("n"), Value(Value(Array{Value(1), Value("two")}).Description()));
+  EXPECT_EQ(*summary->Find(Value(5)), Value("2.5"));
+}
+
+TEST_F(SummaryTest, NothingAggregatedMeansNoSummary) {
+  auto session = NewSession(3);
+  session->start();
+  EXPECT_FALSE(session->createSummaryEventForSession());
+  session->stop();
+  EXPECT_FALSE(session->createSummaryEventForSession());  // arrays gone
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_FALSE(t_.log->Contains("sending summary event"));
+  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
+}
+
+TEST_F(SummaryTest, StopSendsSummaryThroughTheSessionAndCountsIt) {
+  auto session = NewSession(3);
+  session->start();
+  session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  auto lines = t_.log->Lines();
+  auto it = std::find_if(lines.begin(), lines.end(), [](const auto& l) {
+    return l.text.find("sending summary event") != std::string::npos;
+  });
+  ASSERT_NE(it, lines.end());
+  EXPECT_THAT(it->text, MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*stop.*: sending summary "
+                                     "event for reporter 42"));
+  EXPECT_EQ(it->level, LogLevel::kDefault);
+  auto messages = t_.livo->AllSessionMessages();
+  ASSERT_EQ(messages.size(), 2u);
+  EXPECT_EQ(messages[1].category, 0xFFFF);
+  EXPECT_EQ(messages[1].type, 0xFFFF);
+  EXPECT_EQ(messages[1].payload, Value(Dictionary{{"QN_Session_Summary_Event", "3"}, {"a", "1"}}));
+  EXPECT_EQ(*session->messageTypeCounts()->Find("Undefined_Unknown"), Value(1));
+}
+
+TEST_F(SummaryTest, InternalBuildWritesPrettyJsonWithUserInfoFirst) {
+  SetInternal(true);
+  auto session = NewSession(0);
+  session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.app"}}));
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  session->sendMessage(Payload({{"a b", 1}}), 5, 1, nullptr);
+  session->stop();
+  // The disk work has not run yet: the caller does not wait for it.
+  EXPECT_TRUE(SummaryFiles().empty());
+  t_.dispatcher->RunUntilIdle();
+
+  auto files = SummaryFiles();
+  ASSERT_EQ(files.size(), 1u);
+  EXPECT_THAT(
+      files[0].filename().string(),
+      MatchesRegex("[0-9]{8}-[0-9]{6}[-+][0-9]{4}-quenta-org\\.example\\.app-generic\\.json"));
+  Value expected(
+      Array{Value(Dictionary{{"HostApplicationDisplayID", "org.example.app"}}),
+            Value(Dictionary{{"Setup_Start_1", Dictionary{{"a_b", 1}}}}),
+            Value(Dictionary{{"Undefined_Unknown_1",
+                              Dictionary{{"QN_Session_Summary_Event", "0"}, {"a_b", "1"}}}})});
+  std::string expected_text;
+  ASSERT_FALSE(ToJson(expected, JsonStyle::kPretty, expected_text));
+  EXPECT_EQ(Read(files[0]), expected_text);
+  EXPECT_THAT(expected_text, HasSubstr("\n"));
+
+  struct stat st {};
+  ASSERT_EQ(stat(t_.platform->diagnostic_logs_dir.c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0777u);
+  ASSERT_EQ(stat((tmp_ / "DiagnosticLogs").c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0777u);
+  for (const auto& l : t_.log->Lines()) EXPECT_NE(l.level, LogLevel::kError) << l.text;
+}
+
+TEST_F(SummaryTest, CustomerBuildWritesNothing) {
+  SetInternal(false);
+  auto session = NewSession(2);
+  session->start();
+  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_FALSE(fs::exists(tmp_ / "DiagnosticLogs"));
+  EXPECT_EQ(t_.livo->AllSessionMessages().size(), 2u);  // the summary event still went out
+}
+
+TEST_F(SummaryTest, MissingHostAppNamesTheFileUnknown) {
+  SetInternal(true);
+  auto session = NewSession(13);
+  session->start();
+  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  auto files = SummaryFiles();
+  ASSERT_EQ(files.size(), 1u);
+  EXPECT_THAT(files[0].filename().string(), MatchesRegex(".*-quenta-unknown-telephony\\.json"));
+  Value content;
+  ASSERT_FALSE(ParseJson(Read(files[0]), content));
+  ASSERT_TRUE(content.as_array());
+  EXPECT_EQ(content.as_array()->front(), Value(Dictionary{}));
+}
+
+TEST_F(SummaryTest, HostAppCannotLeadOutOfTheDirectory) {
+  SetInternal(true);
+  auto session = NewSession(0);
+  session->setConfiguration(Payload({{"HostApplicationDisplayID", "../../escape"}}));
+  session->start();
+  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  auto files = SummaryFiles();
+  ASSERT_EQ(files.size(), 1u);
+  EXPECT_THAT(files[0].filename().string(),
+              MatchesRegex(".*-quenta-\\.\\._\\.\\._escape-generic\\.json"));
+}
+
+TEST_F(SummaryTest, BlockedDirectoryIsLoggedAndStopGoesOn) {
+  SetInternal(true);
+  { std::ofstream(tmp_ / "blocked") << "x"; }
+  const std::string dir = (tmp_ / "blocked" / "Reporting").string();
+  t_.platform->diagnostic_logs_dir = dir;
+  auto session = NewSession(0);
+  session->start();
+  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  auto dirLines = t_.log->Matching("can't create logging directory");
+  ASSERT_EQ(dirLines.size(), 1u);
+  EXPECT_THAT(dirLines[0], MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*: can't create logging "
+                                        "directory at " +
+                                        dir + ": .+"));
+  EXPECT_EQ(t_.log->Count(": jsonOutput writeToURL: "), 1);
+  int errors = 0;
+  for (const auto& l : t_.log->Lines()) errors += l.level == LogLevel::kError;
+  EXPECT_EQ(errors, 2);
+  EXPECT_FALSE(session->started());
+  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
+}
+
+TEST_F(SummaryTest, SerialiserRefusalIsLoggedAndNothingWritten) {
+  SetInternal(true);
+  auto session = NewSession(0);
+  session->start();
+  session->sendMessage(Payload({{"blob", Data{{1, 2, 3}}}}), 5, 1, nullptr);
+  session->stop();
+  t_.dispatcher->RunUntilIdle();
+  EXPECT_THAT(t_.log->Matching("dataWithJSONObject"),
+              ElementsAre(MatchesRegex(".*: dataWithJSONObject: .+")));
+  EXPECT_TRUE(fs::is_directory(t_.platform->diagnostic_logs_dir));
+  EXPECT_TRUE(SummaryFiles().empty());
+  EXPECT_FALSE(t_.log->Contains("writeToURL"));
+}
+
+TEST_F(SummaryTest, WritingInsertsUserInfoIntoTheArray) {
+  SetInternal(true);
+  auto session = NewSession(0);
+  session->setConfiguration(Payload({{"x", 1}}));
+  session->start();
+  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
+  session->writeSummaryJson();
+  session->writeSummaryJson();
+  auto nested = session->nestedAggregatedPayloadData()->Snapshot();
+  ASSERT_EQ(nested.size(), 3u);
+  EXPECT_EQ(nested[0], Value(Dictionary{{"x", 1}}));
+  EXPECT_EQ(nested[1], Value(Dictionary{{"x", 1}}));
+  t_.dispatcher->RunUntilIdle();
+}
+
+}  // namespace
+}  // namespace qn
