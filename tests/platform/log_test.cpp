@@ -1,0 +1,184 @@
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "platform/linux/linux_log.h"
+#include "tests/platform/test_util.h"
+
+namespace qn {
+namespace {
+
+// A pipe whose read end a background thread drains into a string, so writers never block.
+class PipeReader {
+ public:
+  PipeReader() {
+    if (::pipe2(fds_, O_CLOEXEC) != 0) std::abort();
+    reader_ = std::thread([this] {
+      char buf[65536];
+      ssize_t n;
+      while ((n = ::read(fds_[0], buf, sizeof buf)) > 0) text_.append(buf, n);
+    });
+  }
+  ~PipeReader() {
+    CloseWriteEnd();
+    if (reader_.joinable()) reader_.join();
+    ::close(fds_[0]);
+  }
+  int write_fd() const { return fds_[1]; }
+  // Closes the write end and returns everything written.
+  std::string Finish() {
+    CloseWriteEnd();
+    reader_.join();
+    return text_;
+  }
+
+ private:
+  void CloseWriteEnd() {
+    if (fds_[1] >= 0) ::close(fds_[1]);
+    fds_[1] = -1;
+  }
+  int fds_[2];
+  std::thread reader_;
+  std::string text_;
+};
+
+std::shared_ptr<Log> StreamLog(int fd, std::string debug_scopes = "") {
+  return NewLinuxLog({.sink = LinuxLogOptions::Sink::kStream,
+                      .fd = fd,
+                      .debug_scopes = std::move(debug_scopes),
+                      .identifier = "qnreportingd"});
+}
+
+const LogScope* Register(Log& log, const char* code) {
+  std::uint64_t n = 0;
+  for (const char* p = code; *p; ++p) n = (n << 8) | static_cast<unsigned char>(*p);
+  return log.RegisterScope(true, n, code, "com.norvel.quenta", "test", 31).get();
+}
+
+TEST(LinuxLogTest, StreamSinkWritesExactlyTheLine) {
+  PipeReader pipe;
+  auto log = StreamLog(pipe.write_fd());
+  const int line = __LINE__ + 1;
+  QN_LOG(*log, nullptr, LogLevel::kInfo, "%s:%d:%s: created reporting session for ID: %lli", 42);
+  QN_LOG_AS("QNReportingUtilityWait", *log, nullptr, LogLevel::kError, "%s:%d:%s: %@", "odd  %s");
+  const std::string expected = std::string("log_test.cpp:") + std::to_string(line) + ":" +
+                               "virtual void qn::{anonymous}::LinuxLogTest_"
+                               "StreamSinkWritesExactlyTheLine_Test::TestBody(): created "
+                               "reporting session for ID: 42\n" +
+                               "log_test.cpp:" + std::to_string(line + 1) +
+                               ":QNReportingUtilityWait: odd  %s\n";
+  EXPECT_EQ(pipe.Finish(), expected);
+}
+
+TEST(LinuxLogTest, DebugLinesOnlyForEnabledScopes) {
+  PipeReader pipe;
+  auto log = StreamLog(pipe.write_fd(), "qnrr, qnrd");
+  const LogScope* session = Register(*log, "qnrr");
+  const LogScope* server = Register(*log, "qnrs");
+  EXPECT_TRUE(log->LogEnabled(session, 5));
+  EXPECT_FALSE(log->LogEnabled(server, 5));
+  EXPECT_FALSE(log->LogEnabled(nullptr, 5));
+  for (int level = 0; level < 5; ++level) EXPECT_TRUE(log->LogEnabled(server, level));
+
+  QN_LOG_AS("f", *log, session, LogLevel::kDebug, "%s:%d:%s: session debug");
+  QN_LOG_AS("f", *log, server, LogLevel::kDebug, "%s:%d:%s: server debug");
+  QN_LOG_AS("f", *log, nullptr, LogLevel::kDebug, "%s:%d:%s: default debug");
+  QN_LOG_AS("f", *log, server, LogLevel::kDefault, "%s:%d:%s: server default");
+  const std::string text = pipe.Finish();
+  EXPECT_NE(text.find("session debug"), std::string::npos);
+  EXPECT_EQ(text.find("server debug"), std::string::npos);
+  EXPECT_EQ(text.find("default debug"), std::string::npos);
+  EXPECT_NE(text.find("server default"), std::string::npos);
+}
+
+TEST(LinuxLogTest, AllEnablesDebugEverywhere) {
+  auto log = StreamLog(-1, "all");
+  EXPECT_TRUE(log->LogEnabled(Register(*log, "qnrs"), 5));
+  EXPECT_TRUE(log->LogEnabled(nullptr, 5));
+  EXPECT_FALSE(StreamLog(-1, "")->LogEnabled(nullptr, 5));
+}
+
+TEST(LinuxLogTest, RegisterScopeReturnsTheSameScopePerCode) {
+  auto log = StreamLog(-1);
+  auto a = log->RegisterScope(true, 0x716E7272, "qnrr", "com.norvel.quenta",
+                              "reporting_session_verbose", 31);
+  auto b = log->RegisterScope(true, 0x716E7272, "qnrr", "com.norvel.quenta",
+                              "reporting_session_verbose", 31);
+  auto c = log->RegisterScope(true, 0x716E7273, "qnrs", "com.norvel.quenta",
+                              "reporting_server_verbose", 31);
+  ASSERT_NE(a, nullptr);
+  EXPECT_EQ(a, b);
+  EXPECT_NE(a, c);
+  EXPECT_EQ(a->code_string, "qnrr");
+  EXPECT_EQ(a->category, "reporting_session_verbose");
+}
+
+TEST(LinuxLogTest, LinesFromManyThreadsNeverInterleave) {
+  PipeReader pipe;
+  auto log = StreamLog(pipe.write_fd());
+  constexpr int kThreads = 4;
+  constexpr int kLines = 200;
+  std::vector<std::thread> threads;
+  for (int t = 0; t < kThreads; ++t) {
+    threads.emplace_back([&, t] {
+      for (int i = 0; i < kLines; ++i) {
+        // Some lines are longer than a pipe's atomic write size.
+        const std::string body(i % 10 == 0 ? 20000 : 50 + i, static_cast<char>('a' + t));
+        log->Write(nullptr, LogLevel::kDefault, "f.cpp", 1, "f", body);
+      }
+    });
+  }
+  for (auto& t : threads) t.join();
+  const std::string text = pipe.Finish();
+  int lines = 0;
+  std::size_t start = 0;
+  while (start < text.size()) {
+    const std::size_t end = text.find('\n', start);
+    ASSERT_NE(end, std::string::npos);
+    const std::string_view line(text.data() + start, end - start);
+    ASSERT_FALSE(line.empty());
+    ASSERT_EQ(line.find_first_not_of(line[0]), std::string_view::npos)
+        << "two lines were mixed in one";
+    ++lines;
+    start = end + 1;
+  }
+  EXPECT_EQ(lines, kThreads * kLines);
+}
+
+TEST(LinuxLogTest, JournalStreamMatchesDeviceAndInode) {
+  testing::TempDir dir;
+  const std::string path = dir.str() + "/stream";
+  const int fd = ::open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600);
+  ASSERT_GE(fd, 0);
+  struct stat st;
+  ASSERT_EQ(fstat(fd, &st), 0);
+  const std::string match = std::to_string(st.st_dev) + ":" + std::to_string(st.st_ino);
+  const std::string other = std::to_string(st.st_dev) + ":" + std::to_string(st.st_ino + 1);
+  EXPECT_TRUE(IsJournalStream(fd, match.c_str()));
+  EXPECT_FALSE(IsJournalStream(fd, other.c_str()));
+  EXPECT_FALSE(IsJournalStream(fd, (match + "x").c_str()));
+  EXPECT_FALSE(IsJournalStream(fd, ""));
+  EXPECT_FALSE(IsJournalStream(fd, nullptr));
+  ::close(fd);
+}
+
+TEST(LinuxLogTest, JournalSinkUsesTheStreamWhenNoJournalRuns) {
+  if (::access("/run/systemd/journal/socket", F_OK) == 0) {
+    GTEST_SKIP() << "a journal runs here; its entries are not read back";
+  }
+  PipeReader pipe;
+  LinuxLogOptions options;
+  options.sink = LinuxLogOptions::Sink::kJournal;
+  options.fd = pipe.write_fd();
+  auto log = NewLinuxLog(options);
+  log->Write(nullptr, LogLevel::kError, "f.cpp", 7, "f", "f.cpp:7:f: no journal");
+  EXPECT_EQ(pipe.Finish(), "f.cpp:7:f: no journal\n");
+}
+
+}  // namespace
+}  // namespace qn
