@@ -1,0 +1,166 @@
+// Orientation reporting of telephony and long-form audio sessions on internal builds.
+#include <gmock/gmock.h>
+#include <gtest/gtest.h>
+
+#include <chrono>
+
+#include "Statistics/Service/QNReportingSession.h"
+#include "tests/session/SessionTestPlatform.h"
+
+namespace qn {
+namespace {
+
+using ::testing::ElementsAre;
+using testing::SessionTestPlatform;
+using namespace std::chrono_literals;
+
+class OrientationTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<QNReportingSession> NewSession(std::uint16_t serviceType) {
+    auto session = QNReportingSession::initWithID(t_.platform, 42, Array{});
+    session->setServiceType(serviceType);
+    return session;
+  }
+  void SetInternal(bool internal, int deviceClass = 1) {
+    t_.device_info->SetAnswer("InternalBuild", internal);
+    t_.device_info->SetAnswer("DeviceClassNumber", deviceClass);
+  }
+
+  SessionTestPlatform t_;
+};
+
+TEST_F(OrientationTest, ChangesAreFiledWithTruncatedSecondsAndUnregisteredAtStop) {
+  SetInternal(true);
+  t_.log->EnableDebug("qnrr");
+  auto session = NewSession(2);
+  session->setConfiguration(std::make_shared<const Dictionary>(
+      Dictionary{{"HostApplicationDisplayID", "org.example.phone"}}));
+  session->start();
+  EXPECT_EQ(session->orientationCallbackID(), "QNReportingService 42");
+  ASSERT_TRUE(session->startDate());
+  const auto wallStart = t_.dispatcher->WallNow();
+  EXPECT_DOUBLE_EQ(session->startDate()->seconds_since_1970,
+                   std::chrono::duration<double>(wallStart.time_since_epoch()).count());
+  EXPECT_THAT(t_.orientation->Events(), ElementsAre("register device QNReportingService 42",
+                                                    "register ui QNReportingService 42"));
+
+  t_.dispatcher->AdvanceBy(1234500us);
+  EXPECT_EQ(t_.orientation->FireDevice(3), 1);
+  t_.dispatcher->AdvanceBy(765500us);  // 2.000 s after start
+  EXPECT_EQ(t_.orientation->FireUI(1), 1);
+  t_.dispatcher->AdvanceBy(1999us);
+  t_.orientation->FireDevice(4);
+
+  EXPECT_THAT(
+      session->aggregatedPayloadData()->Snapshot(),
+      ElementsAre(Value(Dictionary{{"device_orientation", "LandscapeLeft"},
+                                   {"device_orientation_time", 1.234}}),
+                  Value(Dictionary{{"ui_orientation", "Portrait"}, {"ui_orientation_time", 2.0}}),
+                  Value(Dictionary{{"device_orientation", "LandscapeRight"},
+                                   {"device_orientation_time", 2.001}})));
+  EXPECT_THAT(
+      t_.log->Matching("Orientation handler"),
+      ElementsAre(::testing::MatchesRegex(
+                      "QNReportingSession\\.cpp:[0-9]+:.*: Orientation handler callback "
+                      "mode=device orientation=\"LandscapeLeft\" app=\"org.example.phone\", "
+                      "time=1.234, id=\"QNReportingService 42\""),
+                  ::testing::EndsWith(": Orientation handler callback mode=ui "
+                                      "orientation=\"Portrait\" app=\"org.example.phone\", "
+                                      "time=2, id=\"QNReportingService 42\""),
+                  ::testing::HasSubstr("time=2.001,")));
+
+  // The entries reach the summary under their four keys, in the order of the changes.
+  auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary);
+  EXPECT_EQ(*summary->Find("device_orientation"), Value("LandscapeLeft,LandscapeRight"));
+  EXPECT_EQ(*summary->Find("device_orientation_time"), Value("1.234,2.001"));
+  EXPECT_EQ(*summary->Find("ui_orientation"), Value("Portrait"));
+  EXPECT_EQ(*summary->Find("ui_orientation_time"), Value("2"));
+
+  session->stop();
+  EXPECT_FALSE(session->orientationCallbackID());
+  EXPECT_THAT(t_.orientation->Events(), ElementsAre("register device QNReportingService 42",
+                                                    "register ui QNReportingService 42",
+                                                    "unregister device QNReportingService 42",
+                                                    "unregister ui QNReportingService 42"));
+  EXPECT_EQ(t_.orientation->DeviceRegistrations() + t_.orientation->UIRegistrations(), 0);
+  t_.dispatcher->RunUntilIdle();
+}
+
+TEST_F(OrientationTest, MissingHostAppPrintsNull) {
+  SetInternal(true);
+  t_.log->EnableDebug("qnrr");
+  auto session = NewSession(7);
+  session->start();
+  t_.orientation->FireUI(99);
+  EXPECT_THAT(t_.log->Matching("Orientation handler"),
+              ElementsAre(::testing::HasSubstr(
+                  "mode=ui orientation=\"Unknown\" app=\"(null)\", time=-0, id=")));
+}
+
+TEST_F(OrientationTest, OnlyInternalTelephonyAndLongFormOnOtherDeviceClasses) {
+  struct Case {
+    bool internal;
+    int deviceClass;
+    std::uint16_t type;
+    bool registers;
+  };
+  const Case cases[] = {{true, 1, 2, true},  {true, 1, 7, true},  {false, 1, 2, false},
+                        {true, 6, 2, false}, {true, 1, 3, false}, {true, 1, 65535, false},
+                        {true, 0, 7, true}};
+  for (const Case& c : cases) {
+    SessionTestPlatform t;
+    t.device_info->SetAnswer("InternalBuild", c.internal);
+    t.device_info->SetAnswer("DeviceClassNumber", c.deviceClass);
+    auto session = QNReportingSession::initWithID(t.platform, 42, Array{});
+    session->setServiceType(c.type);
+    EXPECT_EQ(session->shouldReportOrientation(), c.registers);
+    session->start();
+    EXPECT_EQ(session->orientationCallbackID().has_value(), c.registers)
+        << c.internal << " " << c.deviceClass << " " << c.type;
+    EXPECT_EQ(t.orientation->Events().size(), c.registers ? 2u : 0u);
+    EXPECT_EQ(session->startDate().has_value(), c.registers);
+    session->stop();
+    t.dispatcher->RunUntilIdle();
+  }
+}
+
+TEST_F(OrientationTest, TypeChangedBeforeStopKeepsTheRegistration) {
+  SetInternal(true);
+  auto session = NewSession(2);
+  session->start();
+  session->setServiceType(3);
+  session->stop();
+  EXPECT_EQ(session->orientationCallbackID(), "QNReportingService 42");
+  EXPECT_EQ(t_.orientation->Events().size(), 2u);  // no unregistration
+  // A change after stop finds no array and adds nothing.
+  EXPECT_EQ(t_.orientation->FireDevice(1), 1);
+  EXPECT_FALSE(session->aggregatedPayloadData());
+  t_.dispatcher->RunUntilIdle();
+}
+
+TEST_F(OrientationTest, UnregistrationRunsEvenWhenNotStarted) {
+  SetInternal(true);
+  auto session = NewSession(7);
+  session->start();
+  session->setStarted(false);
+  session->stop();
+  EXPECT_FALSE(session->orientationCallbackID());
+  EXPECT_EQ(t_.orientation->Events().size(), 4u);
+  EXPECT_EQ(t_.trace->Count(0x21042830), 0);  // the rest of stop did not run
+  t_.dispatcher->RunUntilIdle();
+}
+
+TEST_F(OrientationTest, CallbacksHoldTheSessionWeakly) {
+  SetInternal(true);
+  auto session = NewSession(2);
+  session->start();
+  t_.dispatcher->RunUntilIdle();
+  session.reset();
+  EXPECT_TRUE(t_.log->Contains("deallocing this session 42"));
+  EXPECT_EQ(t_.orientation->FireDevice(1), 1);  // the stale callback does nothing
+  EXPECT_EQ(t_.orientation->FireUI(1), 1);
+}
+
+}  // namespace
+}  // namespace qn
