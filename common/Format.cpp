@@ -1,5 +1,6 @@
 #include "common/Format.h"
 
+#include <cmath>
 #include <cstdio>
 
 namespace qn {
@@ -10,7 +11,8 @@ std::string Printf(const std::string& spec, auto value) {
   char buf[128];
   int n = std::snprintf(buf, sizeof buf, spec.c_str(), value);
   if (n < 0) return {};
-  if (static_cast<std::size_t>(n) < sizeof buf) return std::string(buf, static_cast<std::size_t>(n));
+  if (static_cast<std::size_t>(n) < sizeof buf)
+    return std::string(buf, static_cast<std::size_t>(n));
   std::string big(static_cast<std::size_t>(n) + 1, '\0');
   std::snprintf(big.data(), big.size(), spec.c_str(), value);
   big.resize(static_cast<std::size_t>(n));
@@ -30,7 +32,13 @@ std::string AsText(const FormatArg::Storage& s) {
 std::int64_t AsSigned(const FormatArg::Storage& s) {
   if (auto i = std::get_if<std::int64_t>(&s)) return *i;
   if (auto u = std::get_if<std::uint64_t>(&s)) return static_cast<std::int64_t>(*u);
-  if (auto d = std::get_if<double>(&s)) return static_cast<std::int64_t>(*d);
+  if (auto d = std::get_if<double>(&s)) {
+    // Saturate instead of the undefined conversion of NaN or out-of-range doubles.
+    if (std::isnan(*d)) return 0;
+    if (*d >= 9223372036854775808.0) return INT64_MAX;
+    if (*d < -9223372036854775808.0) return INT64_MIN;
+    return static_cast<std::int64_t>(*d);
+  }
   return 0;
 }
 
@@ -56,21 +64,28 @@ std::string StringWithFormatArgs(std::string_view format, const std::vector<Form
     // Collect flags, width, precision and length; then the conversion character.
     std::size_t j = i + 1;
     std::string flags;
-    while (j < format.size() && std::string_view("-+ #0123456789.").find(format[j]) !=
-                                    std::string_view::npos) {
+    while (j < format.size() &&
+           std::string_view("-+ #0123456789.").find(format[j]) != std::string_view::npos) {
       flags += format[j++];
     }
-    while (j < format.size() && std::string_view("hlqLjzt").find(format[j]) != std::string_view::npos) {
+    while (j < format.size() &&
+           std::string_view("hlqLjzt").find(format[j]) != std::string_view::npos) {
       ++j;  // length modifiers: all integers are formatted as 64-bit
     }
     if (j >= format.size()) {
       out.append(format.substr(i));
       break;
     }
-    char conv = format[j];
+    const char conv = format[j];
+    const std::size_t start = i;
     i = j;
     if (conv == '%') {
       out += '%';
+      continue;
+    }
+    if (std::string_view("@sdiuxXofFgGeEc").find(conv) == std::string_view::npos) {
+      // Unknown conversion: keep the text as written, consume no argument.
+      out.append(format.substr(start, j - start + 1));
       continue;
     }
     if (next >= args.size()) {
@@ -91,8 +106,7 @@ std::string StringWithFormatArgs(std::string_view format, const std::vector<Form
       case 'x':
       case 'X':
       case 'o':
-        out += Printf("%" + flags + "ll" + conv,
-                      static_cast<unsigned long long>(AsSigned(arg)));
+        out += Printf("%" + flags + "ll" + conv, static_cast<unsigned long long>(AsSigned(arg)));
         break;
       case 'f':
       case 'F':
@@ -102,14 +116,9 @@ std::string StringWithFormatArgs(std::string_view format, const std::vector<Form
       case 'E':
         out += Printf("%" + flags + conv, AsDouble(arg));
         break;
-      case 'c':
+      default:  // 'c'
         out += static_cast<char>(AsSigned(arg));
         break;
-      default:  // unknown conversion: keep the text as written
-        out += '%';
-        out += flags;
-        out += conv;
-        --next;
     }
   }
   return out;

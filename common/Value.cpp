@@ -159,12 +159,18 @@ void Value::Describe(std::string& out, int indent, bool nested) const {
       break;
     }
     case Kind::kDate: {
-      std::time_t t = static_cast<std::time_t>(std::floor(as_date()->seconds_since_1970));
+      // A date without a calendar form (NaN, infinite, far beyond any year) prints its seconds.
+      const double seconds = as_date()->seconds_since_1970;
       std::tm tm{};
-      gmtime_r(&t, &tm);
-      char buf[40];
-      std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm);
-      out += buf;
+      char buf[64];
+      if (std::isfinite(seconds) && std::fabs(seconds) < 1e14) {
+        std::time_t t = static_cast<std::time_t>(std::floor(seconds));
+        if (gmtime_r(&t, &tm) && std::strftime(buf, sizeof buf, "%Y-%m-%d %H:%M:%S +0000", &tm)) {
+          out += buf;
+          break;
+        }
+      }
+      AppendDouble(out, seconds);
       break;
     }
     case Kind::kArray: {
@@ -201,19 +207,50 @@ std::string Value::Description() const {
   return out;
 }
 
+namespace {
+
+constexpr double kTwoTo63 = 9223372036854775808.0;
+constexpr double kTwoTo64 = 18446744073709551616.0;
+
+// Exact comparisons of an integer with a double: equal only when the double is integral
+// and has exactly that value (no rounding of the integer to double).
+bool EqualsDouble(std::int64_t i, double d) {
+  return d >= -kTwoTo63 && d < kTwoTo63 && d == std::trunc(d) && static_cast<std::int64_t>(d) == i;
+}
+bool EqualsDouble(std::uint64_t u, double d) {
+  return d >= 0 && d < kTwoTo64 && d == std::trunc(d) && static_cast<std::uint64_t>(d) == u;
+}
+
+}  // namespace
+
 bool Value::operator==(const Value& other) const {
   if (is_number() && other.is_number()) {
-    if (kind() == Kind::kDouble || other.kind() == Kind::kDouble) {
-      return *as_double() == *other.as_double();
+    const Value& a = kind() == Kind::kDouble ? other : *this;  // a double is b's, if any
+    const Value& b = kind() == Kind::kDouble ? *this : other;
+    if (b.kind() != Kind::kDouble) return v_ == other.v_;  // int64 and uint64 never overlap
+    const double d = std::get<double>(b.v_);
+    switch (a.kind()) {
+      case Kind::kInt:
+        return EqualsDouble(std::get<std::int64_t>(a.v_), d);
+      case Kind::kUInt:
+        return EqualsDouble(std::get<std::uint64_t>(a.v_), d);
+      default: {
+        // NaN equals NaN here, so that a NaN key can be found and replaced like any other.
+        const double e = std::get<double>(a.v_);
+        return e == d || (std::isnan(e) && std::isnan(d));
+      }
     }
-    return v_ == other.v_;  // int64 and uint64 ranges never overlap
   }
   if (kind() != other.kind()) return false;
   switch (kind()) {
     case Kind::kArray:
-      return *as_array() == *other.as_array();
+      return as_array() == other.as_array() || *as_array() == *other.as_array();
     case Kind::kDictionary:
-      return *as_dictionary() == *other.as_dictionary();
+      return as_dictionary() == other.as_dictionary() || *as_dictionary() == *other.as_dictionary();
+    case Kind::kDate: {
+      const double x = as_date()->seconds_since_1970, y = other.as_date()->seconds_since_1970;
+      return x == y || (std::isnan(x) && std::isnan(y));
+    }
     default:
       return v_ == other.v_;
   }
@@ -235,8 +272,13 @@ std::size_t Value::Hash() const {
     case Kind::kDouble: {
       // Integral doubles hash like the equal integer, so that 1.0 finds the key 1.
       double d = std::get<double>(v_);
-      if (d >= -9.2e18 && d <= 9.2e18 && d == std::trunc(d)) {
-        return std::hash<std::int64_t>()(static_cast<std::int64_t>(d));
+      if (std::isnan(d)) return 0x7ff8;
+      if (d == std::trunc(d)) {
+        if (d >= -kTwoTo63 && d < kTwoTo63) {
+          return std::hash<std::int64_t>()(static_cast<std::int64_t>(d));
+        }
+        if (d >= 0 && d < kTwoTo64)
+          return std::hash<std::uint64_t>()(static_cast<std::uint64_t>(d));
       }
       return std::hash<double>()(d);
     }
@@ -247,8 +289,10 @@ std::size_t Value::Hash() const {
       return std::hash<std::string_view>()(
           std::string_view(reinterpret_cast<const char*>(b.data()), b.size()));
     }
-    case Kind::kDate:
-      return std::hash<double>()(as_date()->seconds_since_1970);
+    case Kind::kDate: {
+      double d = as_date()->seconds_since_1970;
+      return std::isnan(d) ? 0x7ff8 : std::hash<double>()(d);
+    }
     case Kind::kArray: {
       std::size_t h = 0xa77a;
       for (const Value& v : *as_array()) h = mix(h, v.Hash());

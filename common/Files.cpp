@@ -1,0 +1,214 @@
+#include "common/Files.h"
+
+#include <fcntl.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cerrno>
+#include <chrono>
+#include <cmath>
+#include <cstdio>
+#include <ctime>
+
+namespace qn {
+
+namespace {
+
+bool IsDirectory(const std::string& path) {
+  struct stat st;
+  return ::stat(path.c_str(), &st) == 0 && S_ISDIR(st.st_mode);
+}
+
+// Makes one directory with exactly `mode`, or accepts an existing directory.
+std::optional<Error> MakeOneDirectory(const std::string& path, mode_t mode) {
+  if (::mkdir(path.c_str(), mode) == 0) {
+    if (::chmod(path.c_str(), mode) != 0) return ErrnoError("chmod " + path, errno);
+    return std::nullopt;
+  }
+  const int mkdir_errno = errno;
+  if (mkdir_errno == EEXIST) {
+    if (IsDirectory(path)) return std::nullopt;
+    return ErrnoError("create directory " + path, ENOTDIR);
+  }
+  return ErrnoError("create directory " + path, mkdir_errno);
+}
+
+// Writes all of `contents` to fd, retrying short writes and interruptions.
+bool WriteAll(int fd, std::string_view contents) {
+  while (!contents.empty()) {
+    ssize_t n = ::write(fd, contents.data(), contents.size());
+    if (n < 0) {
+      if (errno == EINTR) continue;
+      return false;
+    }
+    contents.remove_prefix(static_cast<std::size_t>(n));
+  }
+  return true;
+}
+
+// A temporary name beside `base` in `dir` that is unlikely to be taken; the caller
+// creates it with O_EXCL and tries another on EEXIST.
+std::string TemporaryName(const std::string& dir, const std::string& base) {
+  static std::atomic<unsigned> counter{0};
+  const auto ticks = std::chrono::steady_clock::now().time_since_epoch().count();
+  char suffix[64];
+  std::snprintf(suffix, sizeof suffix, ".tmp-%d-%u-%llx", static_cast<int>(::getpid()),
+                counter.fetch_add(1, std::memory_order_relaxed),
+                static_cast<unsigned long long>(ticks) & 0xffffffULL);
+  return dir + "/." + base + suffix;
+}
+
+}  // namespace
+
+std::optional<Error> CreateDirectories(const std::string& path, mode_t mode) {
+  if (path.empty()) return ErrnoError("create directory ''", ENOENT);
+  if (IsDirectory(path)) return std::nullopt;
+  // Each prefix that ends a component, then the whole path. "//" and a trailing "/" make
+  // empty components, which are skipped.
+  for (std::size_t slash = path.find('/', 1); slash != std::string::npos;
+       slash = path.find('/', slash + 1)) {
+    if (path[slash - 1] == '/') continue;
+    if (auto error = MakeOneDirectory(path.substr(0, slash), mode)) return error;
+  }
+  if (path.back() == '/') return std::nullopt;
+  return MakeOneDirectory(path, mode);
+}
+
+std::optional<Error> WriteFileAtomically(const std::string& path, std::string_view contents) {
+  const std::size_t slash = path.rfind('/');
+  const std::string dir = slash == std::string::npos ? "."
+                          : slash == 0               ? "/"
+                                                     : path.substr(0, slash);
+  const std::string base = slash == std::string::npos ? path : path.substr(slash + 1);
+  if (base.empty()) return ErrnoError("write " + path, EISDIR);
+
+  std::string temp;
+  int fd = -1;
+  for (int attempt = 0; attempt < 100 && fd < 0; ++attempt) {
+    temp = TemporaryName(dir == "/" ? "" : dir, base);
+    fd = ::open(temp.c_str(), O_WRONLY | O_CREAT | O_EXCL | O_CLOEXEC, 0666);
+    if (fd < 0 && errno != EEXIST) return ErrnoError("create " + temp, errno);
+  }
+  if (fd < 0) return ErrnoError("create " + temp, EEXIST);
+
+  auto fail = [&](const std::string& what) {
+    const int saved = errno;
+    if (fd >= 0) ::close(fd);
+    ::unlink(temp.c_str());
+    return ErrnoError(what, saved);
+  };
+  if (!WriteAll(fd, contents)) return fail("write " + temp);
+  if (::fsync(fd) != 0) return fail("fsync " + temp);
+  const int to_close = fd;
+  fd = -1;
+  if (::close(to_close) != 0) return fail("close " + temp);
+  if (::rename(temp.c_str(), path.c_str()) != 0) return fail("rename " + temp + " to " + path);
+
+  // Make the rename itself durable. Some file systems cannot fsync a directory (EINVAL).
+  int dir_fd = ::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  if (dir_fd < 0) return ErrnoError("open " + dir, errno);
+  const bool synced = ::fsync(dir_fd) == 0 || errno == EINVAL;
+  const int sync_errno = errno;
+  ::close(dir_fd);
+  if (!synced) return ErrnoError("fsync " + dir, sync_errno);
+  return std::nullopt;
+}
+
+std::string FormatLocalTime(Date date, std::string_view pattern) {
+  double seconds = date.seconds_since_1970;
+  if (!std::isfinite(seconds) || std::fabs(seconds) > 1e14) seconds = 0;
+  // Whole milliseconds first, as a date formatter counts time, then split.
+  const auto total_millis = static_cast<long long>(std::floor(seconds * 1000));
+  long long whole = total_millis / 1000;
+  int millis = static_cast<int>(total_millis % 1000);
+  if (millis < 0) {
+    millis += 1000;
+    whole -= 1;
+  }
+  const std::time_t t = static_cast<std::time_t>(whole);
+  std::tm tm{};
+  ::tzset();  // pick up the current TZ
+  if (!localtime_r(&t, &tm)) gmtime_r(&t, &tm);
+
+  std::string out;
+  auto number = [&out](long value, std::size_t digits) {
+    char buf[32];
+    std::snprintf(buf, sizeof buf, "%0*ld", static_cast<int>(digits), value);
+    out += buf;
+  };
+  for (std::size_t i = 0; i < pattern.size();) {
+    const char c = pattern[i];
+    if (c == '\'') {
+      // Quoted text up to the next quote; "''" is a quote, inside quotes too.
+      if (i + 1 < pattern.size() && pattern[i + 1] == '\'') {
+        out += '\'';
+        i += 2;
+        continue;
+      }
+      ++i;
+      while (i < pattern.size()) {
+        if (pattern[i] == '\'') {
+          if (i + 1 < pattern.size() && pattern[i + 1] == '\'') {
+            out += '\'';
+            i += 2;
+            continue;
+          }
+          ++i;
+          break;
+        }
+        out += pattern[i++];
+      }
+      continue;
+    }
+    std::size_t run = 1;
+    while (i + run < pattern.size() && pattern[i + run] == c) ++run;
+    switch (c) {
+      case 'y':
+        if (run == 2) {
+          number((tm.tm_year + 1900) % 100, 2);
+        } else {
+          number(tm.tm_year + 1900L, run);
+        }
+        break;
+      case 'M':
+        number(tm.tm_mon + 1L, run);
+        break;
+      case 'd':
+        number(tm.tm_mday, run);
+        break;
+      case 'H':
+        number(tm.tm_hour, run);
+        break;
+      case 'm':
+        number(tm.tm_min, run);
+        break;
+      case 's':
+        number(tm.tm_sec, run);
+        break;
+      case 'S': {
+        // Fraction of the second, truncated to `run` digits.
+        char buf[8];
+        std::snprintf(buf, sizeof buf, "%03d", millis);
+        std::string digits(buf);
+        digits.resize(run, '0');
+        out += digits;
+        break;
+      }
+      case 'Z': {
+        const long offset = tm.tm_gmtoff;
+        const long magnitude = offset < 0 ? -offset : offset;
+        out += offset < 0 ? '-' : '+';
+        number(magnitude / 3600, 2);
+        number(magnitude % 3600 / 60, 2);
+        break;
+      }
+      default:
+        out.append(run, c);
+    }
+    i += run;
+  }
+  return out;
+}
+
+}  // namespace qn

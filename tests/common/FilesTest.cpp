@@ -1,0 +1,177 @@
+#include "common/Files.h"
+
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <algorithm>
+#include <cerrno>
+#include <cmath>
+#include <cstdlib>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+
+namespace qn {
+namespace {
+
+namespace fs = std::filesystem;
+
+class FilesTest : public testing::Test {
+ protected:
+  void SetUp() override {
+    std::string pattern = (fs::temp_directory_path() / "qn-files-XXXXXX").string();
+    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
+    root_ = pattern;
+    old_umask_ = umask(022);
+  }
+  void TearDown() override {
+    umask(old_umask_);
+    std::error_code ignored;
+    fs::remove_all(root_, ignored);
+  }
+
+  static mode_t ModeOf(const std::string& path) {
+    struct stat st;
+    EXPECT_EQ(stat(path.c_str(), &st), 0) << path;
+    return st.st_mode & 07777;
+  }
+  static std::string Read(const std::string& path) {
+    std::ifstream in(path);
+    std::stringstream s;
+    s << in.rdbuf();
+    return s.str();
+  }
+  std::vector<std::string> Listing(const std::string& dir) const {
+    std::vector<std::string> names;
+    for (const auto& entry : fs::directory_iterator(dir)) {
+      names.push_back(entry.path().filename().string());
+    }
+    std::sort(names.begin(), names.end());
+    return names;
+  }
+
+  std::string root_;
+  mode_t old_umask_ = 0;
+};
+
+TEST_F(FilesTest, CreatedDirectoriesGetExactlyTheModeDespiteTheUmask) {
+  const std::string existing = root_ + "/existing";
+  ASSERT_EQ(mkdir(existing.c_str(), 0700), 0);
+  const std::string deep = existing + "/a//b/c/";
+  ASSERT_FALSE(CreateDirectories(deep, 0777));
+  EXPECT_EQ(ModeOf(existing), 0700u);  // not created here: left as it was
+  EXPECT_EQ(ModeOf(existing + "/a"), 0777u);
+  EXPECT_EQ(ModeOf(existing + "/a/b"), 0777u);
+  EXPECT_EQ(ModeOf(existing + "/a/b/c"), 0777u);
+  EXPECT_FALSE(CreateDirectories(deep, 0777));  // exists already: fine
+
+  ASSERT_FALSE(CreateDirectories(root_ + "/private/x", 0700));
+  EXPECT_EQ(ModeOf(root_ + "/private/x"), 0700u);
+}
+
+TEST_F(FilesTest, RelativePathsWork) {
+  const fs::path cwd = fs::current_path();
+  fs::current_path(root_);
+  auto error = CreateDirectories("rel/sub", 0755);
+  fs::current_path(cwd);
+  EXPECT_FALSE(error);
+  EXPECT_TRUE(fs::is_directory(root_ + "/rel/sub"));
+}
+
+TEST_F(FilesTest, AComponentThatIsAFileFails) {
+  const std::string file = root_ + "/plain";
+  std::ofstream(file) << "x";
+  for (const std::string& path : {file, file + "/sub", file + "/sub/deeper"}) {
+    auto error = CreateDirectories(path, 0777);
+    ASSERT_TRUE(error) << path;
+    EXPECT_EQ(error->domain, "posix");
+    EXPECT_EQ(error->code, ENOTDIR);
+    EXPECT_NE(error->description.find(file), std::string::npos) << error->description;
+  }
+  EXPECT_FALSE(fs::exists(file + "/sub"));
+  EXPECT_TRUE(CreateDirectories("", 0777));
+}
+
+TEST_F(FilesTest, AtomicWriteCreatesAndReplaces) {
+  const std::string path = root_ + "/summary.json";
+  ASSERT_FALSE(WriteFileAtomically(path, "first"));
+  EXPECT_EQ(Read(path), "first");
+  EXPECT_EQ(ModeOf(path), 0644u);  // 0666 less the umask
+  struct stat before;
+  ASSERT_EQ(stat(path.c_str(), &before), 0);
+
+  const std::string big(3 << 20, 'b');
+  ASSERT_FALSE(WriteFileAtomically(path, big));
+  EXPECT_EQ(Read(path), big);
+  struct stat after;
+  ASSERT_EQ(stat(path.c_str(), &after), 0);
+  EXPECT_NE(before.st_ino, after.st_ino);  // a new file moved into place, not rewritten
+  ASSERT_FALSE(WriteFileAtomically(path, ""));
+  EXPECT_EQ(Read(path), "");
+  EXPECT_EQ(Listing(root_), (std::vector<std::string>{"summary.json"}));  // no temporaries
+}
+
+TEST_F(FilesTest, AtomicWriteFailuresLeaveNothingBehind) {
+  // Target is a directory: the rename fails after the temporary was written.
+  ASSERT_FALSE(CreateDirectories(root_ + "/dir.json", 0755));
+  auto error = WriteFileAtomically(root_ + "/dir.json", "text");
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->domain, "posix");
+  EXPECT_NE(error->description.find("rename"), std::string::npos) << error->description;
+  EXPECT_EQ(Listing(root_), (std::vector<std::string>{"dir.json"}));
+
+  // Missing directory, and a path component that is a file.
+  EXPECT_TRUE(WriteFileAtomically(root_ + "/missing/file.json", "text"));
+  std::ofstream(root_ + "/plain") << "x";
+  error = WriteFileAtomically(root_ + "/plain/file.json", "text");
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, ENOTDIR);
+  EXPECT_EQ(Read(root_ + "/plain"), "x");
+  EXPECT_EQ(Listing(root_), (std::vector<std::string>{"dir.json", "plain"}));
+  EXPECT_TRUE(WriteFileAtomically(root_ + "/", "text"));
+}
+
+// Sets TZ for one test and puts the old value back.
+class ScopedTimeZone {
+ public:
+  explicit ScopedTimeZone(const char* tz) {
+    if (const char* old = getenv("TZ")) old_ = old;
+    setenv("TZ", tz, 1);
+    tzset();
+  }
+  ~ScopedTimeZone() {
+    if (old_) {
+      setenv("TZ", old_->c_str(), 1);
+    } else {
+      unsetenv("TZ");
+    }
+    tzset();
+  }
+
+ private:
+  std::optional<std::string> old_;
+};
+
+TEST(FormatLocalTimeTest, SummaryFileNamePattern) {
+  const Date when{1705325405.123};  // 2024-01-15 13:30:05.123 UTC
+  {
+    ScopedTimeZone zone("CET-1");
+    EXPECT_EQ(FormatLocalTime(when, "yyyyMMdd-HHmmssZ"), "20240115-143005+0100");
+  }
+  {
+    ScopedTimeZone zone("EST5");
+    EXPECT_EQ(FormatLocalTime(when, "yyyyMMdd-HHmmssZ"), "20240115-083005-0500");
+  }
+  {
+    ScopedTimeZone zone("IST-5:30");
+    EXPECT_EQ(FormatLocalTime(when, "yyyyMMdd-HHmmssZ"), "20240115-190005+0530");
+  }
+  ScopedTimeZone zone("UTC0");
+  EXPECT_EQ(FormatLocalTime(when, "yyyy-MM-dd'T'HH:mm:ss.SSS 'o''clock' yy''"),
+            "2024-01-15T13:30:05.123 o'clock 24'");
+  EXPECT_EQ(FormatLocalTime(Date{std::nan("")}, "yyyyMMdd-HHmmssZ"), "19700101-000000+0000");
+}
+
+}  // namespace
+}  // namespace qn
