@@ -1,0 +1,32 @@
+#pragma once
+
+#include <cstddef>
+#include <memory>
+
+#include "platform/dispatch.h"
+#include "platform/log.h"
+#include "platform/platform.h"
+
+namespace qn {
+
+// The process-wide state of the service front, made once by the service delegate and
+// shared with every server instance: the platform, the one serial server queue on which
+// every request, every connection-end step and the defaults handler run, and the server
+// log scope ("qnrs"). Immutable after construction; safe to read from any thread.
+struct QNReportingServerContext {
+  std::shared_ptr<const Platform> platform;
+  // Serial, user-interactive, labelled "com.norvel.quenta.reporting.server".
+  std::shared_ptr<SerialQueue> serverQueue;
+  // The "qnrs" scope; null means the platform's default log.
+  std::shared_ptr<const LogScope> logScope;
+  // The most sessions one client may hold at once. A create request for a new reporter ID
+  // beyond it makes no session (its reply is still YES), so one client cannot exhaust the
+  // daemon's memory. Replacing an existing ID is always allowed.
+  static constexpr std::size_t kDefaultMaxSessionsPerClient = 16384;
+  std::size_t maxSessionsPerClient = kDefaultMaxSessionsPerClient;
+
+  Log& log() const { return *platform->log; }
+  const LogScope* scope() const { return logScope.get(); }
+};
+
+}  // namespace qn
