@@ -1,0 +1,100 @@
+#include "common/Paths.h"
+
+#include <pwd.h>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+
+namespace qn {
+
+namespace {
+
+std::optional<std::string> AbsoluteVariable(const char* name) {
+  const char* value = std::getenv(name);
+  if (value == nullptr || value[0] != '/') return std::nullopt;
+  return std::string(value);
+}
+
+std::string WithoutTrailingSlashes(std::string path) {
+  while (path.size() > 1 && path.back() == '/') path.pop_back();
+  return path;
+}
+
+}  // namespace
+
+PathEnvironment PathEnvironment::Current() {
+  PathEnvironment environment;
+  environment.uid = getuid();
+  environment.xdg_runtime_dir = AbsoluteVariable("XDG_RUNTIME_DIR");
+  environment.xdg_state_home = AbsoluteVariable("XDG_STATE_HOME");
+  environment.home = AbsoluteVariable("HOME");
+  if (!environment.home) {
+    struct passwd entry;
+    struct passwd* found = nullptr;
+    char buffer[4096];
+    if (getpwuid_r(environment.uid, &entry, buffer, sizeof buffer, &found) == 0 && found &&
+        found->pw_dir && found->pw_dir[0] == '/') {
+      environment.home = std::string(found->pw_dir);
+    }
+  }
+  return environment;
+}
+
+Paths ResolvePaths(const PathOptions& options, const PathEnvironment& environment) {
+  Paths paths;
+  if (options.home) {
+    std::string home = WithoutTrailingSlashes(*options.home);
+    paths.runtime_dir = home + "/run";
+    paths.state_dir = home + "/state";
+    paths.log_dir = home + "/log";
+  } else if (environment.uid == 0) {
+    paths.runtime_dir = "/run/quenta";
+    paths.state_dir = "/var/lib/quenta";
+    paths.log_dir = "/var/log/quenta";
+  } else {
+    const std::string uid = std::to_string(environment.uid);
+    if (environment.xdg_runtime_dir && !environment.xdg_runtime_dir->empty()) {
+      paths.runtime_dir = WithoutTrailingSlashes(*environment.xdg_runtime_dir) + "/quenta";
+    } else {
+      paths.runtime_dir = "/tmp/quenta-" + uid;
+    }
+    if (environment.xdg_state_home && !environment.xdg_state_home->empty()) {
+      paths.state_dir = WithoutTrailingSlashes(*environment.xdg_state_home) + "/quenta";
+    } else if (environment.home && !environment.home->empty()) {
+      paths.state_dir = WithoutTrailingSlashes(*environment.home) + "/.local/state/quenta";
+    } else {
+      // No home folder at all (a system user): keep state beside the runtime folder.
+      paths.state_dir = "/tmp/quenta-" + uid + "/state";
+    }
+    paths.log_dir = paths.state_dir + "/log";
+  }
+  paths.socket_path = options.socket ? *options.socket : paths.runtime_dir + "/reporting.sock";
+  return paths;
+}
+
+Paths ResolvePaths(const PathOptions& options) {
+  return ResolvePaths(options, PathEnvironment::Current());
+}
+
+std::string MakeDirectories(const std::string& path, mode_t mode) {
+  if (path.empty()) return "empty folder name";
+  std::string prefix;
+  std::size_t start = 0;
+  while (start <= path.size()) {
+    std::size_t slash = path.find('/', start);
+    if (slash == std::string::npos) slash = path.size();
+    prefix = path.substr(0, slash);
+    start = slash + 1;
+    if (prefix.empty() || prefix == "." || prefix == "..") continue;
+    if (mkdir(prefix.c_str(), mode) == 0) continue;
+    const int error = errno;
+    struct stat info;
+    if (error == EEXIST && stat(prefix.c_str(), &info) == 0 && S_ISDIR(info.st_mode)) continue;
+    return "cannot create folder " + prefix + ": " + std::strerror(error);
+  }
+  return {};
+}
+
+}  // namespace qn

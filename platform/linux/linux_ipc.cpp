@@ -1,0 +1,655 @@
+#include "platform/linux/linux_ipc.h"
+
+#include <fcntl.h>
+#include <sys/file.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <sys/un.h>
+#include <systemd/sd-daemon.h>
+#include <unistd.h>
+#include <asio.hpp>
+#include <atomic>
+#include <cerrno>
+#include <cstring>
+#include <mutex>
+#include <unordered_map>
+#include <utility>
+
+#include "common/Frame.h"
+#include "common/MsgPack.h"
+#include "common/Paths.h"
+#include "common/Protocol.h"
+
+namespace qn {
+
+namespace {
+
+using Protocol = asio::local::stream_protocol;
+using Socket = Protocol::socket;
+
+constexpr std::size_t kReadChunkBytes = 16 * 1024;
+// After a write the outgoing buffer keeps at most this much capacity, so one burst of
+// replies does not pin its memory for the life of the connection.
+constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
+// How long accepting pauses after a failed accept (typically fd exhaustion) before retrying.
+constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
+
+std::string ErrnoText(const std::string& what, int error) {
+  return what + ": " + std::strerror(error);
+}
+
+// A file descriptor closed on destruction.
+class Fd {
+ public:
+  Fd() = default;
+  explicit Fd(int fd) : fd_(fd) {}
+  Fd(Fd&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
+  Fd& operator=(Fd&& other) noexcept {
+    if (this != &other) {
+      Reset();
+      fd_ = std::exchange(other.fd_, -1);
+    }
+    return *this;
+  }
+  ~Fd() { Reset(); }
+  int get() const { return fd_; }
+  int release() { return std::exchange(fd_, -1); }
+  void Reset() {
+    if (fd_ >= 0) ::close(fd_);
+    fd_ = -1;
+  }
+
+ private:
+  int fd_ = -1;
+};
+
+bool FillAddress(const std::string& path, sockaddr_un& address) {
+  std::memset(&address, 0, sizeof address);
+  address.sun_family = AF_UNIX;
+  if (path.empty() || path.size() >= sizeof address.sun_path) return false;
+  std::memcpy(address.sun_path, path.data(), path.size());
+  return true;
+}
+
+// The listening socket and what is needed to clean up after it.
+struct ListeningSocket {
+  Fd fd;
+  Fd lock;                 // flock'ed <path>.lock, held while this process owns the path
+  std::string bound_path;  // empty when the socket came from systemd
+  ino_t bound_inode = 0;
+  std::string error;
+};
+
+// Whether something accepts connections on the socket file at `path`. A non-blocking
+// connect that succeeds or finds the backlog full means a live listener; ECONNREFUSED means
+// a file left behind by a process that is gone.
+enum class Probe { kLive, kStale, kError };
+Probe ProbeSocket(const sockaddr_un& address, std::string& error) {
+  Fd fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_NONBLOCK | SOCK_CLOEXEC, 0));
+  if (fd.get() < 0) {
+    error = ErrnoText("socket", errno);
+    return Probe::kError;
+  }
+  if (::connect(fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) == 0) {
+    return Probe::kLive;
+  }
+  const int e = errno;
+  if (e == EAGAIN || e == EINPROGRESS) return Probe::kLive;
+  if (e == ECONNREFUSED) return Probe::kStale;
+  error = ErrnoText(std::string("connect ") + address.sun_path, e);
+  return Probe::kError;
+}
+
+ListeningSocket BindPath(const std::string& path) {
+  ListeningSocket result;
+  sockaddr_un address;
+  if (!FillAddress(path, address)) {
+    result.error = "socket path \"" + path + "\" is empty or too long";
+    return result;
+  }
+  const auto slash = path.rfind('/');
+  if (slash != std::string::npos && slash > 0) {
+    std::string problem = MakeDirectories(path.substr(0, slash), 0755);
+    if (!problem.empty()) {
+      result.error = problem;
+      return result;
+    }
+  }
+
+  // Two daemons starting at once must not both decide the socket is stale and unlink each
+  // other's: the lock file serialises the check-unlink-bind sequence (and is held for life).
+  const std::string lock_path = path + ".lock";
+  result.lock = Fd(::open(lock_path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  if (result.lock.get() < 0) {
+    result.error = ErrnoText("open " + lock_path, errno);
+    return result;
+  }
+  if (::flock(result.lock.get(), LOCK_EX | LOCK_NB) != 0) {
+    const int e = errno;
+    result.error = e == EWOULDBLOCK ? "another daemon is already serving " + path + " (" +
+                                          lock_path + " is locked)"
+                                    : ErrnoText("lock " + lock_path, e);
+    return result;
+  }
+
+  struct stat info;
+  if (::lstat(path.c_str(), &info) == 0) {
+    if (!S_ISSOCK(info.st_mode)) {
+      result.error = path + " exists and is not a socket; refusing to replace it";
+      return result;
+    }
+    std::string problem;
+    switch (ProbeSocket(address, problem)) {
+      case Probe::kLive:
+        result.error = "another daemon is already listening on " + path;
+        return result;
+      case Probe::kError:
+        result.error = "cannot check the existing socket " + path + ": " + problem;
+        return result;
+      case Probe::kStale:
+        if (::unlink(path.c_str()) != 0 && errno != ENOENT) {
+          result.error = ErrnoText("remove stale socket " + path, errno);
+          return result;
+        }
+        break;
+    }
+  } else if (errno != ENOENT) {
+    result.error = ErrnoText("stat " + path, errno);
+    return result;
+  }
+
+  result.fd = Fd(::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0));
+  if (result.fd.get() < 0) {
+    result.error = ErrnoText("socket", errno);
+    return result;
+  }
+  if (::bind(result.fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
+    result.error = ErrnoText("bind " + path, errno);
+    return result;
+  }
+  if (::lstat(path.c_str(), &info) == 0) result.bound_inode = info.st_ino;
+  if (::chmod(path.c_str(), 0660) != 0) {
+    result.error = ErrnoText("chmod " + path, errno);
+  } else if (::listen(result.fd.get(), SOMAXCONN) != 0) {
+    result.error = ErrnoText("listen " + path, errno);
+  }
+  if (!result.error.empty()) {
+    ::unlink(path.c_str());
+    return result;
+  }
+  result.bound_path = path;
+  return result;
+}
+
+// The first listening AF_UNIX stream socket systemd passed, if it passed any.
+std::optional<ListeningSocket> ActivatedSocket() {
+  const int count = sd_listen_fds(1);
+  if (count <= 0) return std::nullopt;
+  ListeningSocket result;
+  for (int fd = SD_LISTEN_FDS_START; fd < SD_LISTEN_FDS_START + count; ++fd) {
+    if (sd_is_socket_unix(fd, SOCK_STREAM, 1, nullptr, 0) > 0) {
+      result.fd = Fd(fd);
+      return result;
+    }
+  }
+  result.error =
+      "systemd passed " + std::to_string(count) + " socket(s), none a listening Unix stream socket";
+  return result;
+}
+
+class LinuxIpcListener;
+
+// One accepted connection. Lives as long as its pending asio operations, the listener's
+// registry, or a reply in progress hold it. Everything except QueueReply and the getters runs
+// on the listener's io_context thread.
+class LinuxConnection final : public IpcConnection,
+                              public std::enable_shared_from_this<LinuxConnection> {
+ public:
+  LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_t pid, uid_t uid);
+
+  pid_t PeerPid() const override { return pid_; }
+  uid_t PeerUid() const override { return uid_; }
+  std::string Description() const override { return description_; }
+
+  void SetExportedObject(std::shared_ptr<IpcExportedObject> object) override {
+    object_ = std::move(object);
+  }
+  void SetInterruptionHandler(std::function<void()> handler) override {
+    interruption_ = std::move(handler);
+  }
+  void SetInvalidationHandler(std::function<void()> handler) override {
+    invalidation_ = std::move(handler);
+  }
+  void Resume() override;
+
+  // Frames [request_id, result] and queues it. Any thread; dropped once the connection is
+  // closing or ended.
+  void QueueReply(std::uint32_t request_id, Value result);
+
+  // Ends the connection: closes the socket, calls the invalidation handler (once) and lets
+  // go of the exported object and handlers. io_context thread.
+  void Finish();
+
+  // Marks the connection ended without running anything; for a listener that is destroyed
+  // without having been stopped. Any thread, while the io_context is not running.
+  void Abandon();
+
+ private:
+  enum class State { kOpen, kClosing, kEnded };
+
+  void StartRead();
+  void OnRead(const asio::error_code& error, std::size_t bytes);
+  // Handles every complete frame in the decoder; returns false once the connection failed.
+  bool HandleFrames();
+  // Bad input: queue the error frame, log, stop reading, close once it is written.
+  void Fail(protocol::ConnectionError code, const std::string& message);
+  void StartWriteLocked();  // REQUIRES: mu_ held
+  void OnWrite(const asio::error_code& error);
+  void OnOverflow();
+
+  // The listener is only reached while the connection is not ended (Finish, Forget); replies
+  // may still arrive after it is gone, so they use the shared pieces below instead.
+  LinuxIpcListener& listener_;
+  const std::shared_ptr<asio::io_context> io_;
+  const std::shared_ptr<Log> log_;
+  const std::shared_ptr<const LogScope> scope_;
+  const std::size_t max_outgoing_bytes_;
+  const int error_flush_timeout_ms_;
+  Socket socket_;
+  const pid_t pid_;
+  const uid_t uid_;
+  const std::string description_;
+  asio::steady_timer close_timer_;
+
+  // io_context thread only.
+  std::shared_ptr<IpcExportedObject> object_;
+  std::function<void()> interruption_;
+  std::function<void()> invalidation_;
+  FrameDecoder decoder_;
+  std::unique_ptr<char[]> read_buffer_;
+  bool reading_ = false;
+
+  std::mutex mu_;
+  State state_ = State::kOpen;     // guarded by mu_ (written on the io thread)
+  std::string pending_;            // guarded by mu_: framed replies not yet handed to a write
+  std::string writing_;            // the bytes of the write in flight (io thread while writing)
+  std::size_t writing_bytes_ = 0;  // guarded by mu_: writing_.size() while a write is in flight
+  bool write_active_ = false;      // guarded by mu_: a write is in flight or posted
+  bool overflowed_ = false;        // guarded by mu_
+};
+
+class LinuxIpcListener final : public IpcListener {
+ public:
+  LinuxIpcListener(const LinuxIpcOptions& options, std::shared_ptr<Log> log,
+                   std::shared_ptr<const LogScope> scope, ListeningSocket socket)
+      : options_(options),
+        log_(std::move(log)),
+        scope_(std::move(scope)),
+        acceptor_(*io_),
+        backoff_(*io_),
+        lock_(std::move(socket.lock)),
+        bound_path_(std::move(socket.bound_path)),
+        bound_inode_(socket.bound_inode) {
+    asio::error_code ignored;
+    acceptor_.assign(Protocol(), socket.fd.release(), ignored);
+  }
+
+  ~LinuxIpcListener() override {
+    // Normally Stop has ended every connection already. Otherwise end the rest without
+    // their handlers, then let every aborted operation complete, so that no handler left in
+    // the io_context keeps a connection (and with it the io_context) alive.
+    for (auto& [raw, connection] : connections_) connection->Abandon();
+    connections_.clear();
+    asio::error_code ignored;
+    acceptor_.close(ignored);
+    backoff_.cancel();
+    io_->restart();
+    io_->run();
+    RemoveSocketFile();
+  }
+
+  void SetDelegate(std::shared_ptr<IpcListenerDelegate> delegate) override {
+    delegate_ = std::move(delegate);
+  }
+
+  void Resume() override {
+    asio::post(*io_, [this] {
+      if (stopped_) return;
+      StartAccept();
+      if (options_.notify_ready) sd_notify(0, "READY=1");
+    });
+    io_->run();
+  }
+
+  void Stop() override {
+    asio::post(*io_, [this] { DoStop(); });
+  }
+
+  const std::shared_ptr<asio::io_context>& io() const { return io_; }
+  const std::shared_ptr<Log>& log() const { return log_; }
+  const std::shared_ptr<const LogScope>& scope() const { return scope_; }
+  const LinuxIpcOptions& options() const { return options_; }
+
+  // io_context thread.
+  void Forget(LinuxConnection* connection) { connections_.erase(connection); }
+
+ private:
+  void StartAccept() {
+    acceptor_.async_accept([this](const asio::error_code& error, Socket socket) {
+      OnAccept(error, std::move(socket));
+    });
+  }
+
+  void OnAccept(const asio::error_code& error, Socket socket) {
+    if (stopped_) return;
+    if (error) {
+      if (error == asio::error::operation_aborted) return;
+      // Typically EMFILE/ENFILE: the connection stays in the backlog, so retrying at once
+      // would spin. Pause, then try again; log once per run of failures.
+      if (!accept_failing_) {
+        QN_LOG(*log_, scope_.get(), LogLevel::kError, "%s:%d:%s: accept failed: %s; retrying",
+               error.message());
+      }
+      accept_failing_ = true;
+      backoff_.expires_after(kAcceptBackoff);
+      backoff_.async_wait([this](const asio::error_code& e) {
+        if (!e && !stopped_) StartAccept();
+      });
+      return;
+    }
+    accept_failing_ = false;
+
+    ucred credentials{};
+    socklen_t length = sizeof credentials;
+    if (::getsockopt(socket.native_handle(), SOL_SOCKET, SO_PEERCRED, &credentials, &length) != 0) {
+      credentials.pid = 0;
+      credentials.uid = static_cast<uid_t>(-1);
+    }
+    auto connection = std::make_shared<LinuxConnection>(*this, std::move(socket), credentials.pid,
+                                                        credentials.uid);
+    connections_.emplace(connection.get(), connection);
+    const bool accepted = delegate_ && delegate_->ShouldAcceptNewConnection(*this, connection);
+    if (!accepted) connection->Finish();
+    StartAccept();
+  }
+
+  void DoStop() {
+    if (stopped_) return;
+    stopped_ = true;
+    asio::error_code ignored;
+    acceptor_.close(ignored);
+    backoff_.cancel();
+    RemoveSocketFile();
+    // Finish removes each connection from the registry; walk a copy.
+    std::vector<std::shared_ptr<LinuxConnection>> open;
+    open.reserve(connections_.size());
+    for (auto& [raw, connection] : connections_) open.push_back(connection);
+    for (auto& connection : open) connection->Finish();
+    if (options_.notify_ready) sd_notify(0, "STOPPING=1");
+  }
+
+  void RemoveSocketFile() {
+    if (bound_path_.empty()) return;
+    struct stat info;
+    // Only our own socket file: another daemon may have replaced it since.
+    if (::lstat(bound_path_.c_str(), &info) == 0 && S_ISSOCK(info.st_mode) &&
+        info.st_ino == bound_inode_) {
+      ::unlink(bound_path_.c_str());
+    }
+    bound_path_.clear();
+  }
+
+  const LinuxIpcOptions options_;
+  const std::shared_ptr<Log> log_;
+  const std::shared_ptr<const LogScope> scope_;
+  // Shared with the connections: a connection that outlives the listener (a reply in
+  // progress on another thread holds it) still destroys its socket against a live context.
+  const std::shared_ptr<asio::io_context> io_ = std::make_shared<asio::io_context>(1);
+  Protocol::acceptor acceptor_;
+  asio::steady_timer backoff_;
+  Fd lock_;
+  std::string bound_path_;
+  ino_t bound_inode_;
+
+  // io_context thread only (set before Resume for the delegate).
+  std::shared_ptr<IpcListenerDelegate> delegate_;
+  std::unordered_map<LinuxConnection*, std::shared_ptr<LinuxConnection>> connections_;
+  bool stopped_ = false;
+  bool accept_failing_ = false;
+};
+
+LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_t pid, uid_t uid)
+    : listener_(listener),
+      io_(listener.io()),
+      log_(listener.log()),
+      scope_(listener.scope()),
+      max_outgoing_bytes_(listener.options().max_outgoing_bytes),
+      error_flush_timeout_ms_(listener.options().error_flush_timeout_ms),
+      socket_(std::move(socket)),
+      pid_(pid),
+      uid_(uid),
+      description_(
+          StringWithFormat("<connection pid=%d uid=%u fd=%d>", pid, uid, socket_.native_handle())),
+      close_timer_(*listener.io()) {}
+
+void LinuxConnection::Resume() {
+  asio::dispatch(*io_, [self = shared_from_this()] {
+    if (self->reading_) return;
+    {
+      std::lock_guard lock(self->mu_);
+      if (self->state_ != State::kOpen) return;
+    }
+    self->reading_ = true;
+    self->read_buffer_ = std::make_unique<char[]>(kReadChunkBytes);
+    self->StartRead();
+  });
+}
+
+void LinuxConnection::StartRead() {
+  socket_.async_read_some(
+      asio::buffer(read_buffer_.get(), kReadChunkBytes),
+      [self = shared_from_this()](const asio::error_code& error, std::size_t bytes) {
+        self->OnRead(error, bytes);
+      });
+}
+
+void LinuxConnection::OnRead(const asio::error_code& error, std::size_t bytes) {
+  {
+    std::lock_guard lock(mu_);
+    if (state_ != State::kOpen) return;
+  }
+  if (error) {
+    if (error == asio::error::eof && decoder_.buffered() > 0) {
+      Fail(protocol::ConnectionError::kBadMessagePack,
+           StringWithFormat("end of stream inside a frame (%zu bytes pending)",
+                            decoder_.buffered()));
+      return;
+    }
+    Finish();
+    return;
+  }
+  decoder_.Feed(std::string_view(read_buffer_.get(), bytes));
+  if (HandleFrames()) StartRead();
+}
+
+bool LinuxConnection::HandleFrames() {
+  while (auto body = decoder_.Next()) {
+    auto decoded = DecodeMsgPack(*body);
+    if (auto* problem = std::get_if<protocol::RequestProblem>(&decoded)) {
+      Fail(problem->code, problem->message);
+      return false;
+    }
+    const Value& request = std::get<Value>(decoded);
+    auto checked = protocol::ValidateRequest(request);
+    if (auto* problem = std::get_if<protocol::RequestProblem>(&checked)) {
+      Fail(problem->code, problem->message);
+      return false;
+    }
+    const auto header = std::get<protocol::RequestHeader>(checked);
+    const Array& items = *request.as_array();
+    Array args(items.begin() + 2, items.end());
+    if (!object_) {
+      QN_LOG(*log_, scope_.get(), LogLevel::kError,
+             "%s:%d:%s: %s: request %u (%s) dropped: no exported object", description_,
+             header.request_id, protocol::OpName(header.op));
+      continue;
+    }
+    std::weak_ptr<LinuxConnection> weak = shared_from_this();
+    const std::uint32_t request_id = header.request_id;
+    object_->HandleRequest(header.op, args, [weak, request_id](Value result) {
+      if (auto connection = weak.lock()) connection->QueueReply(request_id, std::move(result));
+    });
+    std::lock_guard lock(mu_);
+    if (state_ != State::kOpen) return false;  // the exported object closed us, or overflow
+  }
+  if (auto& problem = decoder_.error()) {
+    Fail(problem->code, problem->message);
+    return false;
+  }
+  return true;
+}
+
+void LinuxConnection::Fail(protocol::ConnectionError code, const std::string& message) {
+  QN_LOG(*log_, scope_.get(), LogLevel::kError,
+         "%s:%d:%s: %s: bad input (code %lld): %s; closing the connection", description_,
+         static_cast<long long>(code), message);
+  std::string frame;
+  AppendFrame(frame, protocol::MakeConnectionError(code, message));
+  {
+    std::lock_guard lock(mu_);
+    if (state_ != State::kOpen) return;
+    state_ = State::kClosing;
+    // Replies queued before the bad frame still go out first; the error frame is last.
+    pending_ += frame;
+    if (!write_active_) StartWriteLocked();
+  }
+  close_timer_.expires_after(std::chrono::milliseconds(error_flush_timeout_ms_));
+  close_timer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
+    if (!error) self->Finish();
+  });
+}
+
+void LinuxConnection::QueueReply(std::uint32_t request_id, Value result) {
+  std::string frame;
+  if (!AppendFrame(frame, Value(Array{Value(request_id), std::move(result)}))) {
+    QN_LOG(*log_, scope_.get(), LogLevel::kError,
+           "%s:%d:%s: %s: reply to request %u is larger than a frame may be; dropped", description_,
+           request_id);
+    return;
+  }
+  std::lock_guard lock(mu_);
+  if (state_ != State::kOpen) return;
+  pending_ += frame;
+  if (pending_.size() + writing_bytes_ > max_outgoing_bytes_) {
+    pending_.clear();
+    state_ = State::kClosing;
+    overflowed_ = true;
+    asio::post(*io_, [self = shared_from_this()] { self->OnOverflow(); });
+    return;
+  }
+  if (!write_active_) {
+    write_active_ = true;
+    asio::post(*io_, [self = shared_from_this()] {
+      std::lock_guard lock(self->mu_);
+      if (self->state_ == State::kEnded) return;
+      self->write_active_ = false;
+      if (!self->pending_.empty()) self->StartWriteLocked();
+    });
+  }
+}
+
+void LinuxConnection::OnOverflow() {
+  QN_LOG(*log_, scope_.get(), LogLevel::kError,
+         "%s:%d:%s: %s: peer does not read its replies (more than %zu bytes queued); closing "
+         "the connection",
+         description_, max_outgoing_bytes_);
+  Finish();
+}
+
+void LinuxConnection::StartWriteLocked() {
+  // Everything queued so far goes out in one write.
+  writing_.swap(pending_);
+  pending_.clear();
+  if (pending_.capacity() > kKeptBufferCapacity) std::string().swap(pending_);
+  writing_bytes_ = writing_.size();
+  write_active_ = true;
+  asio::async_write(socket_, asio::buffer(writing_),
+                    [self = shared_from_this()](const asio::error_code& error, std::size_t) {
+                      self->OnWrite(error);
+                    });
+}
+
+void LinuxConnection::OnWrite(const asio::error_code& error) {
+  if (error) {
+    Finish();
+    return;
+  }
+  std::unique_lock lock(mu_);
+  if (state_ == State::kEnded) return;
+  writing_.clear();
+  if (writing_.capacity() > kKeptBufferCapacity) std::string().swap(writing_);
+  writing_bytes_ = 0;
+  write_active_ = false;
+  if (!pending_.empty()) {
+    StartWriteLocked();
+    return;
+  }
+  if (state_ == State::kClosing && !overflowed_) {
+    lock.unlock();
+    Finish();  // the error frame is out
+  }
+}
+
+void LinuxConnection::Finish() {
+  {
+    std::lock_guard lock(mu_);
+    if (state_ == State::kEnded) return;
+    state_ = State::kEnded;
+    pending_.clear();
+  }
+  asio::error_code ignored;
+  socket_.shutdown(Socket::shutdown_both, ignored);
+  socket_.close(ignored);
+  close_timer_.cancel();
+  auto keep = shared_from_this();
+  listener_.Forget(this);
+  auto invalidation = std::move(invalidation_);
+  auto object = std::move(object_);
+  invalidation_ = nullptr;
+  interruption_ = nullptr;
+  object_ = nullptr;
+  if (invalidation) invalidation();
+}
+
+void LinuxConnection::Abandon() {
+  {
+    std::lock_guard lock(mu_);
+    state_ = State::kEnded;
+    pending_.clear();
+  }
+  asio::error_code ignored;
+  socket_.close(ignored);
+  close_timer_.cancel();
+  invalidation_ = nullptr;
+  interruption_ = nullptr;
+  object_ = nullptr;
+}
+
+}  // namespace
+
+LinuxIpcListenerResult NewLinuxIpcListener(const LinuxIpcOptions& options, std::shared_ptr<Log> log,
+                                           std::shared_ptr<const LogScope> scope) {
+  LinuxIpcListenerResult result;
+  std::optional<ListeningSocket> socket;
+  if (options.socket_activation) socket = ActivatedSocket();
+  if (!socket) socket = BindPath(options.socket_path);
+  if (!socket->error.empty()) {
+    result.error = std::move(socket->error);
+    return result;
+  }
+  result.listener = std::make_shared<LinuxIpcListener>(options, std::move(log), std::move(scope),
+                                                       std::move(*socket));
+  return result;
+}
+
+}  // namespace qn

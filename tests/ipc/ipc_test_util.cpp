@@ -1,0 +1,192 @@
+#include "tests/ipc/ipc_test_util.h"
+
+#include <poll.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
+#include <cerrno>
+#include <filesystem>
+
+namespace qn::testing {
+
+TempDir::TempDir() {
+  const char* base = std::getenv("TMPDIR");
+  std::string pattern = std::string(base && *base ? base : "/tmp") + "/qn-ipc-XXXXXX";
+  char* made = ::mkdtemp(pattern.data());
+  if (made == nullptr) {
+    ADD_FAILURE() << "mkdtemp failed";
+    return;
+  }
+  path_ = made;
+}
+
+TempDir::~TempDir() {
+  std::error_code ignored;
+  if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
+}
+
+bool Eventually(const std::function<bool()>& condition, std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (!condition()) {
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(std::chrono::milliseconds(2));
+  }
+  return true;
+}
+
+void FakeExportedObject::HandleRequest(protocol::Op op, const Array& args, IpcReply reply) {
+  {
+    std::lock_guard lock(mu_);
+    calls_.push_back(Call{op, args});
+  }
+  if (handler_) {
+    handler_(op, args, std::move(reply));
+  } else {
+    DefaultReply(op, args, reply);
+  }
+}
+
+void FakeExportedObject::DefaultReply(protocol::Op op, const Array& args, const IpcReply& reply) {
+  using protocol::Op;
+  switch (op) {
+    case Op::kGetServiceNameForReporterID:
+      reply(Value(static_cast<std::uint16_t>(args[0].as_int64().value_or(0) & 0xFFFF)));
+      return;
+    case Op::kReporterIDValid:
+      reply(Value(Dictionary{{"reporterID", args[0]}, {"serviceType", 7}}));
+      return;
+    case Op::kGetAllReporters:
+      reply(Value(Array{1, 2, 3}));
+      return;
+    case Op::kSendMessage:
+      reply(Value());
+      return;
+    case Op::kKillService:
+      return;
+    default:
+      reply(Value(true));
+      return;
+  }
+}
+
+std::vector<FakeExportedObject::Call> FakeExportedObject::calls() const {
+  std::lock_guard lock(mu_);
+  return calls_;
+}
+
+bool FakeDelegate::ShouldAcceptNewConnection(IpcListener&,
+                                             std::shared_ptr<IpcConnection> connection) {
+  Accepted entry;
+  entry.connection = connection;
+  entry.invalidations = std::make_shared<std::atomic<int>>(0);
+  auto object = std::make_shared<FakeExportedObject>(handler_);
+  entry.object = object;
+  {
+    std::lock_guard lock(mu_);
+    accepted_.push_back(entry);
+  }
+  if (!accept) return false;
+  connection->SetExportedObject(object);
+  connection->SetInvalidationHandler([count = entry.invalidations] { ++*count; });
+  connection->Resume();
+  return true;
+}
+
+std::vector<FakeDelegate::Accepted> FakeDelegate::accepted() const {
+  std::lock_guard lock(mu_);
+  return accepted_;
+}
+
+int FakeDelegate::invalidations() const {
+  std::lock_guard lock(mu_);
+  int total = 0;
+  for (const auto& entry : accepted_) total += *entry.invalidations;
+  return total;
+}
+
+ListenerHarness::ListenerHarness(FakeExportedObject::Handler handler, LinuxIpcOptions options)
+    : delegate_(std::make_shared<FakeDelegate>(std::move(handler))) {
+  socket_path_ = dir_.path() + "/run/reporting.sock";
+  options.socket_path = socket_path_;
+  options.socket_activation = false;
+  options.notify_ready = false;
+  auto made = NewLinuxIpcListener(options, log_);
+  if (!made.listener) {
+    ADD_FAILURE() << "listener: " << made.error;
+    return;
+  }
+  listener_ = made.listener;
+  listener_->SetDelegate(delegate_);
+  thread_ = std::thread([listener = listener_] { listener->Resume(); });
+}
+
+ListenerHarness::~ListenerHarness() { Stop(); }
+
+void ListenerHarness::Stop() {
+  if (!thread_.joinable()) return;
+  listener_->Stop();
+  thread_.join();
+}
+
+RawSocket::RawSocket(const std::string& path) {
+  fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
+  if (::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+    ::close(fd_);
+    fd_ = -1;
+  }
+}
+
+RawSocket::~RawSocket() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
+void RawSocket::Send(const std::string& bytes) {
+  std::size_t sent = 0;
+  while (sent < bytes.size()) {
+    ssize_t n = ::send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return;  // the service may already have closed us; the test checks the rest
+    sent += static_cast<std::size_t>(n);
+  }
+}
+
+void RawSocket::ShutdownWrite() { ::shutdown(fd_, SHUT_WR); }
+
+std::vector<Value> RawSocket::ReadUntilEnd(bool* clean_end) {
+  std::vector<Value> frames;
+  FrameDecoder decoder;
+  bool clean = false;
+  char buffer[65536];
+  while (true) {
+    pollfd p{fd_, POLLIN, 0};
+    if (::poll(&p, 1, 20000) <= 0) break;
+    ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
+    if (n < 0 && errno == EINTR) continue;
+    if (n < 0) break;  // ECONNRESET: the service closed with our bytes unread
+    if (n == 0) {
+      clean = true;
+      break;
+    }
+    decoder.Feed(std::string_view(buffer, static_cast<std::size_t>(n)));
+    while (auto body = decoder.Next()) {
+      auto decoded = DecodeMsgPack(*body);
+      if (auto* value = std::get_if<Value>(&decoded)) frames.push_back(*value);
+    }
+  }
+  if (clean_end) *clean_end = clean;
+  return frames;
+}
+
+std::string RawFrame(const std::string& body) {
+  const auto n = static_cast<std::uint32_t>(body.size());
+  std::string frame = {static_cast<char>(n >> 24), static_cast<char>(n >> 16),
+                       static_cast<char>(n >> 8), static_cast<char>(n)};
+  return frame + body;
+}
+
+std::string EncodedFrame(const Value& value) { return RawFrame(EncodeMsgPack(value)); }
+
+}  // namespace qn::testing

@@ -1,0 +1,83 @@
+// The daemon's and the CLI's folders (common/Paths.h).
+
+#include <gtest/gtest.h>
+
+#include <sys/stat.h>
+
+#include "common/Paths.h"
+#include "tests/ipc/ipc_test_util.h"
+
+namespace qn {
+namespace {
+
+TEST(PathsTest, HomeOptionPutsEverythingUnderIt) {
+  PathEnvironment root;  // uid 0: --home still wins
+  Paths paths = ResolvePaths(PathOptions{"/srv/q/", std::nullopt}, root);
+  EXPECT_EQ(paths.runtime_dir, "/srv/q/run");
+  EXPECT_EQ(paths.state_dir, "/srv/q/state");
+  EXPECT_EQ(paths.log_dir, "/srv/q/log");
+  EXPECT_EQ(paths.socket_path, "/srv/q/run/reporting.sock");
+}
+
+TEST(PathsTest, RootUsesTheSystemFolders) {
+  PathEnvironment root;
+  root.xdg_runtime_dir = "/run/user/0";  // ignored for root
+  Paths paths = ResolvePaths({}, root);
+  EXPECT_EQ(paths.runtime_dir, "/run/quenta");
+  EXPECT_EQ(paths.state_dir, "/var/lib/quenta");
+  EXPECT_EQ(paths.log_dir, "/var/log/quenta");
+  EXPECT_EQ(paths.socket_path, "/run/quenta/reporting.sock");
+}
+
+TEST(PathsTest, OtherUsersUseTheXdgFolders) {
+  PathEnvironment user;
+  user.uid = 1000;
+  user.xdg_runtime_dir = "/run/user/1000";
+  user.xdg_state_home = "/home/u/.state";
+  user.home = "/home/u";
+  Paths paths = ResolvePaths({}, user);
+  EXPECT_EQ(paths.runtime_dir, "/run/user/1000/quenta");
+  EXPECT_EQ(paths.state_dir, "/home/u/.state/quenta");
+  EXPECT_EQ(paths.log_dir, "/home/u/.state/quenta/log");
+  EXPECT_EQ(paths.socket_path, "/run/user/1000/quenta/reporting.sock");
+}
+
+TEST(PathsTest, OtherUsersFallBackWithoutXdgVariables) {
+  PathEnvironment user;
+  user.uid = 1000;
+  user.home = "/home/u";
+  Paths paths = ResolvePaths({}, user);
+  EXPECT_EQ(paths.runtime_dir, "/tmp/quenta-1000");
+  EXPECT_EQ(paths.state_dir, "/home/u/.local/state/quenta");
+  EXPECT_EQ(paths.log_dir, "/home/u/.local/state/quenta/log");
+}
+
+TEST(PathsTest, SocketOptionOverridesOnlyTheSocket) {
+  PathEnvironment user;
+  user.uid = 1000;
+  user.home = "/home/u";
+  Paths paths = ResolvePaths(PathOptions{"/h", "/elsewhere/s.sock"}, user);
+  EXPECT_EQ(paths.socket_path, "/elsewhere/s.sock");
+  EXPECT_EQ(paths.runtime_dir, "/h/run");
+}
+
+TEST(PathsTest, MakeDirectoriesCreatesParentsAndAcceptsExistingOnes) {
+  testing::TempDir dir;
+  const std::string deep = dir.path() + "/a/b/c";
+  EXPECT_EQ(MakeDirectories(deep, 0755), "");
+  struct stat info;
+  ASSERT_EQ(::stat(deep.c_str(), &info), 0);
+  EXPECT_TRUE(S_ISDIR(info.st_mode));
+  EXPECT_EQ(MakeDirectories(deep, 0755), "");
+
+  // A file in the way is an error that names it.
+  const std::string file = dir.path() + "/a/file";
+  FILE* f = std::fopen(file.c_str(), "w");
+  ASSERT_TRUE(f);
+  std::fclose(f);
+  const std::string problem = MakeDirectories(file + "/d", 0755);
+  EXPECT_NE(problem.find(file), std::string::npos) << problem;
+}
+
+}  // namespace
+}  // namespace qn
