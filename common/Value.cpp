@@ -4,8 +4,10 @@
 #include <charconv>
 #include <cmath>
 #include <cstdio>
+#include <cstring>
 #include <ctime>
 #include <functional>
+#include <random>
 
 namespace qn {
 
@@ -256,51 +258,142 @@ bool Value::operator==(const Value& other) const {
   }
 }
 
+namespace {
+
+// Hashing is keyed with a random per-process key (SipHash-1-3), so that a client cannot
+// choose dictionary keys that all land in one bucket of an index and turn lookups linear.
+struct HashKey {
+  std::uint64_t k0, k1;
+};
+
+const HashKey& ProcessHashKey() {
+  static const HashKey key = [] {
+    std::random_device random;
+    auto word = [&random] {
+      return (static_cast<std::uint64_t>(random()) << 32) ^ static_cast<std::uint64_t>(random());
+    };
+    return HashKey{word(), word()};
+  }();
+  return key;
+}
+
+constexpr std::uint64_t Rotl(std::uint64_t x, int b) { return (x << b) | (x >> (64 - b)); }
+
+struct SipState {
+  std::uint64_t v0, v1, v2, v3;
+  void Round() {
+    v0 += v1;
+    v1 = Rotl(v1, 13);
+    v1 ^= v0;
+    v0 = Rotl(v0, 32);
+    v2 += v3;
+    v3 = Rotl(v3, 16);
+    v3 ^= v2;
+    v0 += v3;
+    v3 = Rotl(v3, 21);
+    v3 ^= v0;
+    v2 += v1;
+    v1 = Rotl(v1, 17);
+    v1 ^= v2;
+    v2 = Rotl(v2, 32);
+  }
+  void Absorb(std::uint64_t m) {
+    v3 ^= m;
+    Round();
+    v0 ^= m;
+  }
+};
+
+std::uint64_t SipHash13(const unsigned char* data, std::size_t size) {
+  const HashKey& key = ProcessHashKey();
+  SipState s{key.k0 ^ 0x736f6d6570736575ULL, key.k1 ^ 0x646f72616e646f6dULL,
+             key.k0 ^ 0x6c7967656e657261ULL, key.k1 ^ 0x7465646279746573ULL};
+  std::size_t i = 0;
+  for (; i + 8 <= size; i += 8) {
+    std::uint64_t m = 0;
+    for (int b = 7; b >= 0; --b) m = (m << 8) | data[i + static_cast<std::size_t>(b)];
+    s.Absorb(m);
+  }
+  std::uint64_t last = static_cast<std::uint64_t>(size & 0xff) << 56;
+  for (std::size_t b = 0; i + b < size; ++b) last |= std::uint64_t{data[i + b]} << (8 * b);
+  s.Absorb(last);
+  s.v2 ^= 0xff;
+  s.Round();
+  s.Round();
+  s.Round();
+  return s.v0 ^ s.v1 ^ s.v2 ^ s.v3;
+}
+
+std::uint64_t HashWord(std::uint64_t word, std::uint64_t kind_tag) {
+  unsigned char bytes[16];
+  for (int b = 0; b < 8; ++b) {
+    bytes[b] = static_cast<unsigned char>(word >> (8 * b));
+    bytes[8 + b] = static_cast<unsigned char>(kind_tag >> (8 * b));
+  }
+  return SipHash13(bytes, sizeof bytes);
+}
+
+// Integers and the doubles equal to them share a tag, so that 1.0 finds the key 1.
+constexpr std::uint64_t kNumberTag = 1, kDoubleTag = 2, kBoolTag = 3, kDateTag = 4, kDataTag = 5;
+
+std::uint64_t HashDoubleBits(double d, std::uint64_t tag) {
+  if (std::isnan(d)) return HashWord(0x7ff8000000000000ULL, tag);  // every NaN alike
+  if (d == 0) d = 0;                                               // -0.0 like 0.0
+  std::uint64_t bits;
+  std::memcpy(&bits, &d, sizeof bits);
+  return HashWord(bits, tag);
+}
+
+// Combines keyed hashes (the inputs are already unpredictable without the key).
+std::uint64_t Combine(std::uint64_t h, std::uint64_t next) {
+  h ^= next + 0x9e3779b97f4a7c15ULL + (h << 6) + (h >> 2);
+  h ^= h >> 33;
+  h *= 0xff51afd7ed558ccdULL;
+  h ^= h >> 33;
+  return h;
+}
+
+}  // namespace
+
 std::size_t Value::Hash() const {
-  auto mix = [](std::size_t seed, std::size_t h) {
-    return seed ^ (h + 0x9e3779b97f4a7c15ULL + (seed << 6) + (seed >> 2));
-  };
   switch (kind()) {
     case Kind::kNull:
-      return 0;
+      return HashWord(0, 0);
     case Kind::kBool:
-      return *as_bool() ? 0x51 : 0x50;
+      return HashWord(*as_bool() ? 1 : 0, kBoolTag);
     case Kind::kInt:
-      return std::hash<std::int64_t>()(std::get<std::int64_t>(v_));
+      return HashWord(static_cast<std::uint64_t>(std::get<std::int64_t>(v_)), kNumberTag);
     case Kind::kUInt:
-      return std::hash<std::uint64_t>()(std::get<std::uint64_t>(v_));
+      return HashWord(std::get<std::uint64_t>(v_), kNumberTag);
     case Kind::kDouble: {
-      // Integral doubles hash like the equal integer, so that 1.0 finds the key 1.
-      double d = std::get<double>(v_);
-      if (std::isnan(d)) return 0x7ff8;
+      const double d = std::get<double>(v_);
       if (d == std::trunc(d)) {
         if (d >= -kTwoTo63 && d < kTwoTo63) {
-          return std::hash<std::int64_t>()(static_cast<std::int64_t>(d));
+          return HashWord(static_cast<std::uint64_t>(static_cast<std::int64_t>(d)), kNumberTag);
         }
-        if (d >= 0 && d < kTwoTo64)
-          return std::hash<std::uint64_t>()(static_cast<std::uint64_t>(d));
+        if (d >= 0 && d < kTwoTo64) return HashWord(static_cast<std::uint64_t>(d), kNumberTag);
       }
-      return std::hash<double>()(d);
+      return HashDoubleBits(d, kDoubleTag);
     }
-    case Kind::kString:
-      return std::hash<std::string>()(std::get<std::string>(v_));
+    case Kind::kString: {
+      const std::string& s = std::get<std::string>(v_);
+      return SipHash13(reinterpret_cast<const unsigned char*>(s.data()), s.size());
+    }
     case Kind::kData: {
       const auto& b = as_data()->bytes;
-      return std::hash<std::string_view>()(
-          std::string_view(reinterpret_cast<const char*>(b.data()), b.size()));
+      return Combine(SipHash13(b.data(), b.size()), kDataTag);
     }
-    case Kind::kDate: {
-      double d = as_date()->seconds_since_1970;
-      return std::isnan(d) ? 0x7ff8 : std::hash<double>()(d);
-    }
+    case Kind::kDate:
+      return HashDoubleBits(as_date()->seconds_since_1970, kDateTag);
     case Kind::kArray: {
-      std::size_t h = 0xa77a;
-      for (const Value& v : *as_array()) h = mix(h, v.Hash());
+      std::uint64_t h = HashWord(as_array()->size(), 0xa77a);
+      for (const Value& v : *as_array()) h = Combine(h, v.Hash());
       return h;
     }
     case Kind::kDictionary: {
-      std::size_t h = 0xd1c7;  // order-independent, like equality
-      for (const auto& [k, v] : *as_dictionary()) h += mix(k.Hash(), v.Hash());
+      // Order-independent, like equality.
+      std::uint64_t h = HashWord(as_dictionary()->size(), 0xd1c7);
+      for (const auto& [k, v] : *as_dictionary()) h += Combine(k.Hash(), v.Hash());
       return h;
     }
   }

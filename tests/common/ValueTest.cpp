@@ -5,6 +5,7 @@
 #include <cmath>
 #include <limits>
 #include <string>
+#include <unordered_set>
 
 namespace qn {
 namespace {
@@ -138,6 +139,16 @@ TEST(ValueTest, LargeDictionaryIndexSurvivesErase) {
   EXPECT_EQ(d.size(), 15u);
   EXPECT_EQ(*d.Find(Value(19)), Value(38));
   EXPECT_EQ(d.Find(Value(5)), nullptr);
+}
+
+// Keys a client picks to share one bucket of a known bucket count (multiples of it) must
+// still spread out, or a large map's index degrades to a linear scan per insertion.
+TEST(ValueTest, HashSpreadsKeysChosenToCollide) {
+  for (std::uint64_t buckets : {1031u, 42043u, 116731u}) {
+    std::unordered_set<std::size_t> used;
+    for (std::uint64_t i = 1; i <= 1000; ++i) used.insert(Value(i * buckets).Hash() % buckets);
+    EXPECT_GT(used.size(), 500u) << buckets;
+  }
 }
 
 TEST(ValueTest, CollectionEqualityIgnoresDictionaryOrderOnly) {
