@@ -2,12 +2,31 @@
 
 #include <cstddef>
 #include <memory>
+#include <mutex>
+#include <vector>
 
 #include "platform/dispatch.h"
 #include "platform/log.h"
 #include "platform/platform.h"
 
 namespace qn {
+
+class QNReportingSession;
+
+// Every session the service has made, held weakly, so that an orderly shutdown can wait for
+// the work still queued on the queues of the sessions that are alive. Expired entries are
+// pruned as sessions are added. Safe from any thread.
+class QNReportingSessionRegistry {
+ public:
+  void Add(const std::shared_ptr<QNReportingSession>& session);
+  // The sessions still alive, in the order they were made.
+  std::vector<std::shared_ptr<QNReportingSession>> Alive() const;
+
+ private:
+  mutable std::mutex mu_;
+  std::vector<std::weak_ptr<QNReportingSession>> sessions_;  // GUARDED_BY(mu_)
+  std::size_t pruneAt_ = 64;                                 // GUARDED_BY(mu_)
+};
 
 // The process-wide state of the service front, made once by the service delegate and
 // shared with every server instance: the platform, the one serial server queue on which
@@ -24,6 +43,10 @@ struct QNReportingServerContext {
   // daemon's memory. Replacing an existing ID is always allowed.
   static constexpr std::size_t kDefaultMaxSessionsPerClient = 16384;
   std::size_t maxSessionsPerClient = kDefaultMaxSessionsPerClient;
+
+  // The sessions made by every server instance. Never null.
+  std::shared_ptr<QNReportingSessionRegistry> sessions =
+      std::make_shared<QNReportingSessionRegistry>();
 
   Log& log() const { return *platform->log; }
   const LogScope* scope() const { return logScope.get(); }

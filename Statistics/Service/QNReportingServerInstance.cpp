@@ -66,6 +66,26 @@ bool QNReportingSessionMap::Erase(std::int64_t reporterID) {
 }
 
 // ---------------------------------------------------------------------------------------
+// QNReportingSessionRegistry
+
+void QNReportingSessionRegistry::Add(const std::shared_ptr<QNReportingSession>& session) {
+  std::lock_guard lock(mu_);
+  sessions_.push_back(session);
+  if (sessions_.size() < pruneAt_) return;
+  std::erase_if(sessions_, [](const auto& weak) { return weak.expired(); });
+  pruneAt_ = std::max<std::size_t>(64, sessions_.size() * 2);
+}
+
+std::vector<std::shared_ptr<QNReportingSession>> QNReportingSessionRegistry::Alive() const {
+  std::lock_guard lock(mu_);
+  std::vector<std::shared_ptr<QNReportingSession>> alive;
+  for (const auto& weak : sessions_) {
+    if (auto session = weak.lock()) alive.push_back(std::move(session));
+  }
+  return alive;
+}
+
+// ---------------------------------------------------------------------------------------
 // QNReportingServerInstance
 
 std::shared_ptr<QNReportingServerInstance> QNReportingServerInstance::initWithPID(
@@ -141,6 +161,7 @@ void QNReportingServerInstance::createReportingSession(std::int64_t reporterID, 
                                                Array{Value(self.processIdentifier_)});
     }
     if (session) {
+      ctx.sessions->Add(session);
       self.sessions_.Set(reporterID, std::move(session));
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault,
              "%s:%d:%s: session created for reporter %lli", reporterID);

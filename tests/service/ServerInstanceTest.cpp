@@ -520,3 +520,25 @@ TEST_F(ServerInstanceTest, RequestsThroughTheConnectionsExportedObject) {
 
 }  // namespace
 }  // namespace qn
+
+namespace qn {
+namespace {
+
+TEST_F(ServerInstanceTest, TheSessionRegistryListsTheSessionsStillAlive) {
+  Client a = h_.Connect(100);
+  Client b = h_.Connect(200);
+  for (std::int64_t id : {1, 2, 3}) Create(a, id);
+  Create(b, 4);
+  BoolReplies r;
+  a->destroyReportingSession(2, r.Callback());
+  a->createReportingSession(3, r.Callback());  // the replaced session goes too
+  h_.Run();
+  std::vector<std::int64_t> ids;
+  for (const auto& session : h_.delegate->context().sessions->Alive()) {
+    ids.push_back(session->reporterID());
+  }
+  EXPECT_THAT(ids, ElementsAre(1, 4, 3));
+}
+
+}  // namespace
+}  // namespace qn
