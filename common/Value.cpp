@@ -245,6 +245,8 @@ bool Value::operator==(const Value& other) const {
   }
   if (kind() != other.kind()) return false;
   switch (kind()) {
+    case Kind::kString:  // the common case of key lookups: no variant visit
+      return std::get<std::string>(v_) == std::get<std::string>(other.v_);
     case Kind::kArray:
       return as_array() == other.as_array() || *as_array() == *other.as_array();
     case Kind::kDictionary:
