@@ -209,7 +209,10 @@ class Decoder {
 
   bool Fail(ConnectionError code, std::size_t offset, const std::string& what) {
     problem_.code = code;
-    problem_.message = StringWithFormat("bad MessagePack at byte %zu: %s", offset, what);
+    problem_.message = StringWithFormat(
+        "%s at byte %zu: %s",
+        code == ConnectionError::kTooDeep ? "MessagePack too deep" : "bad MessagePack", offset,
+        what);
     return false;
   }
 
@@ -279,7 +282,7 @@ class Decoder {
   bool DecodeArray(std::size_t start, std::size_t n, int depth, Value& out) {
     if (depth >= protocol::kMaxDepth) {
       return Fail(ConnectionError::kTooDeep, start,
-                  StringWithFormat("nesting deeper than %d", protocol::kMaxDepth));
+                  StringWithFormat("more than %d levels of arrays and maps", protocol::kMaxDepth));
     }
     if (n > Remaining()) {
       return Fail(ConnectionError::kBadMessagePack, start,
@@ -298,7 +301,7 @@ class Decoder {
   bool DecodeMap(std::size_t start, std::size_t n, int depth, Value& out) {
     if (depth >= protocol::kMaxDepth) {
       return Fail(ConnectionError::kTooDeep, start,
-                  StringWithFormat("nesting deeper than %d", protocol::kMaxDepth));
+                  StringWithFormat("more than %d levels of arrays and maps", protocol::kMaxDepth));
     }
     if (n > Remaining() / 2) {
       return Fail(ConnectionError::kBadMessagePack, start,

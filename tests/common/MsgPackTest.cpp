@@ -294,6 +294,8 @@ TEST(MsgPackTest, NestingIsLimitedTo64Levels) {
     RequestProblem problem = MustFail(body);
     EXPECT_EQ(problem.code, ConnectionError::kTooDeep) << problem.message;
   }
+  EXPECT_EQ(MustFail(NestedArrays(65)).message,
+            "MessagePack too deep at byte 64: more than 64 levels of arrays and maps");
   // Depth counts map keys too: a 64-deep array used as a key one level down.
   std::string key_too_deep = Bytes({0x81}) + NestedArrays(64) + Bytes({0xc0});
   EXPECT_EQ(MustFail(key_too_deep).code, ConnectionError::kTooDeep);
