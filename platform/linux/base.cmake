@@ -12,7 +12,7 @@ qn_library(qn_linux_base
     linux_ostrel.cpp
     linux_notify.cpp
     linux_defaults.cpp
-    linux_json.cpp
+    small_file.cpp
 )
 if(QN_SANITIZE STREQUAL "thread" AND TARGET qn_linux_base)
   # asio uses std::atomic_thread_fence, which GCC flags under TSan (-Wtsan); the fence is

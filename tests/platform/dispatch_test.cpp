@@ -54,17 +54,26 @@ TEST(LinuxDispatchTest, BusyQueueYieldsToOthersOnASingleThread) {
   std::atomic<int> flood_when_other_ran{-1};
   Counter finished;
 
-  flood->Suspend();
+  std::atomic<bool> other_submitted{false};
+
+  // The flood's first task holds the only thread until `other` has work, so that the
+  // flood cannot finish before `other` even asks for the thread.
+  flood->Async([&] {
+    const auto give_up = std::chrono::steady_clock::now() + testing::kPatience;
+    while (!other_submitted && std::chrono::steady_clock::now() < give_up) {
+      std::this_thread::yield();
+    }
+  });
   for (int i = 0; i < kFlood; ++i) {
     flood->Async([&] {
       if (flood_ran.fetch_add(1) + 1 == kFlood) finished.Add();
     });
   }
-  flood->Resume();  // its first turn is now queued on the pool, ahead of `other`
   other->Async([&] {
     flood_when_other_ran = flood_ran.load();
     finished.Add();
   });
+  other_submitted = true;
   ASSERT_TRUE(finished.WaitFor(2));
   EXPECT_LT(flood_when_other_ran.load(), kFlood) << "a busy queue kept the only thread";
 }

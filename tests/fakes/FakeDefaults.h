@@ -1,0 +1,31 @@
+#pragma once
+
+#include <map>
+#include <memory>
+#include <mutex>
+#include <string>
+
+#include "common/Value.h"
+#include "platform/defaults.h"
+
+namespace qn::testing {
+
+// In-memory user-defaults suites. OpenSuite takes a snapshot, as the Linux suites do, and
+// reads values the same way (the defaults contract tests run against both). Thread-safe.
+class FakeDefaults final : public Defaults {
+ public:
+  std::unique_ptr<DefaultsSuite> OpenSuite(const std::string& suite_name) override;
+
+  void Set(const std::string& suite, const std::string& key, Value value);
+  void Remove(const std::string& suite, const std::string& key);
+  void ClearSuite(const std::string& suite);
+  // How many times the suite was opened.
+  int Opens(const std::string& suite) const;
+
+ private:
+  mutable std::mutex mu_;
+  std::map<std::string, Dictionary> suites_;
+  std::map<std::string, int> opens_;
+};
+
+}  // namespace qn::testing

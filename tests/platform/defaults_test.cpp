@@ -1,0 +1,206 @@
+#include <gtest/gtest.h>
+
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <thread>
+#include <vector>
+
+#include "common/Json.h"
+#include "platform/linux/linux_defaults.h"
+#include "tests/fakes/FakeDefaults.h"
+#include "tests/fakes/LogCapture.h"
+#include "tests/platform/test_util.h"
+
+namespace qn {
+namespace {
+
+constexpr const char* kSuite = "com.norvel.quenta";
+
+struct LinuxDefaultsHarness {
+  testing::TempDir dir;
+  std::shared_ptr<testing::LogCapture> log = std::make_shared<testing::LogCapture>();
+  std::shared_ptr<Defaults> defaults = NewLinuxDefaults({.state_dir = dir.str(), .log = log});
+
+  void Set(const std::string& suite, const std::string& key, Value value) {
+    ASSERT_EQ(WriteDefault(dir.str(), suite, key, value), std::nullopt);
+  }
+  void Remove(const std::string& suite, const std::string& key) {
+    ASSERT_EQ(DeleteDefault(dir.str(), suite, key), std::nullopt);
+  }
+};
+
+struct FakeDefaultsHarness {
+  std::shared_ptr<testing::FakeDefaults> fake = std::make_shared<testing::FakeDefaults>();
+  std::shared_ptr<Defaults> defaults = fake;
+
+  void Set(const std::string& suite, const std::string& key, Value value) {
+    fake->Set(suite, key, std::move(value));
+  }
+  void Remove(const std::string& suite, const std::string& key) { fake->Remove(suite, key); }
+};
+
+template <typename Harness>
+class DefaultsContractTest : public ::testing::Test {
+ protected:
+  Harness h_;
+};
+
+using Harnesses = ::testing::Types<LinuxDefaultsHarness, FakeDefaultsHarness>;
+TYPED_TEST_SUITE(DefaultsContractTest, Harnesses);
+
+TYPED_TEST(DefaultsContractTest, BoolReadings) {
+  const std::vector<std::pair<Value, bool>> cases = {
+      {"YES", true},     {"yes", true},
+      {"true", true},    {"TRUE", true},
+      {"1", true},       {"2 cats", true},
+      {" -3", true},     {"0", false},
+      {"00", false},     {"no", false},
+      {"false", false},  {"", false},
+      {"Y", false},      {0, false},
+      {2, true},         {-1, true},
+      {0.0, false},      {0.25, true},
+      {true, true},      {false, false},
+      {Array{1}, false}, {Dictionary{{"a", 1}}, false},
+      {nullptr, false},
+  };
+  for (std::size_t i = 0; i < cases.size(); ++i) {
+    this->h_.Set(kSuite, "key" + std::to_string(i), cases[i].first);
+  }
+  auto suite = this->h_.defaults->OpenSuite(kSuite);
+  for (std::size_t i = 0; i < cases.size(); ++i) {
+    EXPECT_EQ(suite->BoolForKey("key" + std::to_string(i)), cases[i].second)
+        << cases[i].first.Description();
+  }
+  EXPECT_FALSE(suite->BoolForKey("absent"));
+}
+
+TYPED_TEST(DefaultsContractTest, StringAndObjectReadings) {
+  this->h_.Set(kSuite, "device_name", "Kitchen");
+  this->h_.Set(kSuite, "number", 42);
+  this->h_.Set(kSuite, "flag", true);
+  auto suite = this->h_.defaults->OpenSuite(kSuite);
+  EXPECT_EQ(suite->StringForKey("device_name"), "Kitchen");
+  EXPECT_EQ(suite->StringForKey("number"), "42");
+  EXPECT_EQ(suite->StringForKey("flag"), std::nullopt);
+  EXPECT_EQ(suite->StringForKey("absent"), std::nullopt);
+  EXPECT_EQ(suite->ObjectForKey("number"), Value(42));
+  EXPECT_EQ(suite->ObjectForKey("absent"), std::nullopt);
+}
+
+TYPED_TEST(DefaultsContractTest, SuitesAreSnapshotsAndSeparate) {
+  this->h_.Set(kSuite, "disable_reporting", "YES");
+  auto before = this->h_.defaults->OpenSuite(kSuite);
+  this->h_.Remove(kSuite, "disable_reporting");
+  this->h_.Set("other.suite", "disable_reporting", true);
+  auto after = this->h_.defaults->OpenSuite(kSuite);
+  EXPECT_TRUE(before->BoolForKey("disable_reporting"));
+  EXPECT_FALSE(after->BoolForKey("disable_reporting"));
+  EXPECT_EQ(after->ObjectForKey("disable_reporting"), std::nullopt);
+  EXPECT_TRUE(this->h_.defaults->OpenSuite("other.suite")->BoolForKey("disable_reporting"));
+  EXPECT_EQ(this->h_.defaults->OpenSuite("never.written")->ObjectForKey("x"), std::nullopt);
+}
+
+class LinuxDefaultsTest : public ::testing::Test {
+ protected:
+  std::string SuitePath() const { return DefaultsSuitePath(dir_.str(), kSuite); }
+  std::string FileText() const {
+    std::ifstream in(SuitePath());
+    std::stringstream text;
+    text << in.rdbuf();
+    return text.str();
+  }
+
+  testing::TempDir dir_;
+  std::shared_ptr<testing::LogCapture> log_ = std::make_shared<testing::LogCapture>();
+  std::shared_ptr<Defaults> defaults_ = NewLinuxDefaults({.state_dir = dir_.str(), .log = log_});
+};
+
+TEST_F(LinuxDefaultsTest, WritesOneJsonObjectPerSuite) {
+  ASSERT_EQ(WriteDefault(dir_.str(), kSuite, "device_name", "Kitchen"), std::nullopt);
+  ASSERT_EQ(WriteDefault(dir_.str(), kSuite, "disable_reporting", 1), std::nullopt);
+  EXPECT_EQ(SuitePath(), dir_.str() + "/defaults/com.norvel.quenta.json");
+  Value parsed;
+  ASSERT_EQ(ParseJson(FileText(), parsed), std::nullopt);
+  EXPECT_EQ(parsed, Value(Dictionary{{"device_name", "Kitchen"}, {"disable_reporting", 1}}));
+
+  Dictionary read;
+  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  EXPECT_EQ(read, *parsed.as_dictionary());
+  ASSERT_EQ(DeleteDefault(dir_.str(), kSuite, "device_name"), std::nullopt);
+  ASSERT_EQ(DeleteDefault(dir_.str(), kSuite, "never-there"), std::nullopt);
+  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  EXPECT_EQ(read, (Dictionary{{"disable_reporting", 1}}));
+  // Only the suite and its lock file are left in the folder: no temporary files.
+  int files = 0;
+  for (const auto& entry : std::filesystem::directory_iterator(dir_.path() / "defaults")) {
+    (void)entry;
+    ++files;
+  }
+  EXPECT_EQ(files, 2);
+}
+
+TEST_F(LinuxDefaultsTest, MissingSuiteReadsEmptyWithoutAnError) {
+  Dictionary read{{"stale", 1}};
+  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  EXPECT_TRUE(read.empty());
+  EXPECT_FALSE(defaults_->OpenSuite(kSuite)->BoolForKey("disable_reporting"));
+  EXPECT_TRUE(log_->Lines().empty()) << "a missing suite is logged at debug level only";
+}
+
+TEST_F(LinuxDefaultsTest, MalformedSuiteReadsEmptyAndIsNotOverwritten) {
+  std::filesystem::create_directories(dir_.path() / "defaults");
+  std::ofstream(SuitePath()) << "{\"disable_reporting\": YES}";
+  auto suite = defaults_->OpenSuite(kSuite);
+  EXPECT_EQ(suite->ObjectForKey("disable_reporting"), std::nullopt);
+  ASSERT_EQ(log_->Lines().size(), 1u);
+  EXPECT_EQ(log_->Lines()[0].level, LogLevel::kError);
+
+  Dictionary read;
+  auto error = ReadSuite(dir_.str(), kSuite, read);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->domain, kDefaultsErrorDomain);
+  EXPECT_TRUE(WriteDefault(dir_.str(), kSuite, "device_name", "x"));
+  EXPECT_EQ(FileText(), "{\"disable_reporting\": YES}");
+}
+
+TEST_F(LinuxDefaultsTest, ValuesWithoutJsonFormAreRefused) {
+  ASSERT_EQ(WriteDefault(dir_.str(), kSuite, "a", 1), std::nullopt);
+  const std::string before = FileText();
+  EXPECT_TRUE(WriteDefault(dir_.str(), kSuite, "blob", Data{{1, 2, 3}}));
+  EXPECT_EQ(FileText(), before);
+}
+
+TEST_F(LinuxDefaultsTest, SuiteNamesCannotLeaveTheFolder) {
+  for (const std::string& name :
+       std::vector<std::string>{"", "../escape", "a/b", ".hidden", std::string(201, 'x')}) {
+    Dictionary read;
+    auto error = ReadSuite(dir_.str(), name, read);
+    ASSERT_TRUE(error) << name;
+    EXPECT_EQ(error->code, static_cast<std::int64_t>(DefaultsErrorCode::kInvalidSuiteName));
+    EXPECT_TRUE(WriteDefault(dir_.str(), name, "k", 1)) << name;
+    EXPECT_EQ(defaults_->OpenSuite(name)->ObjectForKey("k"), std::nullopt);
+  }
+  EXPECT_FALSE(std::filesystem::exists(dir_.path() / "escape.json"));
+}
+
+TEST_F(LinuxDefaultsTest, ConcurrentWritersAllLand) {
+  constexpr int kWriters = 4;
+  constexpr int kKeys = 25;
+  std::vector<std::thread> writers;
+  for (int w = 0; w < kWriters; ++w) {
+    writers.emplace_back([&, w] {
+      for (int k = 0; k < kKeys; ++k) {
+        EXPECT_EQ(WriteDefault(dir_.str(), kSuite, std::to_string(w) + "." + std::to_string(k), k),
+                  std::nullopt);
+      }
+    });
+  }
+  for (auto& t : writers) t.join();
+  Dictionary read;
+  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  EXPECT_EQ(read.size(), static_cast<std::size_t>(kWriters * kKeys));
+}
+
+}  // namespace
+}  // namespace qn

@@ -1,0 +1,199 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <filesystem>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "platform/linux/linux_dispatch.h"
+#include "platform/linux/linux_notify.h"
+#include "tests/fakes/FakeNotify.h"
+#include "tests/platform/test_util.h"
+
+namespace qn {
+namespace {
+
+constexpr const char* kName = "com.norvel.quenta.reporting";
+
+// What a handler saw: the token it was given and whether it ran on its queue.
+struct Deliveries {
+  std::mutex mu;
+  std::vector<int> tokens;
+  bool off_queue = false;
+  testing::Counter count;
+
+  std::function<void(int)> Handler(std::shared_ptr<SerialQueue> queue) {
+    return [this, queue](int token) {
+      {
+        std::lock_guard lock(mu);
+        tokens.push_back(token);
+        off_queue = off_queue || !queue->IsCurrent();
+      }
+      count.Add();
+    };
+  }
+};
+
+struct LinuxNotifyHarness {
+  testing::TempDir dir;
+  std::shared_ptr<Notify> notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+};
+
+struct FakeNotifyHarness {
+  std::shared_ptr<Notify> notify = std::make_shared<testing::FakeNotify>();
+};
+
+template <typename Harness>
+class NotifyContractTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<Dispatcher> dispatcher_ = NewLinuxDispatcher();
+  std::shared_ptr<SerialQueue> queue_ =
+      dispatcher_->CreateSerialQueue("server", QualityOfService::kUserInteractive);
+  Harness h_;
+};
+
+using Harnesses = ::testing::Types<LinuxNotifyHarness, FakeNotifyHarness>;
+TYPED_TEST_SUITE(NotifyContractTest, Harnesses);
+
+TYPED_TEST(NotifyContractTest, PostRunsTheHandlerOnItsQueueWithItsToken) {
+  Deliveries seen;
+  Deliveries other;
+  int token = 0;
+  int other_token = 0;
+  Notify& notify = *this->h_.notify;
+  ASSERT_EQ(notify.Register(kName, this->queue_, seen.Handler(this->queue_), &token), 0u);
+  ASSERT_EQ(notify.Register("other.name", this->queue_, other.Handler(this->queue_), &other_token),
+            0u);
+  EXPECT_NE(token, other_token);
+
+  ASSERT_EQ(notify.Post(kName), 0u);
+  ASSERT_TRUE(seen.count.WaitFor(1));
+  {
+    std::lock_guard lock(seen.mu);
+    EXPECT_EQ(seen.tokens, std::vector<int>{token});
+    EXPECT_FALSE(seen.off_queue);
+  }
+  // A second post is delivered again; the other name never is.
+  ASSERT_EQ(notify.Post(kName), 0u);
+  ASSERT_TRUE(seen.count.WaitFor(2));
+  EXPECT_EQ(other.count.value(), 0);
+}
+
+TYPED_TEST(NotifyContractTest, EveryRegistrationOfTheNameIsWoken) {
+  Deliveries a;
+  Deliveries b;
+  int token_a = 0;
+  int token_b = 0;
+  auto queue_b = this->dispatcher_->CreateSerialQueue("b", QualityOfService::kUtility);
+  Notify& notify = *this->h_.notify;
+  ASSERT_EQ(notify.Register(kName, this->queue_, a.Handler(this->queue_), &token_a), 0u);
+  ASSERT_EQ(notify.Register(kName, queue_b, b.Handler(queue_b), &token_b), 0u);
+  ASSERT_EQ(notify.Post(kName), 0u);
+  ASSERT_TRUE(a.count.WaitFor(1));
+  ASSERT_TRUE(b.count.WaitFor(1));
+  std::lock_guard lock(b.mu);
+  EXPECT_EQ(b.tokens, std::vector<int>{token_b});
+  EXPECT_FALSE(b.off_queue);
+}
+
+TYPED_TEST(NotifyContractTest, CancelledRegistrationsHearNothing) {
+  Deliveries cancelled;
+  Deliveries kept;
+  int cancelled_token = 0;
+  int kept_token = 0;
+  Notify& notify = *this->h_.notify;
+  ASSERT_EQ(notify.Register(kName, this->queue_, cancelled.Handler(this->queue_), &cancelled_token),
+            0u);
+  ASSERT_EQ(notify.Register(kName, this->queue_, kept.Handler(this->queue_), &kept_token), 0u);
+  notify.Cancel(cancelled_token);
+  ASSERT_EQ(notify.Post(kName), 0u);
+  ASSERT_TRUE(kept.count.WaitFor(1));
+  // Both handlers would have been queued on the same serial queue, cancelled one first.
+  testing::Counter drained;
+  this->queue_->Async([&] { drained.Add(); });
+  ASSERT_TRUE(drained.WaitFor(1));
+  EXPECT_EQ(cancelled.count.value(), 0);
+}
+
+TYPED_TEST(NotifyContractTest, BadRegistrationsAreRefused) {
+  Notify& notify = *this->h_.notify;
+  int token = -7;
+  EXPECT_NE(notify.Register(
+                "", this->queue_, [](int) {}, &token),
+            0u);
+  EXPECT_NE(notify.Register(
+                kName, nullptr, [](int) {}, &token),
+            0u);
+  EXPECT_EQ(token, -7);
+}
+
+TEST(LinuxNotifyTest, PostingTouchesAFileThatOtherProcessesSee) {
+  testing::TempDir dir;
+  auto dispatcher = NewLinuxDispatcher();
+  auto queue = dispatcher->CreateSerialQueue("server", QualityOfService::kUserInteractive);
+  auto notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+  Deliveries seen;
+  int token = 0;
+  ASSERT_EQ(notify->Register(kName, queue, seen.Handler(queue), &token), 0u);
+  // The command-line tool posts without a Notify object, from its own process.
+  const pid_t child = ::fork();
+  if (child == 0) ::_exit(PostNotification(dir.str(), kName) == 0 ? 0 : 1);
+  int status = 0;
+  ASSERT_EQ(::waitpid(child, &status, 0), child);
+  ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
+  ASSERT_TRUE(seen.count.WaitFor(1));
+  EXPECT_TRUE(std::filesystem::is_regular_file(dir.path() / "notify" / kName));
+}
+
+TEST(LinuxNotifyTest, NamesCannotLeaveTheFolder) {
+  testing::TempDir dir;
+  for (const std::string& name :
+       std::vector<std::string>{"", ".", "..", "../x", "a/b", std::string(300, 'n')}) {
+    EXPECT_EQ(PostNotification(dir.str(), name), kNotifyStatusInvalidName) << name;
+  }
+  EXPECT_FALSE(std::filesystem::exists(dir.path() / "x"));
+}
+
+TEST(LinuxNotifyTest, PostingWithNobodyWatchingSucceeds) {
+  testing::TempDir dir;
+  EXPECT_EQ(PostNotification(dir.str(), kName), 0u);
+  EXPECT_FALSE(std::filesystem::exists(dir.path() / "notify"));
+}
+
+TEST(LinuxNotifyTest, AFifoUnderTheNameDoesNotHangThePoster) {
+  testing::TempDir dir;
+  auto notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+  auto dispatcher = NewLinuxDispatcher();
+  int token = 0;
+  ASSERT_EQ(notify->Register(
+                kName, dispatcher->CreateSerialQueue("q", QualityOfService::kUtility), [](int) {},
+                &token),
+            0u);
+  ASSERT_EQ(::mkfifo((dir.str() + "/notify/fifo").c_str(), 0644), 0);
+  EXPECT_EQ(notify->Post("fifo"), kNotifyStatusFailed);
+}
+
+TEST(LinuxNotifyTest, WatchSurvivesTheFolderBeingRemoved) {
+  testing::TempDir dir;
+  auto dispatcher = NewLinuxDispatcher();
+  auto queue = dispatcher->CreateSerialQueue("server", QualityOfService::kUserInteractive);
+  auto notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+  Deliveries seen;
+  int token = 0;
+  ASSERT_EQ(notify->Register(kName, queue, seen.Handler(queue), &token), 0u);
+  std::filesystem::remove_all(dir.path() / "notify");
+  // The watch thread puts the folder back; posts made after that are seen.
+  const auto give_up = std::chrono::steady_clock::now() + testing::kPatience;
+  while (seen.count.value() == 0 && std::chrono::steady_clock::now() < give_up) {
+    notify->Post(kName);
+    seen.count.WaitFor(1, std::chrono::milliseconds(20));
+  }
+  EXPECT_GE(seen.count.value(), 1);
+}
+
+}  // namespace
+}  // namespace qn

@@ -1,0 +1,274 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cerrno>
+#include <filesystem>
+#include <fstream>
+#include <string>
+#include <vector>
+
+#include "platform/linux/linux_ostrel.h"
+#include "tests/fakes/FakeOstrel.h"
+#include "tests/platform/test_util.h"
+
+namespace qn {
+namespace {
+
+namespace fs = std::filesystem;
+
+struct LinuxOstrelHarness {
+  testing::TempDir dir;
+  std::shared_ptr<Ostrel> ostrel = NewLinuxOstrel(dir.str());
+
+  void AddGroup(const std::string& g, const std::string& s) {
+    fs::create_directories(dir.path() / g / s);
+  }
+  void SetCounter(const std::string& g, const std::string& s, const std::string& c,
+                  std::int64_t value) {
+    AddGroup(g, s);
+    std::ofstream(dir.path() / g / s / c) << value << "\n";
+  }
+  void RemoveCounter(const std::string& g, const std::string& s, const std::string& c) {
+    fs::remove(dir.path() / g / s / c);
+  }
+};
+
+struct FakeOstrelHarness {
+  std::shared_ptr<testing::FakeOstrel> fake = std::make_shared<testing::FakeOstrel>();
+  std::shared_ptr<Ostrel> ostrel = fake;
+
+  void AddGroup(const std::string& g, const std::string& s) { fake->AddGroup(g, s); }
+  void SetCounter(const std::string& g, const std::string& s, const std::string& c,
+                  std::int64_t value) {
+    fake->SetCounter(g, s, c, value);
+  }
+  void RemoveCounter(const std::string& g, const std::string& s, const std::string& c) {
+    fake->RemoveCounter(g, s, c);
+  }
+};
+
+template <typename Harness>
+class OstrelContractTest : public ::testing::Test {
+ protected:
+  Ostrel& ostrel() { return *h_.ostrel; }
+
+  // Looks up and subscribes, as the driver utility does.
+  struct Subscribed {
+    std::shared_ptr<OstrelSubscription> subscription;
+    Dictionary channels;
+  };
+  Subscribed Subscribe(std::optional<std::string> group, std::optional<std::string> subgroup) {
+    std::optional<OstrelError> error;
+    auto channels = ostrel().CopyChannelsInGroup(group, subgroup, 0, &error);
+    EXPECT_FALSE(error);
+    Subscribed s;
+    if (channels) s.subscription = ostrel().CreateSubscription(*channels, &s.channels);
+    return s;
+  }
+  // name -> value of a samples dictionary, in the library's order.
+  std::vector<std::pair<std::string, std::int64_t>> Walk(const Dictionary& samples) {
+    std::vector<std::pair<std::string, std::int64_t>> out;
+    ostrel().Iterate(samples, [&](const Value& sample) {
+      out.emplace_back(ostrel().ChannelGetChannelName(sample).value_or("?"),
+                       ostrel().SimpleGetIntegerValue(sample, 0));
+      return 0;
+    });
+    return out;
+  }
+
+  Harness h_;
+};
+
+using Harnesses = ::testing::Types<LinuxOstrelHarness, FakeOstrelHarness>;
+TYPED_TEST_SUITE(OstrelContractTest, Harnesses);
+
+TYPED_TEST(OstrelContractTest, AbsentNamesInALookupMatchAny) {
+  this->h_.SetCounter("Speaker", "A", "x", 1);
+  this->h_.SetCounter("Speaker", "B", "y", 2);
+  this->h_.SetCounter("Haptics", "Stats", "z", 3);
+  this->h_.SetCounter("Other", "MCA", "w", 4);
+  this->h_.SetCounter("NorvelKT5MCA", "MCA", "v", 5);
+  this->h_.AddGroup("Empty", "Nothing");
+  auto count = [&](std::optional<std::string> g, std::optional<std::string> s) {
+    std::optional<OstrelError> error;
+    auto channels = this->ostrel().CopyChannelsInGroup(g, s, 0, &error);
+    EXPECT_FALSE(error);
+    return channels ? this->ostrel().GetChannelCount(*channels) : -1;
+  };
+  EXPECT_EQ(count("Speaker", std::nullopt), 2);
+  EXPECT_EQ(count(std::nullopt, "MCA"), 2);
+  EXPECT_EQ(count("Haptics", "Stats"), 1);
+  EXPECT_EQ(count(std::nullopt, std::nullopt), 5);
+  EXPECT_EQ(count("Empty", std::nullopt), 0) << "an existing group without channels";
+  EXPECT_EQ(count("Missing", std::nullopt), -1);
+  EXPECT_EQ(count("Speaker", "Missing"), -1);
+}
+
+TYPED_TEST(OstrelContractTest, SamplesAndDeltasFollowTheCounters) {
+  this->h_.SetCounter("Haptics", "Stats", "Underruns", 10);
+  this->h_.SetCounter("Haptics", "Stats", "Overruns", 7);
+  auto s = this->Subscribe("Haptics", "Stats");
+  ASSERT_TRUE(s.subscription);
+  ASSERT_EQ(this->ostrel().GetChannelCount(s.channels), 2);
+
+  std::optional<OstrelError> error;
+  auto earlier = this->ostrel().CreateSamples(s.subscription.get(), s.channels, &error);
+  ASSERT_TRUE(earlier);
+  ASSERT_FALSE(error);
+  EXPECT_EQ(this->Walk(*earlier), (std::vector<std::pair<std::string, std::int64_t>>{
+                                      {"Overruns", 7}, {"Underruns", 10}}));
+
+  this->h_.SetCounter("Haptics", "Stats", "Underruns", 25);
+  this->h_.SetCounter("Haptics", "Stats", "Overruns", 3);  // went down
+  auto later = this->ostrel().CreateSamples(s.subscription.get(), s.channels, &error);
+  ASSERT_TRUE(later);
+  auto delta = this->ostrel().CreateSamplesDelta(&*earlier, *later, &error);
+  ASSERT_TRUE(delta);
+  ASSERT_FALSE(error);
+  EXPECT_EQ(this->Walk(*delta), (std::vector<std::pair<std::string, std::int64_t>>{
+                                    {"Overruns", -4}, {"Underruns", 15}}));
+}
+
+TYPED_TEST(OstrelContractTest, DeltaNeedsEveryEarlierSample) {
+  this->h_.SetCounter("Speaker", "Amp", "Clips", 1);
+  auto s = this->Subscribe("Speaker", std::nullopt);
+  std::optional<OstrelError> error;
+  auto later = this->ostrel().CreateSamples(s.subscription.get(), s.channels, &error);
+  ASSERT_TRUE(later);
+
+  EXPECT_EQ(this->ostrel().CreateSamplesDelta(nullptr, *later, &error), std::nullopt);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, ENODATA);
+
+  error.reset();
+  const Dictionary lacking;
+  EXPECT_EQ(this->ostrel().CreateSamplesDelta(&lacking, *later, &error), std::nullopt);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, ENODATA);
+}
+
+TYPED_TEST(OstrelContractTest, SamplingFailsWithACode) {
+  this->h_.SetCounter("Speaker", "Amp", "Clips", 1);
+  auto s = this->Subscribe("Speaker", std::nullopt);
+  std::optional<OstrelError> error;
+  EXPECT_EQ(this->ostrel().CreateSamples(nullptr, s.channels, &error), std::nullopt);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, EBADF);
+
+  this->h_.RemoveCounter("Speaker", "Amp", "Clips");
+  error.reset();
+  EXPECT_EQ(this->ostrel().CreateSamples(s.subscription.get(), s.channels, &error), std::nullopt);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, ENOENT);
+}
+
+TYPED_TEST(OstrelContractTest, IterationStopsWhenTheCallbackSaysSo) {
+  for (const char* c : {"a", "b", "c"}) this->h_.SetCounter("G", "S", c, 1);
+  auto s = this->Subscribe("G", "S");
+  std::optional<OstrelError> error;
+  auto samples = this->ostrel().CreateSamples(s.subscription.get(), s.channels, &error);
+  ASSERT_TRUE(samples);
+  int calls = 0;
+  this->ostrel().Iterate(*samples, [&](const Value&) { return ++calls == 2 ? 1 : 0; });
+  EXPECT_EQ(calls, 2);
+}
+
+class LinuxOstrelTest : public ::testing::Test {
+ protected:
+  void Write(const std::string& rel, const std::string& text) {
+    fs::create_directories((dir_.path() / rel).parent_path());
+    std::ofstream(dir_.path() / rel) << text;
+  }
+  std::optional<Dictionary> Sample(std::optional<OstrelError>* error) {
+    auto channels = ostrel_->CopyChannelsInGroup("G", "S", 0, error);
+    if (!channels) return std::nullopt;
+    Dictionary subscribed;
+    auto subscription = ostrel_->CreateSubscription(*channels, &subscribed);
+    return ostrel_->CreateSamples(subscription.get(), subscribed, error);
+  }
+
+  testing::TempDir dir_;
+  std::shared_ptr<Ostrel> ostrel_ = NewLinuxOstrel(dir_.str());
+};
+
+TEST_F(LinuxOstrelTest, MissingRootHasNoChannels) {
+  auto ostrel = NewLinuxOstrel(dir_.str() + "/absent");
+  std::optional<OstrelError> error;
+  EXPECT_EQ(ostrel->CopyChannelsInGroup(std::nullopt, std::nullopt, 0, &error), std::nullopt);
+  EXPECT_EQ(ostrel->CopyChannelsInGroup("Speaker", std::nullopt, 0, &error), std::nullopt);
+  EXPECT_FALSE(error);
+}
+
+TEST_F(LinuxOstrelTest, CounterTextsThatParse) {
+  Write("G/S/a", "  42 \n");
+  Write("G/S/b", "-5");
+  Write("G/S/c", "18446744073709551615\n");  // an unsigned counter at its maximum
+  Write("G/S/.hidden", "garbage");
+  std::optional<OstrelError> error;
+  auto samples = Sample(&error);
+  ASSERT_TRUE(samples) << (error ? error->code : 0);
+  ASSERT_EQ(samples->size(), 3u);
+  EXPECT_EQ(ostrel_->SimpleGetIntegerValue(*samples->Find("G/S/a"), 0), 42);
+  EXPECT_EQ(ostrel_->SimpleGetIntegerValue(*samples->Find("G/S/b"), 0), -5);
+  EXPECT_EQ(ostrel_->SimpleGetIntegerValue(*samples->Find("G/S/c"), 0), -1);
+}
+
+TEST_F(LinuxOstrelTest, GarbageInACounterIsASamplingError) {
+  for (const char* text : {"", "twelve", "12 13", "0x10", "1e3", "99999999999999999999999"}) {
+    Write("G/S/a", "1");
+    Write("G/S/b", text);
+    std::optional<OstrelError> error;
+    EXPECT_EQ(Sample(&error), std::nullopt) << text;
+    ASSERT_TRUE(error) << text;
+    EXPECT_EQ(error->code, EBADMSG) << text;
+  }
+  Write("G/S/b", std::string(1000, '1'));
+  std::optional<OstrelError> error;
+  EXPECT_EQ(Sample(&error), std::nullopt);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, EFBIG);
+}
+
+TEST_F(LinuxOstrelTest, ForgedDescriptionsReadNothingOutsideTheTree) {
+  Write("G/S/a", "1");
+  Write("secret", "7");
+  const Dictionary forged{
+      {"G/S/../../secret",
+       Dictionary{{"group", "G"}, {"subgroup", "S/../.."}, {"name", "secret"}}}};
+  Dictionary subscribed{{"stale", 1}};
+  auto subscription = ostrel_->CreateSubscription(forged, &subscribed);
+  EXPECT_TRUE(subscribed.empty()) << "a forged channel was subscribed";
+  std::optional<OstrelError> error;
+  EXPECT_EQ(ostrel_->CreateSamples(subscription.get(), forged, &error), std::nullopt);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, EINVAL);
+}
+
+TEST_F(LinuxOstrelTest, AFifoAsACounterDoesNotHang) {
+  Write("G/S/a", "1");
+  fs::create_directories(dir_.path() / "G/S");
+  ASSERT_EQ(::mkfifo((dir_.str() + "/G/S/pipe").c_str(), 0644), 0);
+  // Not a regular file: not a channel at all.
+  std::optional<OstrelError> error;
+  auto channels = ostrel_->CopyChannelsInGroup("G", "S", 0, &error);
+  ASSERT_TRUE(channels);
+  EXPECT_EQ(ostrel_->GetChannelCount(*channels), 1);
+}
+
+TEST_F(LinuxOstrelTest, UnreadableGroupIsAnErrorButOthersStillCount) {
+  if (::geteuid() == 0) GTEST_SKIP() << "root reads every folder";
+  Write("A/S/x", "1");
+  Write("B/S/y", "2");
+  ASSERT_EQ(::chmod((dir_.str() + "/B").c_str(), 0), 0);
+  std::optional<OstrelError> error;
+  auto channels = ostrel_->CopyChannelsInGroup(std::nullopt, "S", 0, &error);
+  ::chmod((dir_.str() + "/B").c_str(), 0755);
+  ASSERT_TRUE(channels);
+  EXPECT_EQ(ostrel_->GetChannelCount(*channels), 1);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, EACCES);
+}
+
+}  // namespace
+}  // namespace qn
