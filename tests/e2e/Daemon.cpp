@@ -1,0 +1,344 @@
+#include "tests/e2e/Daemon.h"
+
+#include <fcntl.h>
+#include <poll.h>
+#include <signal.h>
+#include <spawn.h>
+#include <sys/socket.h>
+#include <sys/syscall.h>
+#include <sys/un.h>
+#include <sys/wait.h>
+#include <unistd.h>
+
+#include <gtest/gtest.h>
+
+#include <cerrno>
+#include <cstdlib>
+#include <cstring>
+#include <filesystem>
+#include <fstream>
+#include <sstream>
+#include <thread>
+
+#include "common/Frame.h"
+#include "common/Json.h"
+#include "common/MsgPack.h"
+
+extern char** environ;
+
+namespace qn::e2e {
+
+namespace {
+
+std::string ReadFile(const std::string& path) {
+  std::ifstream in(path, std::ios::binary);
+  std::ostringstream text;
+  text << in.rdbuf();
+  return text.str();
+}
+
+// The parent's environment without the variables through which systemd talks to a service,
+// so that the daemon never mistakes the test's environment for its own.
+std::vector<std::string> ChildEnvironment() {
+  std::vector<std::string> out;
+  for (char** entry = environ; entry && *entry; ++entry) {
+    std::string_view e = *entry;
+    if (e.starts_with("NOTIFY_SOCKET=") || e.starts_with("LISTEN_FDS=") ||
+        e.starts_with("LISTEN_PID=") || e.starts_with("LISTEN_FDNAMES=") ||
+        e.starts_with("JOURNAL_STREAM=")) {
+      continue;
+    }
+    out.emplace_back(e);
+  }
+  return out;
+}
+
+std::vector<char*> Pointers(std::vector<std::string>& strings) {
+  std::vector<char*> out;
+  for (auto& s : strings) out.push_back(s.data());
+  out.push_back(nullptr);
+  return out;
+}
+
+ExitStatus FromWaitStatus(int status) {
+  if (WIFEXITED(status)) return ExitStatus{true, WEXITSTATUS(status)};
+  if (WIFSIGNALED(status)) return ExitStatus{false, WTERMSIG(status)};
+  return ExitStatus{};
+}
+
+}  // namespace
+
+// --- TempHome ----------------------------------------------------------------------------
+
+TempHome::TempHome() {
+  const char* base = std::getenv("TMPDIR");
+  std::string pattern = std::string(base && *base ? base : "/tmp") + "/qn-e2e-XXXXXX";
+  char* made = ::mkdtemp(pattern.data());
+  if (made == nullptr) {
+    ADD_FAILURE() << "mkdtemp failed: " << std::strerror(errno);
+    return;
+  }
+  path_ = made;
+}
+
+TempHome::~TempHome() {
+  std::error_code ignored;
+  if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
+}
+
+// --- ChildProcess ------------------------------------------------------------------------
+
+ChildProcess::ChildProcess(const std::string& binary, const std::vector<std::string>& args,
+                           const std::string& dir)
+    : stdout_path_(dir + "/stdout.txt"), stderr_path_(dir + "/stderr.txt") {
+  std::vector<std::string> argv_strings{binary};
+  argv_strings.insert(argv_strings.end(), args.begin(), args.end());
+  std::vector<std::string> env_strings = ChildEnvironment();
+  std::vector<char*> argv = Pointers(argv_strings);
+  std::vector<char*> envp = Pointers(env_strings);
+
+  posix_spawn_file_actions_t actions;
+  posix_spawn_file_actions_init(&actions);
+  posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
+  posix_spawn_file_actions_addopen(&actions, 1, stdout_path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC,
+                                   0644);
+  posix_spawn_file_actions_addopen(&actions, 2, stderr_path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC,
+                                   0644);
+  posix_spawnattr_t attributes;
+  posix_spawnattr_init(&attributes);
+  sigset_t none, all;
+  sigemptyset(&none);
+  sigfillset(&all);
+  posix_spawnattr_setsigmask(&attributes, &none);
+  posix_spawnattr_setsigdefault(&attributes, &all);
+  posix_spawnattr_setflags(&attributes, POSIX_SPAWN_SETSIGMASK | POSIX_SPAWN_SETSIGDEF);
+  const int error =
+      ::posix_spawn(&pid_, binary.c_str(), &actions, &attributes, argv.data(), envp.data());
+  posix_spawnattr_destroy(&attributes);
+  posix_spawn_file_actions_destroy(&actions);
+  if (error != 0) {
+    ADD_FAILURE() << "cannot start " << binary << ": " << std::strerror(error);
+    pid_ = -1;
+    return;
+  }
+  pidfd_ = static_cast<int>(::syscall(SYS_pidfd_open, pid_, 0));
+}
+
+ChildProcess::~ChildProcess() {
+  if (pid_ > 0 && !status_) {
+    ::kill(pid_, SIGKILL);
+    Wait(kPatience);
+  }
+  if (pidfd_ >= 0) ::close(pidfd_);
+}
+
+bool ChildProcess::running() {
+  if (pid_ <= 0 || status_) return false;
+  int status = 0;
+  if (::waitpid(pid_, &status, WNOHANG) == pid_) {
+    status_ = FromWaitStatus(status);
+    return false;
+  }
+  return true;
+}
+
+void ChildProcess::Signal(int signal) const {
+  if (pid_ > 0 && !status_) ::kill(pid_, signal);
+}
+
+std::optional<ExitStatus> ChildProcess::Wait(std::chrono::milliseconds timeout) {
+  if (pid_ <= 0) return std::nullopt;
+  if (status_) return status_;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  for (;;) {
+    int status = 0;
+    pid_t got = ::waitpid(pid_, &status, WNOHANG);
+    if (got == pid_) {
+      status_ = FromWaitStatus(status);
+      return status_;
+    }
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+        deadline - std::chrono::steady_clock::now());
+    if (left.count() <= 0) return std::nullopt;
+    if (pidfd_ >= 0) {
+      // The pidfd becomes readable when the process ends.
+      pollfd p{pidfd_, POLLIN, 0};
+      ::poll(&p, 1, static_cast<int>(left.count()));
+    } else {
+      std::this_thread::sleep_for(5ms);
+    }
+  }
+}
+
+std::string ChildProcess::Stdout() const { return ReadFile(stdout_path_); }
+std::string ChildProcess::Stderr() const { return ReadFile(stderr_path_); }
+
+// --- Daemon ------------------------------------------------------------------------------
+
+Daemon::Daemon(std::vector<std::string> extra_args, std::optional<std::string> socket)
+    : socket_path_(socket.value_or(home_.path() + "/run/reporting.sock")) {
+  std::vector<std::string> args{"--home", home()};
+  if (socket) args.insert(args.end(), {"--socket", *socket});
+  args.insert(args.end(), extra_args.begin(), extra_args.end());
+  process_ = std::make_unique<ChildProcess>(QN_DAEMON_PATH, args, home());
+  // The socket exists once the daemon listens; until then connecting fails.
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  while (std::chrono::steady_clock::now() < deadline) {
+    if (!process_->running()) {
+      ADD_FAILURE() << "qnreportingd exited early: " << process_->Stderr();
+      return;
+    }
+    if (auto probe = client::Client::Connect(socket_path())) {
+      started_ = probe->getAllReportersSync().has_value();
+      if (!started_) ADD_FAILURE() << "qnreportingd did not answer: " << process_->Stderr();
+      return;
+    }
+    std::this_thread::sleep_for(5ms);
+  }
+  ADD_FAILURE() << "qnreportingd never accepted a connection: " << process_->Stderr();
+}
+
+std::unique_ptr<client::Client> Daemon::Connect() {
+  std::string error;
+  auto client = client::Client::Connect(socket_path(), &error);
+  if (!client) ADD_FAILURE() << "connect: " << error;
+  return client;
+}
+
+std::optional<ExitStatus> Daemon::Stop(int signal) {
+  process_->Signal(signal);
+  return process_->Wait();
+}
+
+std::vector<ReportingStoreRow> Daemon::Rows(std::optional<ReportingSink> sink) const {
+  std::vector<ReportingStoreRow> rows;
+  std::optional<Error> error;
+  auto reader = ReportingStoreReader::Open(db_path(), &error);
+  if (!reader) {
+    ADD_FAILURE() << "cannot read the store: " << (error ? error->Description() : "");
+    return rows;
+  }
+  error = reader->ForEachRow(sink, [&](const ReportingStoreRow& row) {
+    rows.push_back(row);
+    return true;
+  });
+  if (error) ADD_FAILURE() << "reading the store: " << error->Description();
+  return rows;
+}
+
+bool Daemon::WaitForRows(
+    const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition) {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  for (;;) {
+    if (condition(Rows())) return true;
+    if (std::chrono::steady_clock::now() > deadline) return false;
+    std::this_thread::sleep_for(10ms);
+  }
+}
+
+std::vector<ReportingStoreRow> RowsOf(const std::vector<ReportingStoreRow>& rows,
+                                      ReportingStoreRow::Table table) {
+  std::vector<ReportingStoreRow> out;
+  for (const auto& row : rows) {
+    if (row.table == table) out.push_back(row);
+  }
+  return out;
+}
+
+Value Json(const std::string& text) {
+  Value value;
+  if (ParseJson(text, value)) return Value();
+  return value;
+}
+
+std::vector<ReportingStoreRow> AnalyticsNamed(const std::vector<ReportingStoreRow>& rows,
+                                              const std::string& name) {
+  std::vector<ReportingStoreRow> out;
+  for (const auto& row : RowsOf(rows, ReportingStoreRow::Table::kAnalyticsEvent)) {
+    if (row.name == name) out.push_back(row);
+  }
+  return out;
+}
+
+// --- RawConnection -----------------------------------------------------------------------
+
+RawConnection::RawConnection(const std::string& socket_path, int receive_buffer) {
+  fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (fd_ < 0) return;
+  if (receive_buffer > 0) {
+    ::setsockopt(fd_, SOL_SOCKET, SO_RCVBUF, &receive_buffer, sizeof receive_buffer);
+  }
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  std::strncpy(address.sun_path, socket_path.c_str(), sizeof address.sun_path - 1);
+  if (::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+    ADD_FAILURE() << "raw connect: " << std::strerror(errno);
+    ::close(fd_);
+    fd_ = -1;
+  }
+}
+
+RawConnection::~RawConnection() {
+  if (fd_ >= 0) ::close(fd_);
+}
+
+bool RawConnection::Write(const std::string& bytes) {
+  std::size_t written = 0;
+  while (written < bytes.size()) {
+    ssize_t n = ::send(fd_, bytes.data() + written, bytes.size() - written, MSG_NOSIGNAL);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) return false;
+    written += static_cast<std::size_t>(n);
+  }
+  return true;
+}
+
+void RawConnection::ShutdownWrite() { ::shutdown(fd_, SHUT_WR); }
+
+std::string RawConnection::Frame(const Value& body) {
+  std::string frame;
+  AppendFrame(frame, body);
+  return frame;
+}
+
+std::string RawConnection::RawFrame(const std::string& body) {
+  const auto n = static_cast<std::uint32_t>(body.size());
+  std::string frame{static_cast<char>(n >> 24), static_cast<char>(n >> 16),
+                    static_cast<char>(n >> 8), static_cast<char>(n)};
+  return frame + body;
+}
+
+std::vector<Value> RawConnection::ReadUntilClosed(bool* closed, std::chrono::milliseconds timeout) {
+  *closed = false;
+  std::vector<Value> frames;
+  FrameDecoder decoder;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  char buffer[65536];
+  for (;;) {
+    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
+        deadline - std::chrono::steady_clock::now());
+    if (left.count() <= 0) break;
+    pollfd p{fd_, POLLIN, 0};
+    if (::poll(&p, 1, static_cast<int>(left.count())) <= 0) continue;
+    ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
+    if (n < 0 && errno == EINTR) continue;
+    if (n <= 0) {
+      *closed = true;
+      break;
+    }
+    decoder.Feed(std::string_view(buffer, static_cast<std::size_t>(n)));
+    while (auto body = decoder.Next()) {
+      auto decoded = DecodeMsgPack(*body);
+      if (auto* value = std::get_if<Value>(&decoded)) frames.push_back(*value);
+    }
+  }
+  return frames;
+}
+
+bool RawConnection::WaitForPeerClose(std::chrono::milliseconds timeout) {
+  pollfd p{fd_, POLLRDHUP, 0};
+  return ::poll(&p, 1, static_cast<int>(timeout.count())) == 1 &&
+         (p.revents & (POLLRDHUP | POLLHUP)) != 0;
+}
+
+}  // namespace qn::e2e

@@ -1,0 +1,143 @@
+#pragma once
+
+#include <sys/types.h>
+
+#include <csignal>
+
+#include <chrono>
+#include <functional>
+#include <memory>
+#include <optional>
+#include <string>
+#include <vector>
+
+#include "common/Value.h"
+#include "platform/linux/reporting_store_reader.h"
+#include "qnreporting/Client.h"
+
+namespace qn::e2e {
+
+using namespace std::chrono_literals;
+
+// Generous bounds for things that happen in milliseconds; they only end a hung test.
+inline constexpr std::chrono::milliseconds kPatience = 30s;
+
+// A fresh folder under $TMPDIR (or /tmp), removed with everything in it.
+class TempHome {
+ public:
+  TempHome();
+  ~TempHome();
+  const std::string& path() const { return path_; }
+
+ private:
+  std::string path_;
+};
+
+// How a child process ended.
+struct ExitStatus {
+  bool exited = false;  // by exit(); else by a signal (or not at all within the wait)
+  int code = -1;        // the exit status, or the signal number
+  bool operator==(const ExitStatus&) const = default;
+};
+inline ExitStatus Exited(int code) { return {true, code}; }
+
+// Runs `binary` with `args`, its stdout and stderr written to files under `dir`, with the
+// signal mask and dispositions reset and without systemd's variables, and waits for it.
+class ChildProcess {
+ public:
+  ChildProcess(const std::string& binary, const std::vector<std::string>& args,
+               const std::string& dir);
+  // Kills the process (SIGKILL) if it still runs.
+  ~ChildProcess();
+
+  pid_t pid() const { return pid_; }
+  bool running();
+  void Signal(int signal) const;
+  // Waits for the process to end, at most `timeout`; nullopt when it did not.
+  std::optional<ExitStatus> Wait(std::chrono::milliseconds timeout = kPatience);
+  std::string Stdout() const;
+  std::string Stderr() const;
+
+ private:
+  pid_t pid_ = -1;
+  int pidfd_ = -1;
+  std::optional<ExitStatus> status_;
+  std::string stdout_path_;
+  std::string stderr_path_;
+};
+
+// The real daemon on a temporary --home.
+class Daemon {
+ public:
+  // Starts qnreportingd --home <temp> plus `extra_args` (and --socket `socket` when given),
+  // and waits until it accepts connections (by retrying connect; fails the test when it
+  // never does or exits). The probe that finds the daemon ready is a client too: it makes
+  // one request, so the daemon always lists it, and sends its uptime event when it leaves.
+  explicit Daemon(std::vector<std::string> extra_args = {},
+                  std::optional<std::string> socket = std::nullopt);
+
+  const std::string& home() const { return home_.path(); }
+  const std::string& socket_path() const { return socket_path_; }
+  std::string db_path() const { return home() + "/state/reports.db"; }
+  ChildProcess& process() { return *process_; }
+  bool started() const { return started_; }
+
+  // A new connection (null with a test failure when it cannot connect).
+  std::unique_ptr<client::Client> Connect();
+
+  // Sends `signal` and waits for the daemon to end.
+  std::optional<ExitStatus> Stop(int signal = SIGTERM);
+
+  // Every row of the store (all sinks, or one), read now.
+  std::vector<ReportingStoreRow> Rows(std::optional<ReportingSink> sink = std::nullopt) const;
+  // Reads the rows again until `condition` holds for them, at most kPatience. For rows
+  // handed to the store by work that runs after a reply (there is no event to wait on).
+  bool WaitForRows(const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition);
+
+ private:
+  TempHome home_;
+  std::string socket_path_;
+  std::unique_ptr<ChildProcess> process_;
+  bool started_ = false;
+};
+
+// Whether a sendMessageSync result is a reply without an error.
+inline bool RepliedWithoutError(const std::optional<std::optional<client::ReplyError>>& result) {
+  return result && !*result;
+}
+
+// The rows of one table.
+std::vector<ReportingStoreRow> RowsOf(const std::vector<ReportingStoreRow>& rows,
+                                      ReportingStoreRow::Table table);
+// A row's JSON column parsed into a Value (null when it is not JSON).
+Value Json(const std::string& text);
+// The analytics rows named `name`.
+std::vector<ReportingStoreRow> AnalyticsNamed(const std::vector<ReportingStoreRow>& rows,
+                                              const std::string& name);
+
+// A raw connection to the daemon's socket, for bytes the client library would never send.
+class RawConnection {
+ public:
+  explicit RawConnection(const std::string& socket_path, int receive_buffer = 0);
+  ~RawConnection();
+  bool connected() const { return fd_ >= 0; }
+
+  // Writes every byte (false when the peer closed first).
+  bool Write(const std::string& bytes);
+  // Closes the writing half.
+  void ShutdownWrite();
+  // One frame: [4-byte big-endian length][MessagePack body].
+  static std::string Frame(const Value& body);
+  static std::string RawFrame(const std::string& body);
+
+  // Reads until the peer closes or `timeout` passes; returns the decoded frames read and
+  // sets *closed when the peer closed.
+  std::vector<Value> ReadUntilClosed(bool* closed, std::chrono::milliseconds timeout = kPatience);
+  // Waits, without reading, until the peer has closed its end.
+  bool WaitForPeerClose(std::chrono::milliseconds timeout = kPatience);
+
+ private:
+  int fd_ = -1;
+};
+
+}  // namespace qn::e2e
