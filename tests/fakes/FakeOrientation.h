@@ -12,7 +12,8 @@ namespace qn::testing {
 // An Orientation whose notifications the test fires. Records every registration and
 // unregistration in order ("register device <id>", "register ui <id>", "unregister device
 // <id>", "unregister ui <id>"). Thread-safe; callbacks run on the firing thread without the
-// fake's lock held.
+// fake's lock held, so a callback that a concurrent Fire has already picked up may still run
+// after its unregistration returns (as with a source that delivers on its own threads).
 class FakeOrientation final : public Orientation {
  public:
   void RegisterDeviceOrientation(const std::string& callback_id, Callback callback) override;

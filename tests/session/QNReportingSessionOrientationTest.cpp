@@ -2,7 +2,9 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
+#include <thread>
 
 #include "Statistics/Service/QNReportingSession.h"
 #include "tests/session/SessionTestPlatform.h"
@@ -148,6 +150,31 @@ TEST_F(OrientationTest, UnregistrationRunsEvenWhenNotStarted) {
   EXPECT_FALSE(session->orientationCallbackID());
   EXPECT_EQ(t_.orientation->Events().size(), 4u);
   EXPECT_EQ(t_.trace->Count(0x21042830), 0);  // the rest of stop did not run
+  t_.dispatcher->RunUntilIdle();
+}
+
+TEST_F(OrientationTest, CallbacksRaceWithIntakeAndStop) {
+  SetInternal(true);
+  auto session = NewSession(7);
+  session->start();
+  std::atomic<bool> go{true};
+  std::thread source([&] {
+    for (int i = 0; go.load(); ++i) {
+      t_.orientation->FireDevice(i % 6 + 1);
+      t_.orientation->FireUI(i % 6 + 1);
+    }
+  });
+  for (int i = 0; i < 200; ++i) {
+    session->sendMessage(std::make_shared<const Dictionary>(Dictionary{{"i", i}}), 1, 0, nullptr);
+  }
+  auto aggregated = session->aggregatedPayloadData();
+  session->stop();
+  go = false;
+  source.join();
+  // Every message and at least the changes before stop were filed; after stop the session
+  // has no array for late callbacks to add to.
+  EXPECT_GE(aggregated->Snapshot().size(), 200u);
+  EXPECT_FALSE(session->aggregatedPayloadData());
   t_.dispatcher->RunUntilIdle();
 }
 

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <memory>
 
 #include "platform/platform.h"
@@ -22,6 +23,10 @@ struct SessionTestPlatform {
   std::shared_ptr<FakeLivoReporting> livo = std::make_shared<FakeLivoReporting>(dispatcher);
   std::shared_ptr<FakeOrientation> orientation = std::make_shared<FakeOrientation>();
   std::shared_ptr<Platform> platform = Make();
+
+  // Queued work holds its session, and the session holds this platform: run what is left
+  // (waits for backends and alarm delays included) so that nothing stays referenced.
+  ~SessionTestPlatform() { dispatcher->AdvanceBy(std::chrono::minutes(2)); }
 
  private:
   std::shared_ptr<Platform> Make() {
