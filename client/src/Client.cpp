@@ -24,6 +24,8 @@ using protocol::Op;
 
 constexpr std::size_t kReadChunkBytes = 64 * 1024;
 constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
+// How long destroying a client waits for its queued requests to be written.
+constexpr Timeout kShutdownFlushTimeout = std::chrono::seconds(1);
 
 // A reply adapter: checks the result's type and calls the typed callback; false when the
 // result is not what the request's operation replies with.
@@ -121,6 +123,7 @@ class Client::Impl : public std::enable_shared_from_this<Impl> {
 
   // Called by ~Client.
   void Shutdown() {
+    Flush(kShutdownFlushTimeout);
     Close();
     if (!thread_.joinable()) return;
     if (OnIoThread()) {
@@ -203,9 +206,15 @@ class Client::Impl : public std::enable_shared_from_this<Impl> {
   bool WaitForReplies(Timeout timeout) {
     if (OnIoThread()) return false;
     std::unique_lock lock(mu_);
-    cv_.wait_for(lock, timeout,
-                 [&] { return (outstanding_ == 0 && delivering_ == 0) || ended_; });
+    cv_.wait_for(lock, timeout, [&] { return (outstanding_ == 0 && delivering_ == 0) || ended_; });
     return outstanding_ == 0 && delivering_ == 0;
+  }
+
+  bool Flush(Timeout timeout) {
+    if (OnIoThread()) return false;
+    std::unique_lock lock(mu_);
+    cv_.wait_for(lock, timeout, [&] { return (outgoing_.empty() && !write_active_) || ended_; });
+    return outgoing_.empty() && !write_active_ && !ended_;
   }
 
   bool WaitUntilEnded(Timeout timeout) {
@@ -248,6 +257,7 @@ class Client::Impl : public std::enable_shared_from_this<Impl> {
       std::lock_guard lock(mu_);
       if (ended_ || outgoing_.empty()) {
         write_active_ = false;
+        cv_.notify_all();  // Flush
         return;
       }
       writing_.swap(outgoing_);
@@ -587,6 +597,7 @@ std::optional<std::vector<std::int64_t>> Client::getAllReportersSync(Timeout tim
 
 bool Client::WaitForReplies(Timeout timeout) { return impl_->WaitForReplies(timeout); }
 bool Client::WaitUntilEnded(Timeout timeout) { return impl_->WaitUntilEnded(timeout); }
+bool Client::Flush(Timeout timeout) { return impl_->Flush(timeout); }
 void Client::Close() { impl_->Close(); }
 bool Client::connected() const { return impl_->connected(); }
 std::size_t Client::outstanding() const { return impl_->outstanding(); }

@@ -81,8 +81,9 @@ class Client {
   static std::unique_ptr<Client> Connect(const std::string& socket_path,
                                          std::string* error = nullptr);
 
-  // Closes the connection (see Close) and joins the I/O thread. May be called from a
-  // callback: the I/O thread then finishes on its own.
+  // Writes out the requests still queued (waiting at most a second for a peer that does
+  // not read), closes the connection (see Close) and joins the I/O thread. May be called
+  // from a callback: the I/O thread then finishes on its own.
   ~Client();
 
   Client(const Client&) = delete;
@@ -163,8 +164,13 @@ class Client {
   // whether it did within `timeout`.
   bool WaitUntilEnded(Timeout timeout = kDefaultTimeout);
 
-  // Closes the connection. Replies not yet received are dropped; the invalidation handler
-  // runs (once) if it has not yet. Returns at once; the handler runs on the I/O thread.
+  // Waits until everything sent so far has been written to the socket. Returns false when
+  // `timeout` passed first, the connection ended, or the call was made on the I/O thread.
+  bool Flush(Timeout timeout = kDefaultTimeout);
+
+  // Closes the connection. Requests not yet written (see Flush) and replies not yet
+  // received are dropped; the invalidation handler runs (once) if it has not yet. Returns
+  // at once; the handler runs on the I/O thread.
   void Close();
   // Whether the connection is still open.
   bool connected() const;
