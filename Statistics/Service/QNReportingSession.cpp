@@ -397,6 +397,7 @@ void QNReportingSession::sendSingleMessage(const std::shared_ptr<const Platform>
                                            std::uint16_t serviceType,
                                            std::shared_ptr<const Dictionary> /*userInfo*/,
                                            ReplyBlock reply) {
+  if (!platform || !platform->log || !platform->dispatcher) return;
   auto scope = RegisterSessionScope(*platform->log);
   const std::uint32_t delay = serviceType == kServiceTypeAlarms ? RandomUniform(60) : 0;
   QN_LOG(*platform->log, scope.get(), LogLevel::kDebug,
@@ -417,9 +418,10 @@ void QNReportingSession::sendSingleMessage(const std::shared_ptr<const Platform>
             {kLivoReportingUserInfoServiceName, QNReportingServiceTypeName(serviceType)}};
         std::shared_ptr<const Dictionary> converted = ConvertPayload(payload.get());
         std::optional<Error> error;
-        const bool sent = platform->livo_reporting->SendOneMessage(
-            sessionInfo, userInfo, static_cast<std::uint16_t>(category & 0xFFFFu), type,
-            Value(converted), &error);
+        const bool sent = platform->livo_reporting &&
+                          platform->livo_reporting->SendOneMessage(
+                              sessionInfo, userInfo, static_cast<std::uint16_t>(category & 0xFFFFu),
+                              type, Value(converted), &error);
         if (sent) {
           QN_LOG(*platform->log, scope.get(), LogLevel::kDebug,
                  "%s:%d:%s: message %@ : category %i : type %i", PrintedOrNull(payload),
@@ -479,16 +481,17 @@ void QNReportingSession::writeSummaryJson() {
 
   // The text is fixed here, under the array's lock; the array keeps the inserted userInfo.
   std::optional<std::string> output;
+  std::optional<Error> jsonError;
   {
     std::lock_guard guard(nested->lock);
     if (nested->items.empty()) return;
     nested->items.insert(nested->items.begin(), Value(info));
     std::string text;
-    if (auto error = ToJson(Value(nested->items), JsonStyle::kPretty, text)) {
-      SESSION_LOG(LogLevel::kError, "%s:%d:%s: dataWithJSONObject: %@", error->Description());
-    } else {
-      output = std::move(text);
-    }
+    jsonError = ToJson(Value(nested->items), JsonStyle::kPretty, text);
+    if (!jsonError) output = std::move(text);
+  }
+  if (jsonError) {
+    SESSION_LOG(LogLevel::kError, "%s:%d:%s: dataWithJSONObject: %@", jsonError->Description());
   }
 
   const std::string directory = platform_->diagnostic_logs_dir;

@@ -140,7 +140,7 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   // 0-59 s delay for service type 4 ("alarms"), at once otherwise. `userInfo` is accepted and
   // ignored (the single message's user info is fixed). `reply` (may be empty) gets the
   // framework's error, or none on success, on a background thread. Returns at once.
-  // REQUIRES: `platform` has a log, a dispatcher and a LivoReporting.
+  // Does nothing without a log and a dispatcher; without a LivoReporting the send fails.
   static void sendSingleMessage(const std::shared_ptr<const Platform>& platform,
                                 std::shared_ptr<const Dictionary> payload, std::uint32_t category,
                                 std::uint16_t type, std::uint16_t serviceType,
@@ -158,8 +158,9 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   // On internal builds, when the nested array holds entries: inserts userInfo at its front
   // and writes it as pretty JSON to
   // "<diagnostic_logs_dir>/<yyyyMMdd-HHmmssZ>-quenta-<host app or unknown>-<service name>.json".
-  // The text and the name are fixed here; the directory creation and the atomic write run
-  // on the global background queue. Failures are logged, never reported.
+  // A "/" in the host application name becomes "_" so the file stays in the directory.
+  // The text and the name are fixed here; the directory creation (mode 0777) and the atomic
+  // write run on the global background queue. Failures are logged, never reported.
   void writeSummaryJson();
 
   // Properties.
