@@ -92,7 +92,7 @@ void PutSized(std::string& out, std::size_t n, std::uint8_t fix_base, std::size_
 void PutDate(std::string& out, double seconds) {
   if (!std::isfinite(seconds)) seconds = 0;
   double whole = std::floor(seconds);
-  std::int64_t sec;
+  std::int64_t sec = 0;
   std::uint32_t nsec = 0;
   if (whole < -9223372036854775808.0) {
     sec = INT64_MIN;
@@ -141,7 +141,7 @@ void Encode(std::string& out, const Value& value) {
       break;
     case Value::Kind::kDouble: {
       double d = *value.as_double();
-      std::uint64_t bits;
+      std::uint64_t bits = 0;
       std::memcpy(&bits, &d, sizeof bits);
       PutByte(out, 0xcb);
       PutBigEndian(out, bits);
@@ -243,19 +243,19 @@ class Decoder {
   bool ReadLength(std::size_t start, const char* what, int width, std::size_t& out) {
     switch (width) {
       case 1: {
-        std::uint8_t n;
+        std::uint8_t n = 0;
         if (!ReadChecked(start, what, n)) return false;
         out = n;
         return true;
       }
       case 2: {
-        std::uint16_t n;
+        std::uint16_t n = 0;
         if (!ReadChecked(start, what, n)) return false;
         out = n;
         return true;
       }
       default: {
-        std::uint32_t n;
+        std::uint32_t n = 0;
         if (!ReadChecked(start, what, n)) return false;
         out = n;
         return true;
@@ -320,7 +320,7 @@ class Decoder {
   }
 
   bool DecodeExtension(std::size_t start, std::size_t n, Value& out) {
-    std::int8_t type;
+    std::int8_t type = 0;
     if (!ReadChecked(start, "extension type", type)) return false;
     if (n > Remaining()) {
       return Fail(ConnectionError::kBadMessagePack, start,
@@ -330,8 +330,8 @@ class Decoder {
       return Fail(ConnectionError::kBadMessagePack, start,
                   StringWithFormat("unsupported extension type %d", static_cast<int>(type)));
     }
-    std::int64_t sec;
-    std::uint32_t nsec;
+    std::int64_t sec = 0;
+    std::uint32_t nsec = 0;
     switch (n) {
       case 4:
         sec = Read<std::uint32_t>();
@@ -399,65 +399,65 @@ class Decoder {
         if (!ReadLength(start, "extension length", 1 << (b - 0xc7), n)) return false;
         return DecodeExtension(start, n, out);
       case 0xca: {
-        std::uint32_t bits;
+        std::uint32_t bits = 0;
         if (!ReadChecked(start, "float32", bits)) return false;
-        float f;
+        float f = 0;
         std::memcpy(&f, &bits, sizeof f);
         out = Value(static_cast<double>(f));
         return true;
       }
       case 0xcb: {
-        std::uint64_t bits;
+        std::uint64_t bits = 0;
         if (!ReadChecked(start, "float64", bits)) return false;
-        double d;
+        double d = 0;
         std::memcpy(&d, &bits, sizeof d);
         out = Value(d);
         return true;
       }
       case 0xcc: {
-        std::uint8_t u;
+        std::uint8_t u = 0;
         if (!ReadChecked(start, "uint8", u)) return false;
         out = Value(u);
         return true;
       }
       case 0xcd: {
-        std::uint16_t u;
+        std::uint16_t u = 0;
         if (!ReadChecked(start, "uint16", u)) return false;
         out = Value(u);
         return true;
       }
       case 0xce: {
-        std::uint32_t u;
+        std::uint32_t u = 0;
         if (!ReadChecked(start, "uint32", u)) return false;
         out = Value(u);
         return true;
       }
       case 0xcf: {
-        std::uint64_t u;
+        std::uint64_t u = 0;
         if (!ReadChecked(start, "uint64", u)) return false;
         out = Value(u);
         return true;
       }
       case 0xd0: {
-        std::int8_t i;
+        std::int8_t i = 0;
         if (!ReadChecked(start, "int8", i)) return false;
         out = Value(i);
         return true;
       }
       case 0xd1: {
-        std::int16_t i;
+        std::int16_t i = 0;
         if (!ReadChecked(start, "int16", i)) return false;
         out = Value(i);
         return true;
       }
       case 0xd2: {
-        std::int32_t i;
+        std::int32_t i = 0;
         if (!ReadChecked(start, "int32", i)) return false;
         out = Value(i);
         return true;
       }
       case 0xd3: {
-        std::int64_t i;
+        std::int64_t i = 0;
         if (!ReadChecked(start, "int64", i)) return false;
         out = Value(i);
         return true;

@@ -185,10 +185,13 @@ bool FakeDispatcher::RunOne() {
       queue->tasks.pop_front();
     }
   }
-  const QueueState* outer = current_queue;
-  current_queue = queue.get();
+  // Restores the running queue even when the task throws (FakeProcess::Exit does).
+  struct CurrentQueue {
+    const QueueState* outer = current_queue;
+    explicit CurrentQueue(const QueueState* q) { current_queue = q; }
+    ~CurrentQueue() { current_queue = outer; }
+  } running(queue.get());
   task();
-  current_queue = outer;
   return true;
 }
 
