@@ -308,30 +308,47 @@ std::string RawConnection::RawFrame(const std::string& body) {
   return frame + body;
 }
 
-std::vector<Value> RawConnection::ReadUntilClosed(bool* closed, std::chrono::milliseconds timeout) {
-  *closed = false;
-  std::vector<Value> frames;
-  FrameDecoder decoder;
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
+bool RawConnection::Receive(std::chrono::steady_clock::time_point deadline, bool* closed) {
   char buffer[65536];
   for (;;) {
     const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
         deadline - std::chrono::steady_clock::now());
-    if (left.count() <= 0) break;
+    if (left.count() <= 0) return false;
     pollfd p{fd_, POLLIN, 0};
     if (::poll(&p, 1, static_cast<int>(left.count())) <= 0) continue;
     ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
     if (n < 0 && errno == EINTR) continue;
     if (n <= 0) {
       *closed = true;
-      break;
+      return false;
     }
-    decoder.Feed(std::string_view(buffer, static_cast<std::size_t>(n)));
-    while (auto body = decoder.Next()) {
+    decoder_.Feed(std::string_view(buffer, static_cast<std::size_t>(n)));
+    while (auto body = decoder_.Next()) {
       auto decoded = DecodeMsgPack(*body);
-      if (auto* value = std::get_if<Value>(&decoded)) frames.push_back(*value);
+      if (auto* value = std::get_if<Value>(&decoded)) pending_.push_back(*value);
     }
+    return true;
   }
+}
+
+std::optional<Value> RawConnection::ReadFrame(std::chrono::milliseconds timeout) {
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  bool closed = false;
+  while (pending_.empty()) {
+    if (!Receive(deadline, &closed)) return std::nullopt;
+  }
+  Value frame = pending_.front();
+  pending_.erase(pending_.begin());
+  return frame;
+}
+
+std::vector<Value> RawConnection::ReadUntilClosed(bool* closed, std::chrono::milliseconds timeout) {
+  *closed = false;
+  const auto deadline = std::chrono::steady_clock::now() + timeout;
+  while (Receive(deadline, closed)) {
+  }
+  std::vector<Value> frames = std::move(pending_);
+  pending_.clear();
   return frames;
 }
 

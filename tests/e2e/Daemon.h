@@ -11,6 +11,7 @@
 #include <string>
 #include <vector>
 
+#include "common/Frame.h"
 #include "common/Value.h"
 #include "platform/linux/reporting_store_reader.h"
 #include "qnreporting/Client.h"
@@ -130,6 +131,8 @@ class RawConnection {
   static std::string Frame(const Value& body);
   static std::string RawFrame(const std::string& body);
 
+  // The next decoded frame; nullopt when the peer closed or `timeout` passed first.
+  std::optional<Value> ReadFrame(std::chrono::milliseconds timeout = kPatience);
   // Reads until the peer closes or `timeout` passes; returns the decoded frames read and
   // sets *closed when the peer closed.
   std::vector<Value> ReadUntilClosed(bool* closed, std::chrono::milliseconds timeout = kPatience);
@@ -137,7 +140,13 @@ class RawConnection {
   bool WaitForPeerClose(std::chrono::milliseconds timeout = kPatience);
 
  private:
+  // Receives once (waiting at most until `deadline`) and decodes what came. Returns false
+  // when the peer closed or the deadline passed.
+  bool Receive(std::chrono::steady_clock::time_point deadline, bool* closed);
+
   int fd_ = -1;
+  FrameDecoder decoder_;
+  std::vector<Value> pending_;  // decoded, not yet returned
 };
 
 }  // namespace qn::e2e
