@@ -322,10 +322,13 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
     return rc;
   }
 
-  void BindJson(sqlite3_stmt* stmt, int index, std::string& buffer, const Value& value) {
-    buffer.clear();
-    AppendJson(buffer, value);
-    sqlite3_bind_text(stmt, index, buffer.data(), static_cast<int>(buffer.size()), SQLITE_STATIC);
+  // Binds the JSON text of `value`, written into `buffer`, which must then stay untouched
+  // until the statement has run.
+  static void BindJson(sqlite3_stmt* stmt, int index, JsonBuffer& buffer, const Value& value) {
+    buffer.Clear();
+    buffer.Append(value);
+    const std::string_view text = buffer.view();
+    sqlite3_bind_text(stmt, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
   }
 
   static void BindText(sqlite3_stmt* stmt, int index, const std::string& text) {
@@ -430,7 +433,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   Statement begin_, commit_, rollback_;
   Statement insert_session_, flush_session_, insert_message_, insert_single_;
   Statement insert_analytics_, insert_powerlog_;
-  std::string json_payload_, json_session_info_, json_user_info_;
+  JsonBuffer json_payload_, json_session_info_, json_user_info_;
 
   const std::shared_ptr<Log> log_;
   const ReportingStore::Options options_;
@@ -515,6 +518,9 @@ std::optional<Error> OpenDatabase(const std::string& path, const ReportingStore:
   // WAL with synchronous=NORMAL: a commit is a write to the WAL file without fsync, so it
   // is safe once the call returns as far as the process is concerned; fsyncs happen at
   // checkpoints.
+  // 16 KiB pages: a quarter of the page writes (system calls) of the default 4 KiB for the
+  // same rows. Takes effect only when the file is created.
+  if (auto e = Exec(db.get(), "PRAGMA page_size=16384", "set page size in " + path)) return e;
   if (auto e = Exec(db.get(), "PRAGMA journal_mode=WAL", "set WAL journal in " + path)) return e;
   if (auto e = Exec(db.get(), "PRAGMA synchronous=NORMAL", "set synchronous in " + path)) return e;
 
