@@ -523,6 +523,10 @@ std::optional<Error> OpenDatabase(const std::string& path, const ReportingStore:
   if (auto e = Exec(db.get(), "PRAGMA page_size=16384", "set page size in " + path)) return e;
   if (auto e = Exec(db.get(), "PRAGMA journal_mode=WAL", "set WAL journal in " + path)) return e;
   if (auto e = Exec(db.get(), "PRAGMA synchronous=NORMAL", "set synchronous in " + path)) return e;
+  // A big batch grows the WAL file; after a checkpoint it is cut back to this size.
+  if (auto e = Exec(db.get(), "PRAGMA journal_size_limit=67108864", "set WAL limit in " + path)) {
+    return e;
+  }
 
   std::int64_t version = 0;
   if (auto e = QueryInt(db.get(), "PRAGMA user_version", &version)) return e;

@@ -243,6 +243,31 @@ TEST_F(ReportingStoreTest, DiskFullLogsTheErrorDropsTheBatchAndLaterBatchesSucce
   EXPECT_EQ(log_->Count("dropped a batch of"), 1);
 }
 
+TEST_F(ReportingStoreTest, DatabaseLockedByAnotherProcessDropsTheBatchUntilReleased) {
+  ReportingStore::Options options;
+  options.busy_timeout_ms = 50;
+  auto store = OpenStore(options);
+
+  // Another connection (as another process would) holds the write lock.
+  sqlite3* other = nullptr;
+  ASSERT_EQ(sqlite3_open(db_path_.c_str(), &other), SQLITE_OK);
+  ASSERT_EQ(sqlite3_exec(other, "BEGIN IMMEDIATE", nullptr, nullptr, nullptr), SQLITE_OK);
+  EXPECT_TRUE(store->AddPowerLogEvent(1, "lost", Value()));
+  store->Drain();  // returns: the writer gave up on the lock
+  auto errors = log_->Matching("dropped a batch of 1 records");
+  ASSERT_EQ(errors.size(), 1u);
+  EXPECT_NE(errors[0].find("database is locked"), std::string::npos) << errors[0];
+
+  ASSERT_EQ(sqlite3_exec(other, "COMMIT", nullptr, nullptr, nullptr), SQLITE_OK);
+  sqlite3_close(other);
+  EXPECT_TRUE(store->AddPowerLogEvent(1, "kept", Value()));
+  store->Drain();
+  auto rows = ReadRows(db_path_);
+  ASSERT_EQ(rows.size(), 1u);
+  EXPECT_EQ(rows[0].name, "kept");
+  EXPECT_EQ(store->stats().failed, 1u);
+}
+
 TEST_F(ReportingStoreTest, FullQueueDropsCountsAndLogsWithoutBlocking) {
   ReportingStore::Options options;
   options.max_queued_records = 10;
