@@ -31,7 +31,7 @@ class ReportingStoreWriter;
 // are). A commit reaches the operating system before Drain returns, so it survives the
 // process ending in any way (exit, _exit, a signal, a crash); on power loss or a kernel
 // crash the last commits before the loss may be missing, but the database stays
-// consistent. The trade-off buys an order of magnitude in commit rate over FULL.
+// consistent. In exchange, a commit costs no fsync.
 //
 // The database uses 16 KiB pages (set when the file is created) and keeps its WAL file at
 // most 64 MiB after a checkpoint.
@@ -60,10 +60,11 @@ class ReportingStore {
   };
 
   // Opens (creating when missing) the database at `path`, creates or checks its schema
-  // and starts the writer thread. REQUIRES: the folder of `path` exists. `log` receives the store's
-  // error lines (default log scope); it may be null (no logging). On failure (the file cannot be
-  // opened or created, it is not a database, or its schema is newer than this program's) returns
+  // and starts the writer thread. `log` receives the store's error lines (default log
+  // scope); it may be null (no logging). On failure (the file cannot be opened or
+  // created, it is not a database, or its schema is newer than this program's) returns
   // null and sets *error when `error` is not null.
+  // REQUIRES: the folder of `path` exists.
   static std::shared_ptr<ReportingStore> Open(const std::string& path, std::shared_ptr<Log> log,
                                               Options options, std::optional<Error>* error);
   static std::shared_ptr<ReportingStore> Open(const std::string& path, std::shared_ptr<Log> log,
