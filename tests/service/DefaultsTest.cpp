@@ -23,7 +23,7 @@ constexpr const char* kSuite = "com.norvel.quenta";
 class DefaultsTest : public ::testing::Test {
  protected:
   void Write(const std::string& key, Value value) {
-    h_.env.defaults->Write(kSuite, key, std::move(value));
+    h_.env.defaults->Set(kSuite, key, std::move(value));
   }
   std::optional<Error> Send(const Client& c, std::optional<std::vector<std::int64_t>> ids) {
     ErrorReplies r;
@@ -43,14 +43,14 @@ TEST(QNReportingDefaultsTest, ReadsTheSuiteAsSettingsAreRead) {
   // Absent: the integer 0; present: the boolean reading.
   EXPECT_TRUE(QNReportingDefaults(*env.platform).Find("disable_reporting")->is_integer());
 
-  env.defaults->Write(kSuite, "device_name", "kitchen");
-  env.defaults->Write(kSuite, "disable_reporting", "YES");
-  env.defaults->Write("other.suite", "device_name", "elsewhere");
+  env.defaults->Set(kSuite, "device_name", "kitchen");
+  env.defaults->Set(kSuite, "disable_reporting", "YES");
+  env.defaults->Set("other.suite", "device_name", "elsewhere");
   EXPECT_EQ(QNReportingDefaults(*env.platform),
             (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", true}}));
 
-  env.defaults->Write(kSuite, "device_name", 12);
-  env.defaults->Write(kSuite, "disable_reporting", 0);
+  env.defaults->Set(kSuite, "device_name", 12);
+  env.defaults->Set(kSuite, "disable_reporting", 0);
   EXPECT_EQ(QNReportingDefaults(*env.platform),
             (Dictionary{{"device_name", "12"}, {"disable_reporting", false}}));
 }
@@ -89,7 +89,7 @@ TEST_F(DefaultsTest, ANotificationReReadsTheSuiteAndPushesItToEverySession) {
   EXPECT_THAT(lines[0], HasSubstr("kitchen"));
 
   // A suite without "device_name" gives defaults without it.
-  h_.env.defaults->Delete(kSuite, "device_name");
+  h_.env.defaults->Remove(kSuite, "device_name");
   h_.PostDefaults();
   EXPECT_EQ(*h_.delegate->getDefaults(), (Dictionary{{"disable_reporting", 0}}));
   EXPECT_NE(h_.delegate->getDefaults(), defaults);  // a fresh dictionary each time
@@ -128,7 +128,7 @@ TEST_F(DefaultsTest, DisabledReportingRefusesSendsAndHidesOtherClientsSessions) 
   EXPECT_EQ(valid[1], (Dictionary{{"reporterID", 42}, {"serviceType", 65535}}));
 
   // Removing the value enables reporting again.
-  h_.env.defaults->Delete(kSuite, "disable_reporting");
+  h_.env.defaults->Remove(kSuite, "disable_reporting");
   h_.PostDefaults();
   EXPECT_TRUE(h_.delegate->isReportingEnabled());
   EXPECT_FALSE(Send(a, std::vector<std::int64_t>{42}));
@@ -142,18 +142,50 @@ TEST_F(DefaultsTest, ANotificationWithoutClientsOnlyUpdatesDefaultsAndSwitch) {
   EXPECT_EQ(*h_.delegate->getDefaults(), (Dictionary{{"disable_reporting", true}}));
 }
 
-TEST_F(DefaultsTest, ADeliveryWithAnotherTokenIsIgnored) {
-  Write("disable_reporting", true);
-  h_.env.notify->DeliverWithToken(kQNReportingDefaultsNotification, 999);
-  h_.Run();
-  EXPECT_EQ(h_.env.log->Count("re-reading"), 0);
-  EXPECT_TRUE(h_.delegate->isReportingEnabled());
+// Notifications whose handler the test calls with any token.
+class StrayNotify final : public Notify {
+ public:
+  std::uint32_t Register(const std::string&, std::shared_ptr<SerialQueue> queue,
+                         std::function<void(int)> handler, int* token) override {
+    queue_ = std::move(queue);
+    handler_ = std::move(handler);
+    *token = 3;
+    return 0;
+  }
+  std::uint32_t Post(const std::string&) override {
+    Deliver(3);
+    return 0;
+  }
+  void Cancel(int) override {}
+  void Deliver(int token) {
+    queue_->Async([handler = handler_, token] { handler(token); });
+  }
+
+ private:
+  std::shared_ptr<SerialQueue> queue_;
+  std::function<void(int)> handler_;
+};
+
+TEST(DefaultsTokenTest, ADeliveryWithAnotherTokenIsIgnored) {
+  auto notify = std::make_shared<StrayNotify>();
+  ServiceHarness h([&](ServiceTestPlatform& env) {
+    env.platform->notify = notify;
+    env.defaults->Set(kSuite, "disable_reporting", true);
+  });
+  notify->Deliver(999);
+  h.Run();
+  EXPECT_EQ(h.env.log->Count("re-reading"), 0);
+  EXPECT_TRUE(h.delegate->isReportingEnabled());
+  notify->Deliver(3);
+  h.Run();
+  EXPECT_EQ(h.env.log->Count("re-reading"), 1);
+  EXPECT_FALSE(h.delegate->isReportingEnabled());
 }
 
 TEST(DefaultsRegistrationTest, AFailedRegistrationIsLoggedAndLeavesReportingOn) {
   ServiceHarness h([](ServiceTestPlatform& env) {
-    env.notify->register_status = 5;
-    env.defaults->Write(kSuite, "disable_reporting", true);
+    env.notify->FailRegistrations(5);
+    env.defaults->Set(kSuite, "disable_reporting", true);
   });
   EXPECT_EQ(h.env.log->Count(": notify setup result 5"), 1);
   h.PostDefaults();
@@ -164,9 +196,9 @@ TEST(DefaultsRegistrationTest, AFailedRegistrationIsLoggedAndLeavesReportingOn) 
 TEST(DefaultsRegistrationTest, TheRegistrationEndsWithTheDelegate) {
   ServiceTestPlatform env;
   auto delegate = QNReportingServiceDelegate::Create(env.platform);
-  EXPECT_EQ(env.notify->Registrations(), 1);
+  EXPECT_EQ(env.notify->Registrations(kQNReportingDefaultsNotification), 1);
   delegate.reset();
-  EXPECT_EQ(env.notify->Registrations(), 0);
+  EXPECT_EQ(env.notify->Registrations(kQNReportingDefaultsNotification), 0);
 }
 
 }  // namespace

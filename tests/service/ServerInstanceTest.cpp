@@ -14,10 +14,10 @@ namespace {
 
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
+using testing::ProcessExited;
 using testing::service::BoolReplies;
 using testing::service::Client;
 using testing::service::ErrorReplies;
-using testing::service::ExitCalled;
 using testing::service::Replies;
 using testing::service::ServiceHarness;
 using testing::service::ServiceTestPlatform;
@@ -75,7 +75,8 @@ class ServerInstanceTest : public ::testing::Test {
 class DriverStatisticsTest : public ServerInstanceTest {
  protected:
   DriverStatisticsTest()
-      : ServerInstanceTest([](ServiceTestPlatform& env) { env.ostrel->SetCounter("X", 5); }) {}
+      : ServerInstanceTest(
+            [](ServiceTestPlatform& env) { env.ostrel->SetCounter("Speaker", "Main", "X", 5); }) {}
 };
 
 TEST_F(ServerInstanceTest, RequestsRunOnTheServerQueueInArrivalOrder) {
@@ -307,7 +308,7 @@ TEST_F(DriverStatisticsTest, StopSendsTheCountersThatGrewThroughTheSessionAndAna
   Client a = h_.Connect(100);
   Create(a, 42, 2);
   Start(a, 42);
-  h_.env.ostrel->SetCounter("X", 12);
+  h_.env.ostrel->SetCounter("Speaker", "Main", "X", 12);
   BoolReplies stop;
   a->stopReportingSessionForID(42, stop.Callback());
   h_.Run();
@@ -331,7 +332,7 @@ TEST_F(DriverStatisticsTest, DestroyStopsAStartedSessionWithoutStatisticsOrItsSt
   Create(a, 42, 2);
   BoolReplies start = Start(a, 42);
   auto session = a.Session(42);
-  h_.env.ostrel->SetCounter("X", 50);
+  h_.env.ostrel->SetCounter("Speaker", "Main", "X", 50);
   BoolReplies destroy;
   a->destroyReportingSession(42, destroy.Callback());
   h_.Run();
@@ -469,7 +470,7 @@ TEST_F(ServerInstanceTest, KillServiceLogsAndExitsWithStatusTwoWithoutReplying) 
   try {
     a->killService(r.Callback());
     FAIL() << "killService returned";
-  } catch (const ExitCalled& exit) {
+  } catch (const ProcessExited& exit) {
     EXPECT_EQ(exit.status, 2);
   }
   EXPECT_EQ(log_.Count("QNReportingServerInstance.cpp:"), 1 + log_.Count("new client"));
