@@ -185,15 +185,6 @@ TEST_F(ServiceDelegateTest, InterruptionRemovesTheClientAndTheLaterInvalidationO
   EXPECT_EQ(h_.env.analytics->EventsNamed(kUptimeEvent).size(), 1u);
 }
 
-TEST_F(ServiceDelegateTest, RepliesAfterTheConnectionEndedGoNowhere) {
-  Client a = h_.Connect(100);
-  a.connection->Request(protocol::Op::kCreateReportingSession, {Value(1)}, 1);
-  a.connection->Invalidate();
-  h_.Run();
-  EXPECT_TRUE(a.connection->Replies().empty());
-  EXPECT_TRUE(h_.delegate->clients().empty());
-}
-
 TEST_F(ServiceDelegateTest, FindReportingSessionForIDTakesTheFirstAcceptedClient) {
   Client a = h_.Connect(100);
   Client b = h_.Connect(200);
@@ -222,17 +213,6 @@ TEST_F(ServiceDelegateTest, FindReportingSessionForIDTakesTheFirstAcceptedClient
   a.connection->Invalidate();
   h_.Run();
   EXPECT_EQ(h_.delegate->findReportingSessionForID(7), b.Session(7));
-}
-
-TEST_F(ServiceDelegateTest, RemoveClientRemovesEveryOccurrenceByIdentity) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(100);  // same pid, another connection
-  ASSERT_EQ(h_.delegate->clients().size(), 2u);
-  h_.delegate->removeClient(a.instance.get());
-  ASSERT_EQ(h_.delegate->clients().size(), 1u);
-  EXPECT_EQ(h_.delegate->clients()[0], b.instance);
-  h_.delegate->removeClient(a.instance.get());
-  EXPECT_EQ(h_.delegate->clients().size(), 1u);
 }
 
 }  // namespace
