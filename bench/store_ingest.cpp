@@ -74,8 +74,10 @@ double BareSqlite(const std::string& path, long rows, int page_size) {
   for (long i = 0; i < rows; i += kRowsPerTransaction) {
     Check(sqlite3_exec(db, "BEGIN", nullptr, nullptr, nullptr), db, "begin");
     for (long j = i; j < i + kRowsPerTransaction && j < rows; ++j) {
-      std::snprintf(row.data(), 16, "%015ld", j);  // rows differ, as real ones do
-      row[15] = 'x';
+      // Rows differ, as real ones do: the row number in the first 15 characters.
+      const std::string number = std::to_string(j);
+      row.replace(15 - std::min<std::size_t>(15, number.size()),
+                  std::min<std::size_t>(15, number.size()), number, 0, 15);
       sqlite3_bind_text(insert, 1, row.data(), static_cast<int>(row.size()), SQLITE_STATIC);
       Check(sqlite3_step(insert), db, "insert");
       sqlite3_reset(insert);
