@@ -198,7 +198,7 @@ class Client::Impl : public std::enable_shared_from_this<Impl> {
     };
     if (start(std::move(deliver)) == 0) return std::nullopt;
     std::unique_lock lock(mu_);
-    cv_.wait_for(lock, timeout, [&] { return state->replies >= needed || ended_; });
+    cv_.wait_for(lock, timeout, [&] { return state->replies >= needed || invalidated_; });
     if (state->replies >= needed) return state->value;
     return std::nullopt;
   }
@@ -206,14 +206,16 @@ class Client::Impl : public std::enable_shared_from_this<Impl> {
   bool WaitForReplies(Timeout timeout) {
     if (OnIoThread()) return false;
     std::unique_lock lock(mu_);
-    cv_.wait_for(lock, timeout, [&] { return (outstanding_ == 0 && delivering_ == 0) || ended_; });
+    cv_.wait_for(lock, timeout,
+                 [&] { return (outstanding_ == 0 && delivering_ == 0) || invalidated_; });
     return outstanding_ == 0 && delivering_ == 0;
   }
 
   bool Flush(Timeout timeout) {
     if (OnIoThread()) return false;
     std::unique_lock lock(mu_);
-    cv_.wait_for(lock, timeout, [&] { return (outgoing_.empty() && !write_active_) || ended_; });
+    cv_.wait_for(lock, timeout,
+                 [&] { return (outgoing_.empty() && !write_active_) || invalidated_; });
     return outgoing_.empty() && !write_active_ && !ended_;
   }
 

@@ -156,9 +156,10 @@ class Client {
                                                 Timeout timeout = kDefaultTimeout);
   std::optional<std::vector<std::int64_t>> getAllReportersSync(Timeout timeout = kDefaultTimeout);
 
-  // Waits until every request sent so far has had the replies it expects. Returns false
-  // when `timeout` passed first, the connection ended with replies outstanding, or the
-  // call was made on the I/O thread.
+  // Waits until every request sent so far has had the replies it expects (and their
+  // callbacks have returned). Returns false when `timeout` passed first, the connection
+  // ended with replies outstanding (the invalidation handler has then run), or the call
+  // was made on the I/O thread.
   bool WaitForReplies(Timeout timeout = kDefaultTimeout);
   // Waits until the connection has ended (the invalidation handler has run). Returns
   // whether it did within `timeout`.
