@@ -130,13 +130,15 @@ void ListenerHarness::Stop() {
 
 RawSocket::RawSocket(const std::string& path) {
   fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  if (!path.empty()) Connect(path);
+}
+
+bool RawSocket::Connect(const std::string& path) {
   sockaddr_un address{};
   address.sun_family = AF_UNIX;
   std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-  if (::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
-    ::close(fd_);
-    fd_ = -1;
-  }
+  connected_ = ::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
+  return connected_;
 }
 
 RawSocket::~RawSocket() {

@@ -114,9 +114,11 @@ class ListenerHarness {
 // A plain blocking socket for bytes a well-behaved client would never send.
 class RawSocket {
  public:
+  // Creates a socket and, when `path` is not empty, connects it.
   explicit RawSocket(const std::string& path);
   ~RawSocket();
-  bool connected() const { return fd_ >= 0; }
+  bool Connect(const std::string& path);
+  bool connected() const { return connected_; }
   void Send(const std::string& bytes);
   void ShutdownWrite();
   // Reads until end of stream (or an error such as a reset, or 20 s of silence) and
@@ -126,6 +128,7 @@ class RawSocket {
 
  private:
   int fd_ = -1;
+  bool connected_ = false;
 };
 
 // A frame with `body` as its bytes (the length header is computed).

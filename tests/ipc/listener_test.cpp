@@ -3,6 +3,7 @@
 #include <gtest/gtest.h>
 
 #include <fcntl.h>
+#include <sys/resource.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -425,6 +426,36 @@ TEST(LinuxIpcTest, PeerThatNeverReadsIsClosedPastTheCap) {
   bool clean_end = false;
   auto frames = raw.ReadUntilEnd(&clean_end);
   EXPECT_LT(frames.size(), 64u);
+}
+
+TEST(LinuxIpcTest, AcceptRecoversWhenDescriptorsRunOut) {
+  ListenerHarness harness;
+  // Sockets made while descriptors are available, connected once they have run out: the
+  // listener's accept then fails with EMFILE until the limit is raised again.
+  std::vector<std::unique_ptr<RawSocket>> sockets;
+  for (int i = 0; i < 3; ++i) sockets.push_back(std::make_unique<RawSocket>(""));
+  rlimit old_limit;
+  ASSERT_EQ(::getrlimit(RLIMIT_NOFILE, &old_limit), 0);
+  const int lowest_free = ::dup(0);
+  ASSERT_GE(lowest_free, 0);
+  ::close(lowest_free);
+  rlimit tight = old_limit;
+  tight.rlim_cur = static_cast<rlim_t>(lowest_free);
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &tight), 0);
+  for (auto& socket : sockets) EXPECT_TRUE(socket->Connect(harness.socket_path()));
+  const bool logged = Eventually([&] { return harness.log().Contains("accept failed"); });
+  ASSERT_EQ(::setrlimit(RLIMIT_NOFILE, &old_limit), 0);
+  ASSERT_TRUE(logged);
+
+  // Every waiting connection is accepted and served once descriptors are back.
+  for (std::uint32_t i = 0; i < sockets.size(); ++i) {
+    sockets[i]->Send(EncodedFrame(Value(Array{1, i + 1, 5})));
+    sockets[i]->ShutdownWrite();
+    auto frames = sockets[i]->ReadUntilEnd();
+    ASSERT_EQ(frames.size(), 1u);
+    EXPECT_EQ(frames[0], Value(Array{i + 1, true}));
+  }
+  EXPECT_EQ(harness.log().Count("accept failed"), 1) << "one line per run of failures";
 }
 
 TEST(LinuxIpcListenerSetupTest, StaleSocketFileIsReplaced) {
