@@ -13,6 +13,7 @@
 
 #include "common/Paths.h"
 #include "qnreporting/Client.h"
+#include "tools/qnreport/Admin.h"
 #include "tools/qnreport/Commands.h"
 #include "tools/qnreport/Shell.h"
 
@@ -20,7 +21,6 @@ namespace qn::qnreport {
 namespace {
 
 constexpr int kExitUsage = 2;
-constexpr int kExitUnavailable = 2;
 
 constexpr const char* kUsage =
     R"(Usage: qnreport [--home DIR] [--socket PATH] [--timeout SECONDS] COMMAND [ARGS]
@@ -44,10 +44,12 @@ Commands:
   reporters                  getAllReporters
   kill                       killService: ends the daemon
   defaults write KEY VALUE | delete KEY | read
-                             the daemon's defaults (not available yet)
-  notify post NAME           post a notification (not available yet)
+                             the daemon's defaults ("device_name", "disable_reporting");
+                             the daemon reads them when notified (see notify)
+  notify post NAME           post a notification; com.norvel.quenta.reporting makes the
+                             daemon re-read its defaults (as `systemctl reload` does)
   events [--sink reporting|analytics|powerlog] [--json]
-                             what the reporting store holds (not available yet)
+                             what the reporting store holds, oldest first
 
 Options:
   --home DIR         the daemon's folders are under DIR (socket: DIR/run/reporting.sock)
@@ -57,7 +59,7 @@ Options:
   --help             this text; `qnreport COMMAND --help` describes one command
 
 Exit status: 0 when every expected reply arrived, 1 when the daemon could not be reached
-or a reply did not come in time, 2 for usage errors and commands not available yet.
+or a reply did not come in time (or an admin command failed), 2 for usage errors.
 )";
 
 constexpr const char* kShellHelp =
@@ -148,13 +150,19 @@ constexpr CommandHelp kCommandHelp[] = {
      "closed the connection.\n"},
     {"defaults",
      "Usage: qnreport defaults write KEY VALUE | delete KEY | read\n\nChanges or "
-     "shows the daemon's defaults. Not available yet.\n"},
+     "shows the daemon's defaults suite (<state>/defaults/com.norvel.quenta.json).\n"
+     "VALUE is read as JSON when it is JSON (true, 1, \"text\"), else as a string (YES).\n"
+     "Keys the daemon reads: device_name, disable_reporting. It reads them when told to:\n"
+     "  qnreport notify post com.norvel.quenta.reporting\n"},
     {"notify",
-     "Usage: qnreport notify post NAME\n\nPosts a system notification. Not available "
-     "yet.\n"},
+     "Usage: qnreport notify post NAME\n\nPosts a system-wide notification (no payload) "
+     "to every process watching NAME.\ncom.norvel.quenta.reporting makes the daemon "
+     "re-read its defaults.\n"},
     {"events",
      "Usage: qnreport events [--sink reporting|analytics|powerlog] [--json]\n\nShows "
-     "what the reporting store holds. Not available yet.\n"},
+     "what the reporting store (<state>/reports.db) holds, oldest first, one row\nper "
+     "line: framework sessions and their messages, single messages (reporting),\n"
+     "analytics events and power-log events. --json prints each row as a JSON object.\n"},
 };
 
 struct GlobalOptions {
@@ -186,13 +194,6 @@ std::unique_ptr<client::Client> Connect(const GlobalOptions& options) {
 
 client::Timeout TimeoutOf(const GlobalOptions& options) {
   return std::chrono::milliseconds(static_cast<std::int64_t>(options.timeout_seconds * 1000));
-}
-
-// TODO(lead): defaults, notify and events are placeholders until the defaults, notify and
-// store APIs are wired in.
-int NotAvailable(const std::string& command) {
-  std::fprintf(stderr, "qnreport: %s: not available yet\n", command.c_str());
-  return kExitUnavailable;
 }
 
 int Main(int argc, char** argv) {
@@ -253,9 +254,12 @@ int Main(int argc, char** argv) {
       return 0;
     }
   }
-  if (command == "defaults" || command == "notify" || command == "events") {
-    return NotAvailable(command);
-  }
+  if (command == "defaults")
+    return RunDefaults(ResolvePaths(options.paths), rest, std::cout, std::cerr);
+  if (command == "notify")
+    return RunNotify(ResolvePaths(options.paths), rest, std::cout, std::cerr);
+  if (command == "events")
+    return RunEvents(ResolvePaths(options.paths), rest, std::cout, std::cerr);
   if (!IsOperationWord(command) || command == "sleep" || command == "wait") {
     return Usage("unknown command " + command);
   }
