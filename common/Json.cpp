@@ -2,6 +2,8 @@
 
 #include <charconv>
 #include <cmath>
+#include <cstdint>
+#include <cstring>
 #include <ctime>
 #include <nlohmann/json.hpp>
 #include <unordered_set>
@@ -39,24 +41,77 @@ std::size_t Utf8SequenceLength(std::string_view s, std::size_t i) {
   return 0;
 }
 
-void AppendBase64(std::string& out, const std::vector<std::uint8_t>& bytes) {
+// The writer's output: a small buffer in front of the string, so that the many short
+// writes of a value are plain copies and the string grows by whole buffers. Flush() before
+// the string is read.
+class Sink {
+ public:
+  static constexpr std::size_t kSize = 2048;
+
+  explicit Sink(std::string& out) : out_(out) {}
+
+  void Put(char c) {
+    if (used_ == kSize) Flush();
+    buffer_[used_++] = c;
+  }
+  // Forced inline: this is the writer's hot path, and the store's ingest rate shows it.
+  [[gnu::always_inline]] void Put(const char* text, std::size_t n) {
+    if (n > kSize - used_) {
+      PutLong(text, n);
+      return;
+    }
+    std::memcpy(buffer_ + used_, text, n);
+    used_ += n;
+  }
+  void Put(std::string_view text) { Put(text.data(), text.size()); }
+  template <std::size_t N>
+  void Put(const char (&literal)[N]) {
+    Put(literal, N - 1);
+  }
+  // Room for `n` bytes to be written in place, then Commit()ted. REQUIRES: n <= kSize.
+  char* Reserve(std::size_t n) {
+    if (n > kSize - used_) Flush();
+    return buffer_ + used_;
+  }
+  void Commit(std::size_t n) { used_ += n; }
+  void Flush() {
+    out_.append(buffer_, used_);
+    used_ = 0;
+  }
+
+ private:
+  // Put() of more than the buffer has room for.
+  void PutLong(const char* text, std::size_t n) {
+    Flush();
+    if (n > kSize) {
+      out_.append(text, n);
+    } else {
+      std::memcpy(buffer_, text, n);
+      used_ = n;
+    }
+  }
+
+  std::string& out_;
+  char buffer_[kSize];
+  std::size_t used_ = 0;
+};
+
+void PutBase64(Sink& out, const std::vector<std::uint8_t>& bytes) {
   static const char* kAlphabet = "ABCDEFGHIJKLMNOPQRSTUVWXYZabcdefghijklmnopqrstuvwxyz0123456789+/";
   std::size_t i = 0;
   for (; i + 3 <= bytes.size(); i += 3) {
     std::uint32_t n = (std::uint32_t{bytes[i]} << 16) | (std::uint32_t{bytes[i + 1]} << 8) |
                       std::uint32_t{bytes[i + 2]};
-    out += kAlphabet[(n >> 18) & 63];
-    out += kAlphabet[(n >> 12) & 63];
-    out += kAlphabet[(n >> 6) & 63];
-    out += kAlphabet[n & 63];
+    const char quad[4] = {kAlphabet[(n >> 18) & 63], kAlphabet[(n >> 12) & 63],
+                          kAlphabet[(n >> 6) & 63], kAlphabet[n & 63]};
+    out.Put(quad, 4);
   }
   if (std::size_t rest = bytes.size() - i; rest > 0) {
     std::uint32_t n = std::uint32_t{bytes[i]} << 16;
     if (rest == 2) n |= std::uint32_t{bytes[i + 1]} << 8;
-    out += kAlphabet[(n >> 18) & 63];
-    out += kAlphabet[(n >> 12) & 63];
-    out += rest == 2 ? kAlphabet[(n >> 6) & 63] : '=';
-    out += '=';
+    const char quad[4] = {kAlphabet[(n >> 18) & 63], kAlphabet[(n >> 12) & 63],
+                          rest == 2 ? kAlphabet[(n >> 6) & 63] : '=', '='};
+    out.Put(quad, 4);
   }
 }
 
@@ -80,62 +135,141 @@ std::optional<std::string> IsoDate(double seconds) {
   return std::string(buf);
 }
 
-// Shortest text that reads back as the same double; integral values get ".0" so that
-// they read back as floating point. REQUIRES: d is finite.
-void AppendDouble(std::string& out, double d) {
-  char buf[400];
+// Shortest text that reads back as the same double, in fixed notation for magnitudes from
+// 1e-5 below 1e17 and scientific otherwise; integral values get ".0" so that they read
+// back as floating point. REQUIRES: d is finite.
+void PutDouble(Sink& out, double d) {
+  // Far more than the longest shortest form (fixed notation below 1e17 included).
+  constexpr std::size_t kRoom = 400;
+  char* p = out.Reserve(kRoom + 2);
   const double magnitude = std::fabs(d);
   const bool fixed = magnitude == 0 || (magnitude >= 1e-5 && magnitude < 1e17);
-  auto r = fixed ? std::to_chars(buf, buf + sizeof buf, d, std::chars_format::fixed)
-                 : std::to_chars(buf, buf + sizeof buf, d, std::chars_format::scientific);
-  std::string_view text(buf, static_cast<std::size_t>(r.ptr - buf));
-  out.append(text);
-  if (text.find_first_of(".e") == std::string_view::npos) out += ".0";
+  auto r = fixed ? std::to_chars(p, p + kRoom, d, std::chars_format::fixed)
+                 : std::to_chars(p, p + kRoom, d, std::chars_format::scientific);
+  std::size_t n = static_cast<std::size_t>(r.ptr - p);
+  if (std::memchr(p, '.', n) == nullptr && std::memchr(p, 'e', n) == nullptr) {
+    std::memcpy(r.ptr, ".0", 2);
+    n += 2;
+  }
+  out.Commit(n);
 }
 
-// Writes Values as JSON text. In strict mode the first value without a JSON form stops the
-// writer, and error() tells what and where; in lenient mode everything is written.
+// Whether none of the 8 bytes in `w` needs attention when writing a string: no byte below
+// 0x20, no '"', no '\\' and no byte of 0x80 or above (those go through UTF-8 validation).
+inline bool PlainWord(std::uint64_t w) {
+  constexpr std::uint64_t kOnes = 0x0101010101010101ULL;
+  constexpr std::uint64_t kHighs = 0x8080808080808080ULL;
+  auto zero_byte = [](std::uint64_t v) { return (v - kOnes) & ~v & kHighs; };
+  const std::uint64_t below_space = (w - kOnes * 0x20) & ~w & kHighs;
+  return ((w & kHighs) | below_space | zero_byte(w ^ (kOnes * '"')) |
+          zero_byte(w ^ (kOnes * '\\'))) == 0;
+}
+
+inline bool PlainByte(unsigned char c) { return c >= 0x20 && c < 0x80 && c != '"' && c != '\\'; }
+
+// Writes the escape of the ASCII byte `c` (a control character, '"' or '\\').
+void PutEscape(Sink& out, unsigned char c) {
+  static constexpr char kHex[] = "0123456789abcdef";
+  char escape[6] = {'\\', 'u', '0', '0', kHex[c >> 4], kHex[c & 15]};
+  switch (c) {
+    case '"':
+    case '\\':
+      escape[1] = static_cast<char>(c);
+      break;
+    case '\b':
+      escape[1] = 'b';
+      break;
+    case '\f':
+      escape[1] = 'f';
+      break;
+    case '\n':
+      escape[1] = 'n';
+      break;
+    case '\r':
+      escape[1] = 'r';
+      break;
+    case '\t':
+      escape[1] = 't';
+      break;
+    default:
+      out.Put(escape, 6);
+      return;
+  }
+  out.Put(escape, 2);
+}
+
+// Writes Values as JSON text, appending to a string. In strict mode the first value without
+// a JSON form stops the writer, and TakeError() tells what and where; in lenient mode
+// everything is written. The store writes every row through here: the common cases (short
+// strings, integers, small maps) allocate nothing, and plain runs of a string are found
+// eight bytes at a time and copied at once.
+template <bool kStrict, bool kPretty>
 class Writer {
  public:
-  Writer(JsonStyle style, bool strict, std::string& out)
-      : pretty_(style == JsonStyle::kPretty), strict_(strict), out_(out) {}
+  explicit Writer(std::string& out) : out_(out) {}
 
-  bool Write(const Value& value, int level) {
+  // Appends the text of `value`; after a strict failure, part of it.
+  void Write(const Value& value) {
+    WriteValue(value, 0);
+    out_.Flush();
+  }
+
+  // What stopped a strict writer; nullopt when all was written.
+  std::optional<Error> TakeError() { return std::move(error_); }
+
+ private:
+  using PathElement = std::variant<const std::string*, std::size_t>;
+
+  bool WriteValue(const Value& value, int level) {
+    if (level > kMaxJsonWriteDepth) {
+      if constexpr (kStrict) return Fail("JSON cannot hold values nested this deep");
+      out_.Put("null");
+      return true;
+    }
     switch (value.kind()) {
       case Value::Kind::kNull:
-        out_ += "null";
+        out_.Put("null");
         return true;
       case Value::Kind::kBool:
-        out_ += *value.as_bool() ? "true" : "false";
+        if (*value.as_bool()) {
+          out_.Put("true");
+        } else {
+          out_.Put("false");
+        }
         return true;
       case Value::Kind::kInt:
-        AppendInteger(*value.as_int64());
+        PutInteger(*value.as_int64());
         return true;
       case Value::Kind::kUInt:
-        AppendInteger(*value.as_uint64());
+        PutInteger(*value.as_uint64());
         return true;
       case Value::Kind::kDouble: {
         double d = *value.as_double();
         if (std::isfinite(d)) {
-          AppendDouble(out_, d);
+          PutDouble(out_, d);
           return true;
         }
-        if (strict_) return Fail("JSON cannot hold NaN or infinity");
-        out_ += "null";
+        if constexpr (kStrict) return Fail("JSON cannot hold NaN or infinity");
+        out_.Put("null");
         return true;
       }
       case Value::Kind::kString:
         return WriteString(*value.as_string());
       case Value::Kind::kData:
-        if (strict_) return Fail("JSON cannot hold data");
-        out_ += '"';
-        AppendBase64(out_, value.as_data()->bytes);
-        out_ += '"';
+        if constexpr (kStrict) return Fail("JSON cannot hold data");
+        out_.Put('"');
+        PutBase64(out_, value.as_data()->bytes);
+        out_.Put('"');
         return true;
       case Value::Kind::kDate: {
-        if (strict_) return Fail("JSON cannot hold a date");
-        auto iso = IsoDate(value.as_date()->seconds_since_1970);
-        out_ += iso ? '"' + *iso + '"' : std::string("null");
+        if constexpr (kStrict) return Fail("JSON cannot hold a date");
+        if (auto iso = IsoDate(value.as_date()->seconds_since_1970)) {
+          out_.Put('"');
+          out_.Put(*iso);
+          out_.Put('"');
+        } else {
+          out_.Put("null");
+        }
         return true;
       }
       case Value::Kind::kArray:
@@ -145,11 +279,6 @@ class Writer {
     }
     return true;
   }
-
-  std::optional<Error> TakeError() { return std::move(error_); }
-
- private:
-  using PathElement = std::variant<const std::string*, std::size_t>;
 
   bool Fail(const std::string& what) {
     std::string path;
@@ -166,102 +295,89 @@ class Writer {
     return false;
   }
 
+  // Only strict mode says where it failed, so only it keeps the path.
+  void Enter(PathElement element) {
+    if constexpr (kStrict) path_.push_back(element);
+  }
+  void Leave() {
+    if constexpr (kStrict) path_.pop_back();
+  }
+
   template <typename T>
-  void AppendInteger(T n) {
-    char buf[24];
-    auto r = std::to_chars(buf, buf + sizeof buf, n);
-    out_.append(buf, static_cast<std::size_t>(r.ptr - buf));
+  void PutInteger(T n) {
+    constexpr std::size_t kRoom = 24;  // 20 digits and a sign at most
+    char* p = out_.Reserve(kRoom);
+    out_.Commit(static_cast<std::size_t>(std::to_chars(p, p + kRoom, n).ptr - p));
   }
 
   void NewLine(int level) {
-    if (!pretty_) return;
-    out_ += '\n';
-    out_.append(static_cast<std::size_t>(level) * 2, ' ');
+    if constexpr (!kPretty) return;
+    out_.Put('\n');
+    for (int i = 0; i < level; ++i) out_.Put("  ");
   }
 
-  bool WriteString(std::string_view s) {
-    static const char* kHex = "0123456789abcdef";
-    out_ += '"';
+  bool WriteString(std::string_view text) {
+    const auto* s = reinterpret_cast<const unsigned char*>(text.data());
+    const std::size_t n = text.size();
+    out_.Put('"');
     std::size_t i = 0, plain_from = 0;
-    auto flush = [&] { out_.append(s.data() + plain_from, i - plain_from); };
-    while (i < s.size()) {
-      const unsigned char c = static_cast<unsigned char>(s[i]);
-      if (c >= 0x20 && c != '"' && c != '\\' && c < 0x80) {
-        ++i;
-        continue;
+    while (true) {
+      // Bytes that need no escaping (valid UTF-8 sequences included) stay in the run that
+      // is copied at once.
+      while (i + 8 <= n) {
+        std::uint64_t w;
+        std::memcpy(&w, s + i, 8);
+        if (!PlainWord(w)) break;
+        i += 8;
       }
+      while (i < n && PlainByte(s[i])) ++i;
+      if (i >= n) break;
+      const unsigned char c = s[i];
       if (c >= 0x80) {
-        if (std::size_t n = Utf8SequenceLength(s, i)) {
-          i += n;
+        if (std::size_t length = Utf8SequenceLength(text, i)) {
+          i += length;
           continue;
         }
-        if (strict_) return Fail("JSON cannot hold a string that is not valid UTF-8");
-        flush();
-        out_ += "\xef\xbf\xbd";  // U+FFFD for the invalid byte
-        plain_from = ++i;
-        continue;
-      }
-      flush();
-      switch (c) {
-        case '"':
-          out_ += "\\\"";
-          break;
-        case '\\':
-          out_ += "\\\\";
-          break;
-        case '\b':
-          out_ += "\\b";
-          break;
-        case '\f':
-          out_ += "\\f";
-          break;
-        case '\n':
-          out_ += "\\n";
-          break;
-        case '\r':
-          out_ += "\\r";
-          break;
-        case '\t':
-          out_ += "\\t";
-          break;
-        default:
-          out_ += "\\u00";
-          out_ += kHex[c >> 4];
-          out_ += kHex[c & 15];
+        if constexpr (kStrict) return Fail("JSON cannot hold a string that is not valid UTF-8");
+        out_.Put(text.data() + plain_from, i - plain_from);
+        out_.Put("\xef\xbf\xbd");  // U+FFFD for the invalid byte
+      } else {
+        out_.Put(text.data() + plain_from, i - plain_from);
+        PutEscape(out_, c);
       }
       plain_from = ++i;
     }
-    flush();
-    out_ += '"';
+    out_.Put(text.data() + plain_from, n - plain_from);
+    out_.Put('"');
     return true;
   }
 
   bool WriteArray(const Array& array, int level) {
     if (array.empty()) {
-      out_ += "[]";
+      out_.Put("[]");
       return true;
     }
-    out_ += '[';
+    out_.Put('[');
     for (std::size_t i = 0; i < array.size(); ++i) {
-      if (i > 0) out_ += ',';
+      if (i > 0) out_.Put(',');
       NewLine(level + 1);
-      path_.emplace_back(i);
-      if (!Write(array[i], level + 1)) return false;
-      path_.pop_back();
+      Enter(i);
+      if (!WriteValue(array[i], level + 1)) return false;
+      Leave();
     }
     NewLine(level);
-    out_ += ']';
+    out_.Put(']');
     return true;
   }
 
   bool WriteDictionary(const Dictionary& dictionary, int level) {
     if (dictionary.empty()) {
-      out_ += "{}";
+      out_.Put("{}");
       return true;
     }
     // Printed forms of non-string keys may repeat a key: keep the first.
     std::optional<std::unordered_set<std::string>> written;
-    if (!strict_) {
+    if constexpr (!kStrict) {
       for (const auto& [key, unused] : dictionary) {
         if (!key.is_string()) {
           written.emplace();
@@ -269,36 +385,38 @@ class Writer {
         }
       }
     }
-    out_ += '{';
+    out_.Put('{');
     bool first = true;
     for (const auto& [key, element] : dictionary) {
       std::string printed;
       const std::string* name = key.as_string();
       if (!name) {
-        if (strict_) {
+        if constexpr (kStrict) {
           return Fail("JSON object keys must be strings, not " + key.Description());
         }
         printed = key.Description();
         name = &printed;
       }
       if (written && !written->insert(*name).second) continue;
-      if (!first) out_ += ',';
+      if (!first) out_.Put(',');
       first = false;
       NewLine(level + 1);
       if (!WriteString(*name)) return false;
-      out_ += pretty_ ? ": " : ":";
-      path_.emplace_back(name);
-      if (!Write(element, level + 1)) return false;
-      path_.pop_back();
+      if constexpr (kPretty) {
+        out_.Put(": ");
+      } else {
+        out_.Put(':');
+      }
+      Enter(name);
+      if (!WriteValue(element, level + 1)) return false;
+      Leave();
     }
     NewLine(level);
-    out_ += '}';
+    out_.Put('}');
     return true;
   }
 
-  const bool pretty_;
-  const bool strict_;
-  std::string& out_;
+  Sink out_;
   std::vector<PathElement> path_;
   std::optional<Error> error_;
 };
@@ -373,21 +491,37 @@ class ValueBuilder {
   std::optional<Error> error_;
 };
 
+// Appends the text of `value` to `out`. Returns the strict mode's error, if any (then `out`
+// holds part of the text).
+template <bool kStrict>
+std::optional<Error> WriteJson(const Value& value, JsonStyle style, std::string& out) {
+  if (style == JsonStyle::kPretty) {
+    Writer<kStrict, true> writer(out);
+    writer.Write(value);
+    return writer.TakeError();
+  }
+  Writer<kStrict, false> writer(out);
+  writer.Write(value);
+  return writer.TakeError();
+}
+
 }  // namespace
 
 std::optional<Error> ToJson(const Value& value, JsonStyle style, std::string& out) {
   std::string text;
-  Writer writer(style, /*strict=*/true, text);
-  if (!writer.Write(value, 0)) return writer.TakeError();
+  if (auto error = WriteJson<true>(value, style, text)) return error;
   out = std::move(text);
   return std::nullopt;
 }
 
 std::string ToJsonLenient(const Value& value, JsonStyle style) {
   std::string text;
-  Writer writer(style, /*strict=*/false, text);
-  writer.Write(value, 0);
+  WriteJson<false>(value, style, text);
   return text;
+}
+
+void AppendJsonLenient(std::string& out, const Value& value) {
+  WriteJson<false>(value, JsonStyle::kCompact, out);
 }
 
 std::optional<Error> ParseJson(std::string_view text, Value& out) {

@@ -12,7 +12,7 @@
 #include <utility>
 #include <vector>
 
-#include "platform/linux/store_json.h"
+#include "common/Json.h"
 
 // An error line to the store's log, when it has one.
 #define QN_STORE_ERROR(format, ...)                                                \
@@ -324,11 +324,10 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
 
   // Binds the JSON text of `value`, written into `buffer`, which must then stay untouched
   // until the statement has run.
-  static void BindJson(sqlite3_stmt* stmt, int index, JsonBuffer& buffer, const Value& value) {
-    buffer.Clear();
-    buffer.Append(value);
-    const std::string_view text = buffer.view();
-    sqlite3_bind_text(stmt, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
+  static void BindJson(sqlite3_stmt* stmt, int index, std::string& buffer, const Value& value) {
+    buffer.clear();
+    AppendJsonLenient(buffer, value);
+    BindText(stmt, index, buffer);
   }
 
   static void BindText(sqlite3_stmt* stmt, int index, const std::string& text) {
@@ -433,7 +432,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   Statement begin_, commit_, rollback_;
   Statement insert_session_, flush_session_, insert_message_, insert_single_;
   Statement insert_analytics_, insert_powerlog_;
-  JsonBuffer json_payload_, json_session_info_, json_user_info_;
+  std::string json_payload_, json_session_info_, json_user_info_;
 
   const std::shared_ptr<Log> log_;
   const ReportingStore::Options options_;

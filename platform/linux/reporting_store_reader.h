@@ -28,9 +28,10 @@ namespace qn {
 //   analytics_events(id INTEGER PRIMARY KEY, name TEXT, payload TEXT, time REAL)
 //   powerlog_events(id INTEGER PRIMARY KEY, subsystem INTEGER, name TEXT, payload TEXT,
 //                   time REAL)
-// Every TEXT column except names holds compact JSON (see store_json.h for how values JSON
-// cannot hold are written). Times are seconds since the Unix epoch, taken when the record
-// was handed to the store. Within a table, ids follow the order of hand-over.
+// Every TEXT column except names holds compact lenient JSON (ToJsonLenient in common/Json.h
+// says how values JSON cannot hold are written). Times are seconds since the Unix epoch,
+// taken when the record was handed to the store. Within a table, ids follow the order of
+// hand-over.
 
 // The sinks whose rows the store keeps: "reporting" (livo_sessions and livo_messages),
 // "analytics", "powerlog".

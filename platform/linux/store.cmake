@@ -3,7 +3,6 @@
 qn_library(qn_linux_store
   LINK qn_common PkgConfig::SQLITE3 Threads::Threads
   FILES
-    store_json.cpp
     reporting_store.cpp
     reporting_store_reader.cpp
     store_sinks.cpp

@@ -8,6 +8,7 @@
 #include <nlohmann/json.hpp>
 #include <random>
 #include <string>
+#include <utility>
 
 namespace qn {
 namespace {
@@ -77,13 +78,39 @@ TEST(JsonTest, StringsAreEscaped) {
             "\"caf\xC3\xA9 \xE2\x82\xAC \xF0\x9F\x8E\xB5\"");
 }
 
-TEST(JsonTest, DoublesReadBackExactly) {
-  EXPECT_EQ(Strict(Value(1.0)), "1.0");
-  EXPECT_EQ(Strict(Value(-0.0)), "-0.0");
-  EXPECT_EQ(Strict(Value(0.1)), "0.1");
-  EXPECT_EQ(Strict(Value(1000000.0)), "1000000.0");
-  EXPECT_EQ(Strict(Value(1e300)), "1e+300");
-  EXPECT_EQ(Strict(Value(2.5e-7)), "2.5e-07");
+// Strings are scanned eight bytes at a time: every ASCII byte at every offset in a word,
+// and runs longer than the writer's buffer, come out as a reference writer writes them.
+TEST(JsonTest, StringsMatchAReferenceWriterAtEveryOffset) {
+  for (int c = 0; c < 0x80; ++c) {
+    for (std::size_t offset = 0; offset < 17; ++offset) {
+      std::string s = std::string(offset, 'a') + static_cast<char>(c) + "bcdefghÃ©xyz";
+      EXPECT_EQ(Strict(Value(s)), nlohmann::json(s).dump()) << c << " at " << offset;
+    }
+  }
+  const std::string long_text = std::string(40000, 'x') + "â¬" + std::string(20000, '"');
+  EXPECT_EQ(ToJsonLenient(Value(long_text)), nlohmann::json(long_text).dump());
+}
+
+TEST(JsonTest, NumbersReadBackExactly) {
+  const std::pair<Value, const char*> cases[] = {
+      {Value(std::numeric_limits<std::int64_t>::min()), "-9223372036854775808"},
+      {Value(1.0), "1.0"},
+      {Value(-0.0), "-0.0"},
+      {Value(0.1), "0.1"},
+      {Value(1.0 / 3), "0.3333333333333333"},
+      {Value(1000000.0), "1000000.0"},
+      // Fixed notation from 1e-5 up to below 1e17, scientific outside.
+      {Value(1e16), "10000000000000000.0"},
+      {Value(1e17), "1e+17"},
+      {Value(123456789012345678.0), "1.2345678901234568e+17"},
+      {Value(1e-5), "0.00001"},
+      {Value(9.99e-6), "9.99e-06"},
+      {Value(2.5e-7), "2.5e-07"},
+      {Value(1e300), "1e+300"},
+      {Value(5e-324), "5e-324"},
+      {Value(std::numeric_limits<double>::max()), "1.7976931348623157e+308"},
+  };
+  for (const auto& [value, text] : cases) EXPECT_EQ(Strict(value), text);
   std::mt19937_64 random(99);
   for (int i = 0; i < 2000; ++i) {
     std::uint64_t bits = random();
@@ -144,6 +171,45 @@ TEST(JsonTest, LenientWritesEverything) {
   EXPECT_EQ(ToJsonLenient(Sample(), JsonStyle::kPretty), Strict(Sample(), JsonStyle::kPretty));
 }
 
+TEST(JsonTest, LenientReplacesEachInvalidUtf8Byte) {
+  const std::string r = "\xef\xbf\xbd";  // U+FFFD
+  // Stray, overlong, surrogate, above U+10FFFF, truncated.
+  EXPECT_EQ(
+      ToJsonLenient(Value("bad \xFF \xC0\xAF \xED\xA0\x80 \xF4\x90\x80\x80 \xE2\x82")),
+      "\"bad " + r + " " + r + r + " " + r + r + r + " " + r + r + r + r + " " + r + r + "\"");
+  // Whatever the bytes, a strict parser accepts the result.
+  std::string all_bytes;
+  for (int c = 0; c < 256; ++c) all_bytes.push_back(static_cast<char>(c));
+  EXPECT_FALSE(
+      nlohmann::json::parse(ToJsonLenient(Value(all_bytes)), nullptr, false).is_discarded());
+}
+
+TEST(JsonTest, AppendJsonLenientAppends) {
+  std::string buffer = "prefix:";
+  AppendJsonLenient(buffer, Value(Dictionary{{"k", "v"}}));
+  EXPECT_EQ(buffer, R"(prefix:{"k":"v"})");
+}
+
+TEST(JsonTest, VeryDeepValuesAreCutOffOrRejectedNotOverflowed) {
+  Value v(1);
+  for (int i = 0; i < 2000; ++i) v = Value(Array{v});
+  auto parsed = nlohmann::json::parse(ToJsonLenient(v), nullptr, false);
+  ASSERT_FALSE(parsed.is_discarded());
+  int depth = 0;
+  const nlohmann::json* level = &parsed;
+  while (level->is_array()) {
+    ASSERT_EQ(level->size(), 1u);
+    level = &(*level)[0];
+    ++depth;
+  }
+  EXPECT_TRUE(level->is_null());
+  EXPECT_EQ(depth, kMaxJsonWriteDepth + 1);
+  std::string out;
+  auto error = ToJson(v, JsonStyle::kCompact, out);
+  ASSERT_TRUE(error);
+  EXPECT_EQ(error->code, static_cast<std::int64_t>(JsonErrorCode::kInvalidValue));
+}
+
 TEST(JsonTest, LenientBase64AndDates) {
   const char* expected[] = {"\"\"",         "\"Zg==\"",     "\"Zm8=\"",    "\"Zm9v\"",
                             "\"Zm9vYg==\"", "\"Zm9vYmE=\"", "\"Zm9vYmFy\""};
@@ -155,6 +221,7 @@ TEST(JsonTest, LenientBase64AndDates) {
   EXPECT_EQ(ToJsonLenient(Value(Date{0})), "\"1970-01-01T00:00:00.000Z\"");
   EXPECT_EQ(ToJsonLenient(Value(Date{1705329005.9996})), "\"2024-01-15T14:30:06.000Z\"");
   EXPECT_EQ(ToJsonLenient(Value(Date{-0.5})), "\"1969-12-31T23:59:59.500Z\"");
+  EXPECT_EQ(ToJsonLenient(Value(Date{1e20})), "null");  // beyond any calendar
 }
 
 TEST(JsonTest, ParsesIntoValuesInOrder) {

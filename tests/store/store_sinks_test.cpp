@@ -7,7 +7,7 @@
 #include <future>
 #include <thread>
 
-#include "platform/linux/store_json.h"
+#include "common/Json.h"
 #include "tests/fakes/FakeAnalytics.h"
 #include "tests/fakes/FakeEnerdex.h"
 #include "tests/fakes/LogCapture.h"
@@ -88,13 +88,13 @@ class FakeHarness final : public EventSinkHarness {
   std::vector<RecordedEvent> RecordedAnalytics() override {
     std::vector<RecordedEvent> events;
     for (const auto& e : analytics_.Events())
-      events.push_back({0, e.name, StoreJsonText(e.payload)});
+      events.push_back({0, e.name, ToJsonLenient(e.payload)});
     return events;
   }
   std::vector<RecordedEvent> RecordedPowerLog() override {
     std::vector<RecordedEvent> events;
     for (const auto& e : enerdex_.Events()) {
-      events.push_back({e.subsystem, e.name, StoreJsonText(e.payload)});
+      events.push_back({e.subsystem, e.name, ToJsonLenient(e.payload)});
     }
     return events;
   }
