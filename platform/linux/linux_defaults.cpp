@@ -4,12 +4,12 @@
 #include <sys/file.h>
 #include <unistd.h>
 
-#include <cctype>
 #include <cerrno>
 #include <functional>
 
 #include "common/Files.h"
 #include "common/Json.h"
+#include "platform/defaults_suite.h"
 #include "platform/linux/small_file.h"
 
 namespace qn {
@@ -31,28 +31,6 @@ std::optional<Error> CheckSuiteName(const std::string& suite) {
   return std::nullopt;
 }
 
-bool EqualsIgnoringCase(std::string_view a, std::string_view b) {
-  if (a.size() != b.size()) return false;
-  for (std::size_t i = 0; i < a.size(); ++i) {
-    if (std::tolower(static_cast<unsigned char>(a[i])) !=
-        std::tolower(static_cast<unsigned char>(b[i]))) {
-      return false;
-    }
-  }
-  return true;
-}
-
-// Whether the text starts (after blanks and a sign) with a number that is not zero.
-bool StartsWithNonZeroNumber(std::string_view s) {
-  std::size_t i = 0;
-  while (i < s.size() && std::isspace(static_cast<unsigned char>(s[i]))) ++i;
-  if (i < s.size() && (s[i] == '+' || s[i] == '-')) ++i;
-  for (; i < s.size() && std::isdigit(static_cast<unsigned char>(s[i])); ++i) {
-    if (s[i] != '0') return true;
-  }
-  return false;
-}
-
 bool IsMissingFile(const Error& error) { return error.domain == "posix" && error.code == ENOENT; }
 
 // Reads the suite's file: a missing file is reported as ENOENT.
@@ -72,32 +50,6 @@ std::optional<Error> ReadSuiteFile(const std::string& path, Dictionary& out) {
   return std::nullopt;
 }
 
-class LinuxDefaultsSuite final : public DefaultsSuite {
- public:
-  explicit LinuxDefaultsSuite(Dictionary values) : values_(std::move(values)) {}
-
-  std::optional<Value> ObjectForKey(const std::string& key) const override {
-    if (const Value* v = values_.Find(key)) return *v;
-    return std::nullopt;
-  }
-
-  std::optional<std::string> StringForKey(const std::string& key) const override {
-    const Value* v = values_.Find(key);
-    if (v == nullptr) return std::nullopt;
-    if (const std::string* s = v->as_string()) return *s;
-    if (v->is_number()) return v->Description();
-    return std::nullopt;
-  }
-
-  bool BoolForKey(const std::string& key) const override {
-    const Value* v = values_.Find(key);
-    return v != nullptr && DefaultsBoolValue(*v);
-  }
-
- private:
-  const Dictionary values_;
-};
-
 class LinuxDefaults final : public Defaults {
  public:
   explicit LinuxDefaults(LinuxDefaultsOptions options) : options_(std::move(options)) {}
@@ -113,7 +65,7 @@ class LinuxDefaults final : public Defaults {
       }
       values = Dictionary();
     }
-    return std::make_unique<LinuxDefaultsSuite>(std::move(values));
+    return std::make_unique<SnapshotDefaultsSuite>(std::move(values));
   }
 
  private:
@@ -158,16 +110,6 @@ std::optional<Error> ChangeSuite(const std::string& state_dir, const std::string
 }
 
 }  // namespace
-
-bool DefaultsBoolValue(const Value& value) {
-  if (const bool* b = value.as_bool()) return *b;
-  if (value.is_number()) return value.as_double().value_or(0) != 0;
-  if (const std::string* s = value.as_string()) {
-    return EqualsIgnoringCase(*s, "YES") || EqualsIgnoringCase(*s, "true") ||
-           StartsWithNonZeroNumber(*s);
-  }
-  return false;
-}
 
 std::string DefaultsSuitePath(const std::string& state_dir, const std::string& suite) {
   return state_dir + "/defaults/" + suite + ".json";

@@ -30,9 +30,6 @@ struct LinuxDefaultsOptions {
 // Safe from any thread.
 std::shared_ptr<Defaults> NewLinuxDefaults(LinuxDefaultsOptions options);
 
-// The boolean reading of a stored value, as DefaultsSuite::BoolForKey describes it.
-bool DefaultsBoolValue(const Value& value);
-
 // <state_dir>/defaults/<suite>.json.
 std::string DefaultsSuitePath(const std::string& state_dir, const std::string& suite);
 

@@ -3,6 +3,8 @@
 #include <map>
 #include <mutex>
 
+#include "platform/orientation_text.h"
+
 namespace qn {
 namespace {
 
@@ -43,25 +45,6 @@ class LinuxOrientation final : public Orientation {
 };
 
 }  // namespace
-
-std::string OrientationText(std::int32_t orientation) {
-  switch (orientation) {
-    case 1:
-      return "Portrait";
-    case 2:
-      return "PortraitUpsideDown";
-    case 3:
-      return "LandscapeLeft";
-    case 4:
-      return "LandscapeRight";
-    case 5:
-      return "FaceUp";
-    case 6:
-      return "FaceDown";
-    default:
-      return "Unknown";
-  }
-}
 
 std::shared_ptr<Orientation> NewLinuxOrientation() { return std::make_shared<LinuxOrientation>(); }
 

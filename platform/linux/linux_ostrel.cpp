@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "platform/linux/small_file.h"
+#include "platform/ostrel_samples.h"
 
 namespace qn {
 namespace {
@@ -192,66 +193,23 @@ class LinuxOstrel final : public Ostrel {
 
   std::optional<Dictionary> CreateSamplesDelta(const Dictionary* earlier, const Dictionary& later,
                                                std::optional<OstrelError>* error) override {
-    if (earlier == nullptr) {
-      SetError(error, ENODATA);
-      return std::nullopt;
-    }
-    Dictionary delta;
-    for (const auto& [key, sample] : later) {
-      const std::optional<std::int64_t> now = SampleValue(sample);
-      if (!now) {
-        SetError(error, EINVAL);
-        return std::nullopt;
-      }
-      const Value* before = earlier->Find(key);
-      if (before == nullptr) {
-        SetError(error, ENODATA);
-        return std::nullopt;
-      }
-      const std::optional<std::int64_t> then = SampleValue(*before);
-      if (!then) {
-        SetError(error, EINVAL);
-        return std::nullopt;
-      }
-      const auto difference = static_cast<std::int64_t>(static_cast<std::uint64_t>(*now) -
-                                                        static_cast<std::uint64_t>(*then));
-      Dictionary entry = *sample.as_dictionary();
-      entry.Set("value", difference);
-      delta.Set(key, std::move(entry));
-    }
-    return delta;
+    return OstrelSamplesDelta(earlier, later, error);
   }
 
   void Iterate(const Dictionary& samples,
                const std::function<int(const Value& channel_sample)>& fn) const override {
-    for (const auto& [key, sample] : samples) {
-      if (fn(sample) != 0) return;
-    }
+    OstrelIterateSamples(samples, fn);
   }
 
   std::int64_t SimpleGetIntegerValue(const Value& channel_sample, int /*options*/) const override {
-    return SampleValue(channel_sample).value_or(0);
+    return OstrelSampleValue(channel_sample).value_or(0);
   }
 
   std::optional<std::string> ChannelGetChannelName(const Value& channel_sample) const override {
-    const Dictionary* d = channel_sample.as_dictionary();
-    if (d == nullptr) return std::nullopt;
-    const Value* name = d->Find("name");
-    if (name == nullptr || name->as_string() == nullptr) return std::nullopt;
-    return *name->as_string();
+    return OstrelSampleName(channel_sample);
   }
 
  private:
-  static std::optional<std::int64_t> SampleValue(const Value& sample) {
-    const Dictionary* d = sample.as_dictionary();
-    if (d == nullptr) return std::nullopt;
-    const Value* value = d->Find("value");
-    if (value == nullptr) return std::nullopt;
-    if (auto i = value->as_int64()) return i;
-    if (auto u = value->as_uint64()) return static_cast<std::int64_t>(*u);
-    return std::nullopt;
-  }
-
   const fs::path root_;
 };
 

@@ -1,5 +1,7 @@
 #include "tests/fakes/FakeOrientation.h"
 
+#include "platform/orientation_text.h"
+
 namespace qn::testing {
 
 void FakeOrientation::RegisterDeviceOrientation(const std::string& callback_id, Callback callback) {
@@ -27,22 +29,7 @@ void FakeOrientation::UnregisterUIOrientation(const std::string& callback_id) {
 }
 
 std::string FakeOrientation::OrientationToString(std::int32_t orientation) const {
-  switch (orientation) {
-    case 1:
-      return "Portrait";
-    case 2:
-      return "PortraitUpsideDown";
-    case 3:
-      return "LandscapeLeft";
-    case 4:
-      return "LandscapeRight";
-    case 5:
-      return "FaceUp";
-    case 6:
-      return "FaceDown";
-    default:
-      return "Unknown";
-  }
+  return OrientationText(orientation);
 }
 
 int FakeOrientation::FireDevice(std::int32_t orientation) {

@@ -20,8 +20,7 @@ class FakeOrientation final : public Orientation {
   void RegisterUIOrientation(const std::string& callback_id, Callback callback) override;
   void UnregisterDeviceOrientation(const std::string& callback_id) override;
   void UnregisterUIOrientation(const std::string& callback_id) override;
-  // 1 "Portrait", 2 "PortraitUpsideDown", 3 "LandscapeLeft", 4 "LandscapeRight",
-  // 5 "FaceUp", 6 "FaceDown", anything else "Unknown".
+  // OrientationText (platform/orientation_text.h).
   std::string OrientationToString(std::int32_t orientation) const override;
 
   // Calls every registered device (or UI) callback with `orientation`; returns how many.

@@ -4,6 +4,8 @@
 #include <cerrno>
 #include <limits>
 
+#include "platform/ostrel_samples.h"
+
 namespace qn::testing {
 namespace {
 
@@ -19,13 +21,6 @@ const std::string* StringField(const Value& entry, std::string_view key) {
   if (d == nullptr) return nullptr;
   const Value* v = d->Find(key);
   return v ? v->as_string() : nullptr;
-}
-
-std::optional<std::int64_t> SampleValue(const Value& sample) {
-  const Dictionary* d = sample.as_dictionary();
-  if (d == nullptr) return std::nullopt;
-  const Value* v = d->Find("value");
-  return v ? v->as_int64() : std::nullopt;
 }
 
 }  // namespace
@@ -103,42 +98,24 @@ std::optional<Dictionary> FakeOstrel::CreateSamplesDelta(const Dictionary* earli
                                                          std::optional<OstrelError>* error) {
   std::lock_guard lock(mu_);
   ++deltas_;
-  auto fail = [&](std::int64_t code) -> std::optional<Dictionary> {
-    if (error) *error = OstrelError{code};
+  if (delta_failure_) {
+    if (error) *error = OstrelError{*delta_failure_};
     return std::nullopt;
-  };
-  if (delta_failure_) return fail(*delta_failure_);
-  if (earlier == nullptr) return fail(ENODATA);
-  Dictionary delta;
-  for (const auto& [key, sample] : later) {
-    const Value* before = earlier->Find(key);
-    if (before == nullptr) return fail(ENODATA);
-    const auto now = SampleValue(sample);
-    const auto then = SampleValue(*before);
-    if (!now || !then) return fail(EINVAL);
-    Dictionary entry = *sample.as_dictionary();
-    entry.Set("value", static_cast<std::int64_t>(static_cast<std::uint64_t>(*now) -
-                                                 static_cast<std::uint64_t>(*then)));
-    delta.Set(key, std::move(entry));
   }
-  return delta;
+  return OstrelSamplesDelta(earlier, later, error);
 }
 
 void FakeOstrel::Iterate(const Dictionary& samples,
                          const std::function<int(const Value& channel_sample)>& fn) const {
-  for (const auto& [key, sample] : samples) {
-    if (fn(sample) != 0) return;
-  }
+  OstrelIterateSamples(samples, fn);
 }
 
 std::int64_t FakeOstrel::SimpleGetIntegerValue(const Value& channel_sample, int) const {
-  return SampleValue(channel_sample).value_or(0);
+  return OstrelSampleValue(channel_sample).value_or(0);
 }
 
 std::optional<std::string> FakeOstrel::ChannelGetChannelName(const Value& channel_sample) const {
-  const std::string* name = StringField(channel_sample, "name");
-  if (name == nullptr) return std::nullopt;
-  return *name;
+  return OstrelSampleName(channel_sample);
 }
 
 void FakeOstrel::AddGroup(const std::string& group, const std::string& subgroup) {
