@@ -10,37 +10,23 @@
 #include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
+
+#include "tests/fakes/TempDir.h"
 
 namespace qn {
 namespace {
 
 namespace fs = std::filesystem;
 
-class FilesTest : public testing::Test {
+class FilesTest : public ::testing::Test {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "qn-files-XXXXXX").string();
-    ASSERT_NE(mkdtemp(pattern.data()), nullptr);
-    root_ = pattern;
-    old_umask_ = umask(022);
-  }
-  void TearDown() override {
-    umask(old_umask_);
-    std::error_code ignored;
-    fs::remove_all(root_, ignored);
-  }
+  FilesTest() : old_umask_(umask(022)) {}
+  ~FilesTest() override { umask(old_umask_); }
 
   static mode_t ModeOf(const std::string& path) {
     struct stat st;
     EXPECT_EQ(stat(path.c_str(), &st), 0) << path;
     return st.st_mode & 07777;
-  }
-  static std::string Read(const std::string& path) {
-    std::ifstream in(path);
-    std::stringstream s;
-    s << in.rdbuf();
-    return s.str();
   }
   std::vector<std::string> Listing(const std::string& dir) const {
     std::vector<std::string> names;
@@ -51,8 +37,9 @@ class FilesTest : public testing::Test {
     return names;
   }
 
-  std::string root_;
-  mode_t old_umask_ = 0;
+  const mode_t old_umask_;
+  testing::TempDir dir_;
+  const std::string& root_ = dir_.path();
 };
 
 TEST_F(FilesTest, CreatedDirectoriesGetExactlyTheModeDespiteTheUmask) {
@@ -96,19 +83,19 @@ TEST_F(FilesTest, AComponentThatIsAFileFails) {
 TEST_F(FilesTest, AtomicWriteCreatesAndReplaces) {
   const std::string path = root_ + "/summary.json";
   ASSERT_FALSE(WriteFileAtomically(path, "first"));
-  EXPECT_EQ(Read(path), "first");
+  EXPECT_EQ(testing::ReadFileText(path), "first");
   EXPECT_EQ(ModeOf(path), 0644u);  // 0666 less the umask
   struct stat before;
   ASSERT_EQ(stat(path.c_str(), &before), 0);
 
   const std::string big(3 << 20, 'b');
   ASSERT_FALSE(WriteFileAtomically(path, big));
-  EXPECT_EQ(Read(path), big);
+  EXPECT_EQ(testing::ReadFileText(path), big);
   struct stat after;
   ASSERT_EQ(stat(path.c_str(), &after), 0);
   EXPECT_NE(before.st_ino, after.st_ino);  // a new file moved into place, not rewritten
   ASSERT_FALSE(WriteFileAtomically(path, ""));
-  EXPECT_EQ(Read(path), "");
+  EXPECT_EQ(testing::ReadFileText(path), "");
   EXPECT_EQ(Listing(root_), (std::vector<std::string>{"summary.json"}));  // no temporaries
 }
 
@@ -127,7 +114,7 @@ TEST_F(FilesTest, AtomicWriteFailuresLeaveNothingBehind) {
   error = WriteFileAtomically(root_ + "/plain/file.json", "text");
   ASSERT_TRUE(error);
   EXPECT_EQ(error->code, ENOTDIR);
-  EXPECT_EQ(Read(root_ + "/plain"), "x");
+  EXPECT_EQ(testing::ReadFileText(root_ + "/plain"), "x");
   EXPECT_EQ(Listing(root_), (std::vector<std::string>{"dir.json", "plain"}));
   EXPECT_TRUE(WriteFileAtomically(root_ + "/", "text"));
 }

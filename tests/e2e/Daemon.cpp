@@ -16,26 +16,18 @@
 #include <cstdlib>
 #include <cstring>
 #include <filesystem>
-#include <fstream>
-#include <sstream>
 #include <thread>
 
 #include "common/Frame.h"
 #include "common/Json.h"
 #include "common/MsgPack.h"
+#include "tests/store/store_test_util.h"
 
 extern char** environ;
 
 namespace qn::e2e {
 
 namespace {
-
-std::string ReadFile(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
-  std::ostringstream text;
-  text << in.rdbuf();
-  return text.str();
-}
 
 // The parent's environment without the variables through which systemd talks to a service,
 // so that the daemon never mistakes the test's environment for its own.
@@ -67,24 +59,6 @@ ExitStatus FromWaitStatus(int status) {
 }
 
 }  // namespace
-
-// --- TempHome ----------------------------------------------------------------------------
-
-TempHome::TempHome() {
-  const char* base = std::getenv("TMPDIR");
-  std::string pattern = std::string(base && *base ? base : "/tmp") + "/qn-e2e-XXXXXX";
-  char* made = ::mkdtemp(pattern.data());
-  if (made == nullptr) {
-    ADD_FAILURE() << "mkdtemp failed: " << std::strerror(errno);
-    return;
-  }
-  path_ = made;
-}
-
-TempHome::~TempHome() {
-  std::error_code ignored;
-  if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
-}
 
 // --- ChildProcess ------------------------------------------------------------------------
 
@@ -170,8 +144,8 @@ std::optional<ExitStatus> ChildProcess::Wait(std::chrono::milliseconds timeout) 
   }
 }
 
-std::string ChildProcess::Stdout() const { return ReadFile(stdout_path_); }
-std::string ChildProcess::Stderr() const { return ReadFile(stderr_path_); }
+std::string ChildProcess::Stdout() const { return testing::ReadFileText(stdout_path_); }
+std::string ChildProcess::Stderr() const { return testing::ReadFileText(stderr_path_); }
 
 // --- Daemon ------------------------------------------------------------------------------
 
@@ -211,19 +185,7 @@ std::optional<ExitStatus> Daemon::Stop(int signal) {
 }
 
 std::vector<ReportingStoreRow> Daemon::Rows(std::optional<ReportingSink> sink) const {
-  std::vector<ReportingStoreRow> rows;
-  std::optional<Error> error;
-  auto reader = ReportingStoreReader::Open(db_path(), &error);
-  if (!reader) {
-    ADD_FAILURE() << "cannot read the store: " << (error ? error->Description() : "");
-    return rows;
-  }
-  error = reader->ForEachRow(sink, [&](const ReportingStoreRow& row) {
-    rows.push_back(row);
-    return true;
-  });
-  if (error) ADD_FAILURE() << "reading the store: " << error->Description();
-  return rows;
+  return testing::ReadRows(db_path(), sink);
 }
 
 bool Daemon::WaitForRows(
@@ -292,8 +254,6 @@ bool RawConnection::Write(const std::string& bytes) {
   }
   return true;
 }
-
-void RawConnection::ShutdownWrite() { ::shutdown(fd_, SHUT_WR); }
 
 std::string RawConnection::Frame(const Value& body) {
   std::string frame;

@@ -15,6 +15,7 @@
 #include "common/Value.h"
 #include "platform/linux/reporting_store_reader.h"
 #include "qnreporting/Client.h"
+#include "tests/fakes/TempDir.h"
 
 namespace qn::e2e {
 
@@ -22,17 +23,6 @@ using namespace std::chrono_literals;
 
 // Generous bounds for things that happen in milliseconds; they only end a hung test.
 inline constexpr std::chrono::milliseconds kPatience = 30s;
-
-// A fresh folder under $TMPDIR (or /tmp), removed with everything in it.
-class TempHome {
- public:
-  TempHome();
-  ~TempHome();
-  const std::string& path() const { return path_; }
-
- private:
-  std::string path_;
-};
 
 // How a child process ended.
 struct ExitStatus {
@@ -96,7 +86,7 @@ class Daemon {
   bool WaitForRows(const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition);
 
  private:
-  TempHome home_;
+  testing::TempDir home_;
   std::string socket_path_;
   std::unique_ptr<ChildProcess> process_;
   bool started_ = false;
@@ -125,8 +115,6 @@ class RawConnection {
 
   // Writes every byte (false when the peer closed first).
   bool Write(const std::string& bytes);
-  // Closes the writing half.
-  void ShutdownWrite();
   // One frame: [4-byte big-endian length][MessagePack body].
   static std::string Frame(const Value& body);
   static std::string RawFrame(const std::string& body);

@@ -151,7 +151,7 @@ TEST(LifecycleTest, SighupReReadsTheDefaults) {
 }
 
 TEST(CommandLineTest, HelpVersionAndBadArguments) {
-  TempHome dir;
+  testing::TempDir dir;
   {
     ChildProcess help(QN_DAEMON_PATH, {"--help"}, dir.path());
     EXPECT_EQ(help.Wait(), Exited(0));
@@ -178,7 +178,7 @@ TEST(CommandLineTest, HelpVersionAndBadArguments) {
 }
 
 TEST(CommandLineTest, SocketFlagChoosesTheListeningPath) {
-  TempHome elsewhere;
+  testing::TempDir elsewhere;
   const std::string socket = elsewhere.path() + "/custom.sock";
   Daemon daemon({}, socket);
   ASSERT_TRUE(daemon.started());

@@ -22,20 +22,23 @@ std::uint32_t FakeNotify::Register(const std::string& name, std::shared_ptr<Seri
 
 std::uint32_t FakeNotify::Post(const std::string& name) {
   if (name.empty()) return 1;
+  PostWithToken(name, std::nullopt);
+  return 0;
+}
+
+void FakeNotify::PostWithToken(const std::string& name, std::optional<int> token) {
   std::vector<std::shared_ptr<Registration>> targets;
   {
     std::lock_guard lock(mu_);
-    posts_[name]++;
-    for (const auto& [token, registration] : registrations_) {
+    for (const auto& [unused, registration] : registrations_) {
       if (registration->name == name) targets.push_back(registration);
     }
   }
   for (auto& registration : targets) {
-    registration->queue->Async([registration] {
-      if (registration->active) registration->handler(registration->token);
+    registration->queue->Async([registration, token] {
+      if (registration->active) registration->handler(token.value_or(registration->token));
     });
   }
-  return 0;
 }
 
 void FakeNotify::Cancel(int token) {
@@ -56,12 +59,6 @@ int FakeNotify::Registrations(const std::string& name) const {
   int n = 0;
   for (const auto& [token, registration] : registrations_) n += registration->name == name;
   return n;
-}
-
-int FakeNotify::Posts(const std::string& name) const {
-  std::lock_guard lock(mu_);
-  auto it = posts_.find(name);
-  return it == posts_.end() ? 0 : it->second;
 }
 
 }  // namespace qn::testing

@@ -5,6 +5,7 @@
 #include <map>
 #include <memory>
 #include <mutex>
+#include <optional>
 #include <string>
 
 #include "platform/notify.h"
@@ -25,9 +26,11 @@ class FakeNotify final : public Notify {
 
   // Makes later registrations fail with `status` (0 = succeed again).
   void FailRegistrations(std::uint32_t status);
-  // Live registrations of `name`, and how often `name` was posted.
+  // Like Post, but hands every handler `token` instead of its own (when given): a stray
+  // delivery, as a notification system may make.
+  void PostWithToken(const std::string& name, std::optional<int> token);
+  // Live registrations of `name`.
   int Registrations(const std::string& name) const;
-  int Posts(const std::string& name) const;
 
  private:
   struct Registration {
@@ -40,7 +43,6 @@ class FakeNotify final : public Notify {
 
   mutable std::mutex mu_;
   std::map<int, std::shared_ptr<Registration>> registrations_;
-  std::map<std::string, int> posts_;
   int next_token_ = 1;
   std::uint32_t fail_status_ = 0;
 };

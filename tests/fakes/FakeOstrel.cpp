@@ -29,7 +29,6 @@ std::optional<Dictionary> FakeOstrel::CopyChannelsInGroup(
     const std::optional<std::string>& group, const std::optional<std::string>& subgroup,
     std::uint64_t, std::optional<OstrelError>* error) {
   std::lock_guard lock(mu_);
-  ++lookups_;
   bool found = false;
   Dictionary channels;
   for (const auto& [g, s] : groups_) {
@@ -58,7 +57,6 @@ std::int32_t FakeOstrel::GetChannelCount(const Dictionary& channels) const {
 std::shared_ptr<OstrelSubscription> FakeOstrel::CreateSubscription(const Dictionary& channels,
                                                                    Dictionary* subscribed) {
   std::lock_guard lock(mu_);
-  ++subscriptions_;
   if (subscribed) *subscribed = channels;
   return std::make_shared<FakeOstrelSubscription>();
 }
@@ -67,13 +65,11 @@ std::optional<Dictionary> FakeOstrel::CreateSamples(const OstrelSubscription* su
                                                     const Dictionary& subscribed,
                                                     std::optional<OstrelError>* error) {
   std::lock_guard lock(mu_);
-  ++samplings_;
   auto fail = [&](std::int64_t code) -> std::optional<Dictionary> {
     if (error) *error = OstrelError{code};
     return std::nullopt;
   };
   if (subscription == nullptr) return fail(EBADF);
-  if (sampling_failure_) return fail(*sampling_failure_);
   Dictionary samples;
   for (const auto& [key, entry] : subscribed) {
     const std::string* g = StringField(entry, "group");
@@ -96,12 +92,6 @@ std::optional<Dictionary> FakeOstrel::CreateSamples(const OstrelSubscription* su
 std::optional<Dictionary> FakeOstrel::CreateSamplesDelta(const Dictionary* earlier,
                                                          const Dictionary& later,
                                                          std::optional<OstrelError>* error) {
-  std::lock_guard lock(mu_);
-  ++deltas_;
-  if (delta_failure_) {
-    if (error) *error = OstrelError{*delta_failure_};
-    return std::nullopt;
-  }
   return OstrelSamplesDelta(earlier, later, error);
 }
 
@@ -143,48 +133,10 @@ void FakeOstrel::FailLookup(const std::optional<std::string>& group,
   lookup_failures_[{group, subgroup}] = {code, still_return_channels};
 }
 
-void FakeOstrel::FailSampling(std::int64_t code) {
-  std::lock_guard lock(mu_);
-  sampling_failure_ = code;
-}
-
 void FakeOstrel::FailSamplingOf(const std::string& group, const std::string& subgroup,
                                 std::int64_t code) {
   std::lock_guard lock(mu_);
   sampling_failures_of_[{group, subgroup}] = code;
-}
-
-void FakeOstrel::FailDeltas(std::int64_t code) {
-  std::lock_guard lock(mu_);
-  delta_failure_ = code;
-}
-
-void FakeOstrel::ClearFailures() {
-  std::lock_guard lock(mu_);
-  lookup_failures_.clear();
-  sampling_failure_.reset();
-  sampling_failures_of_.clear();
-  delta_failure_.reset();
-}
-
-int FakeOstrel::lookups() const {
-  std::lock_guard lock(mu_);
-  return lookups_;
-}
-
-int FakeOstrel::subscriptions() const {
-  std::lock_guard lock(mu_);
-  return subscriptions_;
-}
-
-int FakeOstrel::samplings() const {
-  std::lock_guard lock(mu_);
-  return samplings_;
-}
-
-int FakeOstrel::deltas() const {
-  std::lock_guard lock(mu_);
-  return deltas_;
 }
 
 }  // namespace qn::testing

@@ -17,8 +17,8 @@ namespace qn::testing {
 // unnamed channel), deltas later minus earlier, ENODATA when the earlier sample is absent
 // or lacks a channel, ENOENT when a subscribed counter was removed, EBADF for a null
 // subscription. An absent group or subgroup in a lookup matches any; a lookup that matches
-// no group/subgroup pair returns nullopt. Switches make lookups, sampling and deltas fail
-// with a given code. Thread-safe.
+// no group/subgroup pair returns nullopt. Switches make lookups and sampling fail with a
+// given code. Thread-safe.
 class FakeOstrel final : public Ostrel {
  public:
   std::optional<Dictionary> CopyChannelsInGroup(const std::optional<std::string>& group,
@@ -52,18 +52,9 @@ class FakeOstrel final : public Ostrel {
   void FailLookup(const std::optional<std::string>& group,
                   const std::optional<std::string>& subgroup, std::int64_t code,
                   bool still_return_channels = false);
-  // Makes sampling fail with `code`: every subscription, or those holding a channel of
-  // the group/subgroup pair.
-  void FailSampling(std::int64_t code);
+  // Makes sampling fail with `code` for subscriptions holding a channel of the
+  // group/subgroup pair.
   void FailSamplingOf(const std::string& group, const std::string& subgroup, std::int64_t code);
-  // Makes every delta fail with `code`.
-  void FailDeltas(std::int64_t code);
-  void ClearFailures();
-
-  int lookups() const;
-  int subscriptions() const;
-  int samplings() const;
-  int deltas() const;
 
  private:
   struct Counter {
@@ -80,13 +71,7 @@ class FakeOstrel final : public Ostrel {
   std::set<Pair> groups_;
   std::map<std::string, Counter> counters_;  // by "group/subgroup/channel"
   std::map<LookupKey, std::pair<std::int64_t, bool>> lookup_failures_;
-  std::optional<std::int64_t> sampling_failure_;
   std::map<Pair, std::int64_t> sampling_failures_of_;
-  std::optional<std::int64_t> delta_failure_;
-  int lookups_ = 0;
-  int subscriptions_ = 0;
-  int samplings_ = 0;
-  int deltas_ = 0;
 };
 
 }  // namespace qn::testing

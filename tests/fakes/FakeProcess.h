@@ -2,7 +2,6 @@
 
 #include <sys/types.h>
 
-#include <functional>
 #include <map>
 #include <mutex>
 #include <optional>
@@ -19,9 +18,8 @@ struct ProcessExited {
   int status;
 };
 
-// A Process with a settable pid and process table. Exit records the status, runs the exit
-// hook (the work a real exit would do first, e.g. draining a store) and throws
-// ProcessExited. Thread-safe.
+// A Process with a settable pid and process table. Exit throws ProcessExited with the
+// status. Thread-safe.
 class FakeProcess final : public Process {
  public:
   explicit FakeProcess(pid_t pid = 4242, std::string own_name = "qnreportingd");
@@ -33,24 +31,13 @@ class FakeProcess final : public Process {
   [[noreturn]] void Exit(int status) override;
 
   void SetPid(pid_t pid);
-  void SetOwnName(std::string name);
   void SetName(pid_t pid, std::string name);
-  void RemoveName(pid_t pid);
-  // Runs in Exit, before the throw.
-  void SetExitHook(std::function<void(int status)> hook);
-
-  // The status of the last Exit, if any, and how many times Exit was called.
-  std::optional<int> exit_status() const;
-  int exit_calls() const;
 
  private:
   mutable std::mutex mu_;
   pid_t pid_;
   std::string own_name_;
   std::map<pid_t, std::string> names_;
-  std::function<void(int)> exit_hook_;
-  std::optional<int> exit_status_;
-  int exit_calls_ = 0;
 };
 
 }  // namespace qn::testing

@@ -35,6 +35,7 @@ void LogCapture::Write(const LogScope* scope, LogLevel level, const char*, int, 
   }
   if (echo_) std::fprintf(stderr, "%.*s\n", static_cast<int>(message.size()), message.data());
   lines_.push_back(Line{scope ? scope->code_string : "", level, std::string(message)});
+  written_.notify_all();
 }
 
 void LogCapture::EnableDebug(const std::string& code_string) {
@@ -49,9 +50,19 @@ std::vector<LogCapture::Line> LogCapture::Lines() const {
 
 int LogCapture::Count(std::string_view needle) const {
   std::lock_guard lock(mu_);
+  return CountLocked(needle);
+}
+
+int LogCapture::CountLocked(std::string_view needle) const {
   int n = 0;
   for (const auto& l : lines_) n += l.text.find(needle) != std::string::npos;
   return n;
+}
+
+bool LogCapture::WaitForCount(std::string_view needle, int count,
+                              std::chrono::seconds patience) const {
+  std::unique_lock lock(mu_);
+  return written_.wait_for(lock, patience, [&] { return CountLocked(needle) >= count; });
 }
 
 std::vector<std::string> LogCapture::Matching(std::string_view needle) const {

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <chrono>
+#include <condition_variable>
 #include <map>
 #include <memory>
 #include <mutex>
@@ -36,6 +38,9 @@ class LogCapture final : public Log {
   // Number of lines whose text contains `needle`.
   int Count(std::string_view needle) const;
   bool Contains(std::string_view needle) const { return Count(needle) > 0; }
+  // Waits until `count` lines contain `needle`; false when `patience` ran out first (it only
+  // bounds a failing test).
+  bool WaitForCount(std::string_view needle, int count, std::chrono::seconds patience) const;
   // Texts of the lines that contain `needle`, in order.
   std::vector<std::string> Matching(std::string_view needle) const;
   // How many times RegisterScope was called for a code.
@@ -43,7 +48,10 @@ class LogCapture final : public Log {
   void Clear();
 
  private:
+  int CountLocked(std::string_view needle) const;
+
   mutable std::mutex mu_;
+  mutable std::condition_variable written_;  // notified for every line
   std::vector<Line> lines_;
   std::map<std::uint64_t, std::shared_ptr<const LogScope>> scopes_;
   std::map<std::string, int> registrations_;

@@ -2,7 +2,6 @@
 
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 #include <thread>
 #include <vector>
 
@@ -20,13 +19,13 @@ constexpr const char* kSuite = "com.norvel.quenta";
 struct LinuxDefaultsHarness {
   testing::TempDir dir;
   std::shared_ptr<testing::LogCapture> log = std::make_shared<testing::LogCapture>();
-  std::shared_ptr<Defaults> defaults = NewLinuxDefaults({.state_dir = dir.str(), .log = log});
+  std::shared_ptr<Defaults> defaults = NewLinuxDefaults({.state_dir = dir.path(), .log = log});
 
   void Set(const std::string& suite, const std::string& key, Value value) {
-    ASSERT_EQ(WriteDefault(dir.str(), suite, key, value), std::nullopt);
+    ASSERT_EQ(WriteDefault(dir.path(), suite, key, value), std::nullopt);
   }
   void Remove(const std::string& suite, const std::string& key) {
-    ASSERT_EQ(DeleteDefault(dir.str(), suite, key), std::nullopt);
+    ASSERT_EQ(DeleteDefault(dir.path(), suite, key), std::nullopt);
   }
 };
 
@@ -103,37 +102,32 @@ TYPED_TEST(DefaultsContractTest, SuitesAreSnapshotsAndSeparate) {
 
 class LinuxDefaultsTest : public ::testing::Test {
  protected:
-  std::string SuitePath() const { return DefaultsSuitePath(dir_.str(), kSuite); }
-  std::string FileText() const {
-    std::ifstream in(SuitePath());
-    std::stringstream text;
-    text << in.rdbuf();
-    return text.str();
-  }
+  std::string SuitePath() const { return DefaultsSuitePath(dir_.path(), kSuite); }
+  std::string FileText() const { return testing::ReadFileText(SuitePath()); }
 
   testing::TempDir dir_;
   std::shared_ptr<testing::LogCapture> log_ = std::make_shared<testing::LogCapture>();
-  std::shared_ptr<Defaults> defaults_ = NewLinuxDefaults({.state_dir = dir_.str(), .log = log_});
+  std::shared_ptr<Defaults> defaults_ = NewLinuxDefaults({.state_dir = dir_.path(), .log = log_});
 };
 
 TEST_F(LinuxDefaultsTest, WritesOneJsonObjectPerSuite) {
-  ASSERT_EQ(WriteDefault(dir_.str(), kSuite, "device_name", "Kitchen"), std::nullopt);
-  ASSERT_EQ(WriteDefault(dir_.str(), kSuite, "disable_reporting", 1), std::nullopt);
-  EXPECT_EQ(SuitePath(), dir_.str() + "/defaults/com.norvel.quenta.json");
+  ASSERT_EQ(WriteDefault(dir_.path(), kSuite, "device_name", "Kitchen"), std::nullopt);
+  ASSERT_EQ(WriteDefault(dir_.path(), kSuite, "disable_reporting", 1), std::nullopt);
+  EXPECT_EQ(SuitePath(), dir_.path() + "/defaults/com.norvel.quenta.json");
   Value parsed;
   ASSERT_EQ(ParseJson(FileText(), parsed), std::nullopt);
   EXPECT_EQ(parsed, Value(Dictionary{{"device_name", "Kitchen"}, {"disable_reporting", 1}}));
 
   Dictionary read;
-  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  ASSERT_EQ(ReadSuite(dir_.path(), kSuite, read), std::nullopt);
   EXPECT_EQ(read, *parsed.as_dictionary());
-  ASSERT_EQ(DeleteDefault(dir_.str(), kSuite, "device_name"), std::nullopt);
-  ASSERT_EQ(DeleteDefault(dir_.str(), kSuite, "never-there"), std::nullopt);
-  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  ASSERT_EQ(DeleteDefault(dir_.path(), kSuite, "device_name"), std::nullopt);
+  ASSERT_EQ(DeleteDefault(dir_.path(), kSuite, "never-there"), std::nullopt);
+  ASSERT_EQ(ReadSuite(dir_.path(), kSuite, read), std::nullopt);
   EXPECT_EQ(read, (Dictionary{{"disable_reporting", 1}}));
   // Only the suite and its lock file are left in the folder: no temporary files.
   int files = 0;
-  for (const auto& entry : std::filesystem::directory_iterator(dir_.path() / "defaults")) {
+  for (const auto& entry : std::filesystem::directory_iterator(dir_.File("defaults"))) {
     (void)entry;
     ++files;
   }
@@ -142,14 +136,14 @@ TEST_F(LinuxDefaultsTest, WritesOneJsonObjectPerSuite) {
 
 TEST_F(LinuxDefaultsTest, MissingSuiteReadsEmptyWithoutAnError) {
   Dictionary read{{"stale", 1}};
-  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  ASSERT_EQ(ReadSuite(dir_.path(), kSuite, read), std::nullopt);
   EXPECT_TRUE(read.empty());
   EXPECT_FALSE(defaults_->OpenSuite(kSuite)->BoolForKey("disable_reporting"));
   EXPECT_TRUE(log_->Lines().empty()) << "a missing suite is logged at debug level only";
 }
 
 TEST_F(LinuxDefaultsTest, MalformedSuiteReadsEmptyAndIsNotOverwritten) {
-  std::filesystem::create_directories(dir_.path() / "defaults");
+  std::filesystem::create_directories(dir_.File("defaults"));
   std::ofstream(SuitePath()) << "{\"disable_reporting\": YES}";
   auto suite = defaults_->OpenSuite(kSuite);
   EXPECT_EQ(suite->ObjectForKey("disable_reporting"), std::nullopt);
@@ -157,17 +151,17 @@ TEST_F(LinuxDefaultsTest, MalformedSuiteReadsEmptyAndIsNotOverwritten) {
   EXPECT_EQ(log_->Lines()[0].level, LogLevel::kError);
 
   Dictionary read;
-  auto error = ReadSuite(dir_.str(), kSuite, read);
+  auto error = ReadSuite(dir_.path(), kSuite, read);
   ASSERT_TRUE(error);
   EXPECT_EQ(error->domain, kDefaultsErrorDomain);
-  EXPECT_TRUE(WriteDefault(dir_.str(), kSuite, "device_name", "x"));
+  EXPECT_TRUE(WriteDefault(dir_.path(), kSuite, "device_name", "x"));
   EXPECT_EQ(FileText(), "{\"disable_reporting\": YES}");
 }
 
 TEST_F(LinuxDefaultsTest, ValuesWithoutJsonFormAreRefused) {
-  ASSERT_EQ(WriteDefault(dir_.str(), kSuite, "a", 1), std::nullopt);
+  ASSERT_EQ(WriteDefault(dir_.path(), kSuite, "a", 1), std::nullopt);
   const std::string before = FileText();
-  EXPECT_TRUE(WriteDefault(dir_.str(), kSuite, "blob", Data{{1, 2, 3}}));
+  EXPECT_TRUE(WriteDefault(dir_.path(), kSuite, "blob", Data{{1, 2, 3}}));
   EXPECT_EQ(FileText(), before);
 }
 
@@ -175,13 +169,13 @@ TEST_F(LinuxDefaultsTest, SuiteNamesCannotLeaveTheFolder) {
   for (const std::string& name :
        std::vector<std::string>{"", "../escape", "a/b", ".hidden", std::string(201, 'x')}) {
     Dictionary read;
-    auto error = ReadSuite(dir_.str(), name, read);
+    auto error = ReadSuite(dir_.path(), name, read);
     ASSERT_TRUE(error) << name;
     EXPECT_EQ(error->code, static_cast<std::int64_t>(DefaultsErrorCode::kInvalidSuiteName));
-    EXPECT_TRUE(WriteDefault(dir_.str(), name, "k", 1)) << name;
+    EXPECT_TRUE(WriteDefault(dir_.path(), name, "k", 1)) << name;
     EXPECT_EQ(defaults_->OpenSuite(name)->ObjectForKey("k"), std::nullopt);
   }
-  EXPECT_FALSE(std::filesystem::exists(dir_.path() / "escape.json"));
+  EXPECT_FALSE(std::filesystem::exists(dir_.File("escape.json")));
 }
 
 TEST_F(LinuxDefaultsTest, ConcurrentWritersAllLand) {
@@ -191,14 +185,14 @@ TEST_F(LinuxDefaultsTest, ConcurrentWritersAllLand) {
   for (int w = 0; w < kWriters; ++w) {
     writers.emplace_back([&, w] {
       for (int k = 0; k < kKeys; ++k) {
-        EXPECT_EQ(WriteDefault(dir_.str(), kSuite, std::to_string(w) + "." + std::to_string(k), k),
+        EXPECT_EQ(WriteDefault(dir_.path(), kSuite, std::to_string(w) + "." + std::to_string(k), k),
                   std::nullopt);
       }
     });
   }
   for (auto& t : writers) t.join();
   Dictionary read;
-  ASSERT_EQ(ReadSuite(dir_.str(), kSuite, read), std::nullopt);
+  ASSERT_EQ(ReadSuite(dir_.path(), kSuite, read), std::nullopt);
   EXPECT_EQ(read.size(), static_cast<std::size_t>(kWriters * kKeys));
 }
 

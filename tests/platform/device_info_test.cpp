@@ -13,7 +13,7 @@ namespace {
 class LinuxDeviceInfoTest : public ::testing::Test {
  protected:
   std::string WriteFile(const std::string& text) {
-    const std::string path = dir_.str() + "/device-info.json";
+    const std::string path = dir_.path() + "/device-info.json";
     std::ofstream(path) << text;
     return path;
   }
@@ -45,14 +45,14 @@ TEST_F(LinuxDeviceInfoTest, NumbersOutsideInt32AreNoAnswer) {
 }
 
 TEST_F(LinuxDeviceInfoTest, MissingFileIsQuietlyEmpty) {
-  auto info = Make(dir_.str() + "/absent.json");
+  auto info = Make(dir_.path() + "/absent.json");
   EXPECT_EQ(info->CopyAnswer("InternalBuild"), std::nullopt);
   EXPECT_EQ(info->GetSInt32Answer("DeviceClassNumber"), 0);
   EXPECT_TRUE(log_->Lines().empty());
 }
 
 TEST_F(LinuxDeviceInfoTest, OverrideMakesTheBuildInternal) {
-  auto without_file = Make(dir_.str() + "/absent.json", /*internal_build=*/true);
+  auto without_file = Make(dir_.path() + "/absent.json", /*internal_build=*/true);
   EXPECT_EQ(without_file->CopyAnswer("InternalBuild"), Value(true));
   auto over_file = Make(WriteFile(R"({"InternalBuild": false, "DeviceClassNumber": 3})"),
                         /*internal_build=*/true);
@@ -75,7 +75,7 @@ TEST_F(LinuxDeviceInfoTest, MalformedFileIsLoggedOnceAndIgnored) {
 }
 
 TEST_F(LinuxDeviceInfoTest, AFolderInsteadOfAFileIsLogged) {
-  auto info = Make(dir_.str());
+  auto info = Make(dir_.path());
   EXPECT_EQ(info->CopyAnswer("InternalBuild"), std::nullopt);
   EXPECT_EQ(log_->Lines().size(), 1u);
 }

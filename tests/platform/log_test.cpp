@@ -152,7 +152,7 @@ TEST(LinuxLogTest, LinesFromManyThreadsNeverInterleave) {
 
 TEST(LinuxLogTest, JournalStreamMatchesDeviceAndInode) {
   testing::TempDir dir;
-  const std::string path = dir.str() + "/stream";
+  const std::string path = dir.path() + "/stream";
   const int fd = ::open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600);
   ASSERT_GE(fd, 0);
   struct stat st;

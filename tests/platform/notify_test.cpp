@@ -40,7 +40,7 @@ struct Deliveries {
 
 struct LinuxNotifyHarness {
   testing::TempDir dir;
-  std::shared_ptr<Notify> notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+  std::shared_ptr<Notify> notify = NewLinuxNotify({.runtime_dir = dir.path(), .log = nullptr});
 };
 
 struct FakeNotifyHarness {
@@ -54,6 +54,15 @@ class NotifyContractTest : public ::testing::Test {
   std::shared_ptr<SerialQueue> queue_ =
       dispatcher_->CreateSerialQueue("server", QualityOfService::kUserInteractive);
   Harness h_;
+
+  // Registers `seen` for `name` on `queue` (the server queue when null); returns its token.
+  int Register(Deliveries& seen, const char* name = kName,
+               std::shared_ptr<SerialQueue> queue = nullptr) {
+    if (!queue) queue = queue_;
+    int token = 0;
+    EXPECT_EQ(h_.notify->Register(name, queue, seen.Handler(queue), &token), 0u);
+    return token;
+  }
 };
 
 using Harnesses = ::testing::Types<LinuxNotifyHarness, FakeNotifyHarness>;
@@ -62,13 +71,9 @@ TYPED_TEST_SUITE(NotifyContractTest, Harnesses);
 TYPED_TEST(NotifyContractTest, PostRunsTheHandlerOnItsQueueWithItsToken) {
   Deliveries seen;
   Deliveries other;
-  int token = 0;
-  int other_token = 0;
+  const int token = this->Register(seen);
+  EXPECT_NE(token, this->Register(other, "other.name"));
   Notify& notify = *this->h_.notify;
-  ASSERT_EQ(notify.Register(kName, this->queue_, seen.Handler(this->queue_), &token), 0u);
-  ASSERT_EQ(notify.Register("other.name", this->queue_, other.Handler(this->queue_), &other_token),
-            0u);
-  EXPECT_NE(token, other_token);
 
   ASSERT_EQ(notify.Post(kName), 0u);
   ASSERT_TRUE(seen.count.WaitFor(1));
@@ -86,13 +91,10 @@ TYPED_TEST(NotifyContractTest, PostRunsTheHandlerOnItsQueueWithItsToken) {
 TYPED_TEST(NotifyContractTest, EveryRegistrationOfTheNameIsWoken) {
   Deliveries a;
   Deliveries b;
-  int token_a = 0;
-  int token_b = 0;
-  auto queue_b = this->dispatcher_->CreateSerialQueue("b", QualityOfService::kUtility);
-  Notify& notify = *this->h_.notify;
-  ASSERT_EQ(notify.Register(kName, this->queue_, a.Handler(this->queue_), &token_a), 0u);
-  ASSERT_EQ(notify.Register(kName, queue_b, b.Handler(queue_b), &token_b), 0u);
-  ASSERT_EQ(notify.Post(kName), 0u);
+  this->Register(a);
+  const int token_b = this->Register(
+      b, kName, this->dispatcher_->CreateSerialQueue("b", QualityOfService::kUtility));
+  ASSERT_EQ(this->h_.notify->Post(kName), 0u);
   ASSERT_TRUE(a.count.WaitFor(1));
   ASSERT_TRUE(b.count.WaitFor(1));
   std::lock_guard lock(b.mu);
@@ -103,14 +105,10 @@ TYPED_TEST(NotifyContractTest, EveryRegistrationOfTheNameIsWoken) {
 TYPED_TEST(NotifyContractTest, CancelledRegistrationsHearNothing) {
   Deliveries cancelled;
   Deliveries kept;
-  int cancelled_token = 0;
-  int kept_token = 0;
-  Notify& notify = *this->h_.notify;
-  ASSERT_EQ(notify.Register(kName, this->queue_, cancelled.Handler(this->queue_), &cancelled_token),
-            0u);
-  ASSERT_EQ(notify.Register(kName, this->queue_, kept.Handler(this->queue_), &kept_token), 0u);
-  notify.Cancel(cancelled_token);
-  ASSERT_EQ(notify.Post(kName), 0u);
+  const int cancelled_token = this->Register(cancelled);
+  this->Register(kept);
+  this->h_.notify->Cancel(cancelled_token);
+  ASSERT_EQ(this->h_.notify->Post(kName), 0u);
   ASSERT_TRUE(kept.count.WaitFor(1));
   // Both handlers would have been queued on the same serial queue, cancelled one first.
   testing::Counter drained;
@@ -135,45 +133,45 @@ TEST(LinuxNotifyTest, PostingTouchesAFileThatOtherProcessesSee) {
   testing::TempDir dir;
   auto dispatcher = NewLinuxDispatcher();
   auto queue = dispatcher->CreateSerialQueue("server", QualityOfService::kUserInteractive);
-  auto notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+  auto notify = NewLinuxNotify({.runtime_dir = dir.path(), .log = nullptr});
   Deliveries seen;
   int token = 0;
   ASSERT_EQ(notify->Register(kName, queue, seen.Handler(queue), &token), 0u);
   // The command-line tool posts without a Notify object, from its own process.
   const pid_t child = ::fork();
-  if (child == 0) ::_exit(PostNotification(dir.str(), kName) == 0 ? 0 : 1);
+  if (child == 0) ::_exit(PostNotification(dir.path(), kName) == 0 ? 0 : 1);
   int status = 0;
   ASSERT_EQ(::waitpid(child, &status, 0), child);
   ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
   ASSERT_TRUE(seen.count.WaitFor(1));
-  EXPECT_TRUE(std::filesystem::is_regular_file(dir.path() / "notify" / kName));
+  EXPECT_TRUE(std::filesystem::is_regular_file(dir.File(std::string("notify/") + kName)));
 }
 
 TEST(LinuxNotifyTest, NamesCannotLeaveTheFolder) {
   testing::TempDir dir;
   for (const std::string& name :
        std::vector<std::string>{"", ".", "..", "../x", "a/b", std::string(300, 'n')}) {
-    EXPECT_EQ(PostNotification(dir.str(), name), kNotifyStatusInvalidName) << name;
+    EXPECT_EQ(PostNotification(dir.path(), name), kNotifyStatusInvalidName) << name;
   }
-  EXPECT_FALSE(std::filesystem::exists(dir.path() / "x"));
+  EXPECT_FALSE(std::filesystem::exists(dir.File("x")));
 }
 
 TEST(LinuxNotifyTest, PostingWithNobodyWatchingSucceeds) {
   testing::TempDir dir;
-  EXPECT_EQ(PostNotification(dir.str(), kName), 0u);
-  EXPECT_FALSE(std::filesystem::exists(dir.path() / "notify"));
+  EXPECT_EQ(PostNotification(dir.path(), kName), 0u);
+  EXPECT_FALSE(std::filesystem::exists(dir.File("notify")));
 }
 
 TEST(LinuxNotifyTest, AFifoUnderTheNameDoesNotHangThePoster) {
   testing::TempDir dir;
-  auto notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+  auto notify = NewLinuxNotify({.runtime_dir = dir.path(), .log = nullptr});
   auto dispatcher = NewLinuxDispatcher();
   int token = 0;
   ASSERT_EQ(notify->Register(
                 kName, dispatcher->CreateSerialQueue("q", QualityOfService::kUtility), [](int) {},
                 &token),
             0u);
-  ASSERT_EQ(::mkfifo((dir.str() + "/notify/fifo").c_str(), 0644), 0);
+  ASSERT_EQ(::mkfifo((dir.path() + "/notify/fifo").c_str(), 0644), 0);
   EXPECT_EQ(notify->Post("fifo"), kNotifyStatusFailed);
 }
 
@@ -181,11 +179,11 @@ TEST(LinuxNotifyTest, WatchSurvivesTheFolderBeingRemoved) {
   testing::TempDir dir;
   auto dispatcher = NewLinuxDispatcher();
   auto queue = dispatcher->CreateSerialQueue("server", QualityOfService::kUserInteractive);
-  auto notify = NewLinuxNotify({.runtime_dir = dir.str(), .log = nullptr});
+  auto notify = NewLinuxNotify({.runtime_dir = dir.path(), .log = nullptr});
   Deliveries seen;
   int token = 0;
   ASSERT_EQ(notify->Register(kName, queue, seen.Handler(queue), &token), 0u);
-  std::filesystem::remove_all(dir.path() / "notify");
+  std::filesystem::remove_all(dir.File("notify"));
   // The watch thread puts the folder back; posts made after that are seen.
   const auto give_up = std::chrono::steady_clock::now() + testing::kPatience;
   while (seen.count.value() == 0 && std::chrono::steady_clock::now() < give_up) {

@@ -19,18 +19,18 @@ namespace fs = std::filesystem;
 
 struct LinuxOstrelHarness {
   testing::TempDir dir;
-  std::shared_ptr<Ostrel> ostrel = NewLinuxOstrel(dir.str());
+  std::shared_ptr<Ostrel> ostrel = NewLinuxOstrel(dir.path());
 
   void AddGroup(const std::string& g, const std::string& s) {
-    fs::create_directories(dir.path() / g / s);
+    fs::create_directories(fs::path(dir.path()) / g / s);
   }
   void SetCounter(const std::string& g, const std::string& s, const std::string& c,
                   std::int64_t value) {
     AddGroup(g, s);
-    std::ofstream(dir.path() / g / s / c) << value << "\n";
+    std::ofstream(fs::path(dir.path()) / g / s / c) << value << "\n";
   }
   void RemoveCounter(const std::string& g, const std::string& s, const std::string& c) {
-    fs::remove(dir.path() / g / s / c);
+    fs::remove(fs::path(dir.path()) / g / s / c);
   }
 };
 
@@ -177,8 +177,8 @@ TYPED_TEST(OstrelContractTest, IterationStopsWhenTheCallbackSaysSo) {
 class LinuxOstrelTest : public ::testing::Test {
  protected:
   void Write(const std::string& rel, const std::string& text) {
-    fs::create_directories((dir_.path() / rel).parent_path());
-    std::ofstream(dir_.path() / rel) << text;
+    fs::create_directories((fs::path(dir_.path()) / rel).parent_path());
+    std::ofstream(fs::path(dir_.path()) / rel) << text;
   }
   std::optional<Dictionary> Sample(std::optional<OstrelError>* error) {
     auto channels = ostrel_->CopyChannelsInGroup("G", "S", 0, error);
@@ -189,11 +189,11 @@ class LinuxOstrelTest : public ::testing::Test {
   }
 
   testing::TempDir dir_;
-  std::shared_ptr<Ostrel> ostrel_ = NewLinuxOstrel(dir_.str());
+  std::shared_ptr<Ostrel> ostrel_ = NewLinuxOstrel(dir_.path());
 };
 
 TEST_F(LinuxOstrelTest, MissingRootHasNoChannels) {
-  auto ostrel = NewLinuxOstrel(dir_.str() + "/absent");
+  auto ostrel = NewLinuxOstrel(dir_.path() + "/absent");
   std::optional<OstrelError> error;
   EXPECT_EQ(ostrel->CopyChannelsInGroup(std::nullopt, std::nullopt, 0, &error), std::nullopt);
   EXPECT_EQ(ostrel->CopyChannelsInGroup("Speaker", std::nullopt, 0, &error), std::nullopt);
@@ -247,8 +247,8 @@ TEST_F(LinuxOstrelTest, ForgedDescriptionsReadNothingOutsideTheTree) {
 
 TEST_F(LinuxOstrelTest, AFifoAsACounterDoesNotHang) {
   Write("G/S/a", "1");
-  fs::create_directories(dir_.path() / "G/S");
-  ASSERT_EQ(::mkfifo((dir_.str() + "/G/S/pipe").c_str(), 0644), 0);
+  fs::create_directories(dir_.File("G/S"));
+  ASSERT_EQ(::mkfifo((dir_.path() + "/G/S/pipe").c_str(), 0644), 0);
   // Not a regular file: not a channel at all.
   std::optional<OstrelError> error;
   auto channels = ostrel_->CopyChannelsInGroup("G", "S", 0, &error);
@@ -260,10 +260,10 @@ TEST_F(LinuxOstrelTest, UnreadableGroupIsAnErrorButOthersStillCount) {
   if (::geteuid() == 0) GTEST_SKIP() << "root reads every folder";
   Write("A/S/x", "1");
   Write("B/S/y", "2");
-  ASSERT_EQ(::chmod((dir_.str() + "/B").c_str(), 0), 0);
+  ASSERT_EQ(::chmod((dir_.path() + "/B").c_str(), 0), 0);
   std::optional<OstrelError> error;
   auto channels = ostrel_->CopyChannelsInGroup(std::nullopt, "S", 0, &error);
-  ::chmod((dir_.str() + "/B").c_str(), 0755);
+  ::chmod((dir_.path() + "/B").c_str(), 0755);
   ASSERT_TRUE(channels);
   EXPECT_EQ(ostrel_->GetChannelCount(*channels), 1);
   ASSERT_TRUE(error);

@@ -1,14 +1,10 @@
 #pragma once
 
-#include <unistd.h>
-
 #include <chrono>
 #include <condition_variable>
-#include <cstdlib>
-#include <filesystem>
 #include <mutex>
-#include <string>
-#include <vector>
+
+#include "tests/fakes/TempDir.h"
 
 namespace qn::testing {
 
@@ -38,30 +34,6 @@ class Counter {
   mutable std::mutex mu_;
   mutable std::condition_variable cv_;
   int value_ = 0;
-};
-
-// A fresh temporary directory, removed with everything in it at the end of the test.
-class TempDir {
- public:
-  TempDir() {
-    std::string tmpl = (std::filesystem::temp_directory_path() / "qn-platform-XXXXXX").string();
-    std::vector<char> buf(tmpl.begin(), tmpl.end());
-    buf.push_back('\0');
-    if (mkdtemp(buf.data()) == nullptr) std::abort();
-    path_ = buf.data();
-  }
-  ~TempDir() {
-    std::error_code ec;
-    std::filesystem::remove_all(path_, ec);
-  }
-  TempDir(const TempDir&) = delete;
-  TempDir& operator=(const TempDir&) = delete;
-
-  const std::filesystem::path& path() const { return path_; }
-  std::string str() const { return path_.string(); }
-
- private:
-  std::filesystem::path path_;
 };
 
 }  // namespace qn::testing

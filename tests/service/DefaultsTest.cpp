@@ -10,13 +10,13 @@
 namespace qn {
 namespace {
 
+using testing::FakePlatform;
 using ::testing::HasSubstr;
 using testing::service::BoolReplies;
 using testing::service::Client;
 using testing::service::ErrorReplies;
 using testing::service::Replies;
 using testing::service::ServiceHarness;
-using testing::service::ServiceTestPlatform;
 
 constexpr const char* kSuite = "com.norvel.quenta";
 
@@ -38,7 +38,7 @@ class DefaultsTest : public ::testing::Test {
 };
 
 TEST(QNReportingDefaultsTest, ReadsTheSuiteAsSettingsAreRead) {
-  ServiceTestPlatform env;
+  FakePlatform env;
   EXPECT_EQ(QNReportingDefaults(*env.platform), (Dictionary{{"disable_reporting", 0}}));
   // Absent: the integer 0; present: the boolean reading.
   EXPECT_TRUE(QNReportingDefaults(*env.platform).Find("disable_reporting")->is_integer());
@@ -142,48 +142,20 @@ TEST_F(DefaultsTest, ANotificationWithoutClientsOnlyUpdatesDefaultsAndSwitch) {
   EXPECT_EQ(*h_.delegate->getDefaults(), (Dictionary{{"disable_reporting", true}}));
 }
 
-// Notifications whose handler the test calls with any token.
-class StrayNotify final : public Notify {
- public:
-  std::uint32_t Register(const std::string&, std::shared_ptr<SerialQueue> queue,
-                         std::function<void(int)> handler, int* token) override {
-    queue_ = std::move(queue);
-    handler_ = std::move(handler);
-    *token = 3;
-    return 0;
-  }
-  std::uint32_t Post(const std::string&) override {
-    Deliver(3);
-    return 0;
-  }
-  void Cancel(int) override {}
-  void Deliver(int token) {
-    queue_->Async([handler = handler_, token] { handler(token); });
-  }
-
- private:
-  std::shared_ptr<SerialQueue> queue_;
-  std::function<void(int)> handler_;
-};
-
-TEST(DefaultsTokenTest, ADeliveryWithAnotherTokenIsIgnored) {
-  auto notify = std::make_shared<StrayNotify>();
-  ServiceHarness h([&](ServiceTestPlatform& env) {
-    env.platform->notify = notify;
-    env.defaults->Set(kSuite, "disable_reporting", true);
-  });
-  notify->Deliver(999);
-  h.Run();
-  EXPECT_EQ(h.env.log->Count("re-reading"), 0);
-  EXPECT_TRUE(h.delegate->isReportingEnabled());
-  notify->Deliver(3);
-  h.Run();
-  EXPECT_EQ(h.env.log->Count("re-reading"), 1);
-  EXPECT_FALSE(h.delegate->isReportingEnabled());
+TEST_F(DefaultsTest, ADeliveryWithAnotherTokenIsIgnored) {
+  Write("disable_reporting", true);
+  h_.env.notify->PostWithToken(kQNReportingDefaultsNotification, 999);
+  h_.Run();
+  EXPECT_EQ(h_.env.log->Count("re-reading"), 0);
+  EXPECT_TRUE(h_.delegate->isReportingEnabled());
+  h_.env.notify->PostWithToken(kQNReportingDefaultsNotification, std::nullopt);
+  h_.Run();
+  EXPECT_EQ(h_.env.log->Count("re-reading"), 1);
+  EXPECT_FALSE(h_.delegate->isReportingEnabled());
 }
 
 TEST(DefaultsRegistrationTest, AFailedRegistrationIsLoggedAndLeavesReportingOn) {
-  ServiceHarness h([](ServiceTestPlatform& env) {
+  ServiceHarness h([](FakePlatform& env) {
     env.notify->FailRegistrations(5);
     env.defaults->Set(kSuite, "disable_reporting", true);
   });
@@ -194,7 +166,7 @@ TEST(DefaultsRegistrationTest, AFailedRegistrationIsLoggedAndLeavesReportingOn) 
 }
 
 TEST(DefaultsRegistrationTest, TheRegistrationEndsWithTheDelegate) {
-  ServiceTestPlatform env;
+  FakePlatform env;
   auto delegate = QNReportingServiceDelegate::Create(env.platform);
   EXPECT_EQ(env.notify->Registrations(kQNReportingDefaultsNotification), 1);
   delegate.reset();

@@ -13,6 +13,7 @@ namespace qn {
 namespace {
 
 using ::testing::ElementsAre;
+using testing::FakePlatform;
 using ::testing::HasSubstr;
 using testing::ProcessExited;
 using testing::service::BoolReplies;
@@ -20,13 +21,12 @@ using testing::service::Client;
 using testing::service::ErrorReplies;
 using testing::service::Replies;
 using testing::service::ServiceHarness;
-using testing::service::ServiceTestPlatform;
 
 MessagePayload Payload(Dictionary d) { return std::make_shared<const Dictionary>(std::move(d)); }
 
 class ServerInstanceTest : public ::testing::Test {
  protected:
-  explicit ServerInstanceTest(const std::function<void(ServiceTestPlatform&)>& setup = nullptr,
+  explicit ServerInstanceTest(const std::function<void(FakePlatform&)>& setup = nullptr,
                               QNReportingServiceDelegate::Options options = {})
       : h_(setup, options) {}
 
@@ -76,7 +76,7 @@ class DriverStatisticsTest : public ServerInstanceTest {
  protected:
   DriverStatisticsTest()
       : ServerInstanceTest(
-            [](ServiceTestPlatform& env) { env.ostrel->SetCounter("Speaker", "Main", "X", 5); }) {}
+            [](FakePlatform& env) { env.ostrel->SetCounter("Speaker", "Main", "X", 5); }) {}
 };
 
 TEST_F(ServerInstanceTest, RequestsRunOnTheServerQueueInArrivalOrder) {
@@ -518,12 +518,6 @@ TEST_F(ServerInstanceTest, RequestsThroughTheConnectionsExportedObject) {
               ElementsAre(Value(Dictionary{{"reporterID", 42}, {"serviceType", 2}})));
   EXPECT_THAT(a.connection->RepliesFor(5), ElementsAre(Value()));
 }
-
-}  // namespace
-}  // namespace qn
-
-namespace qn {
-namespace {
 
 TEST_F(ServerInstanceTest, TheSessionRegistryListsTheSessionsStillAlive) {
   Client a = h_.Connect(100);

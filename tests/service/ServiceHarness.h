@@ -14,7 +14,7 @@
 #include "Statistics/Service/QNReportingServiceDelegate.h"
 #include "Statistics/Service/QNReportingSession.h"
 #include "tests/fakes/FakeIpc.h"
-#include "tests/service/ServiceTestPlatform.h"
+#include "tests/fakes/FakePlatform.h"
 
 namespace qn::testing::service {
 
@@ -53,7 +53,7 @@ struct Client {
 class ServiceHarness {
  public:
   // `setup` runs before the delegate is made (driver counters, defaults, notify failures).
-  explicit ServiceHarness(const std::function<void(ServiceTestPlatform&)>& setup = nullptr,
+  explicit ServiceHarness(const std::function<void(FakePlatform&)>& setup = nullptr,
                           QNReportingServiceDelegate::Options options = {}) {
     if (setup) setup(env);
     delegate = QNReportingServiceDelegate::Create(env.platform, options);
@@ -83,7 +83,7 @@ class ServiceHarness {
     Run();
   }
 
-  ServiceTestPlatform env;
+  FakePlatform env;
   std::shared_ptr<FakeIpcListener> listener = std::make_shared<FakeIpcListener>();
   std::shared_ptr<QNReportingServiceDelegate> delegate;
 };

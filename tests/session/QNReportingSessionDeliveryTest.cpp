@@ -1,13 +1,9 @@
 // Message intake and delivery: through the framework session, as single messages, and the
 // cases where a message is dropped.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
 #include <chrono>
 #include <regex>
 
-#include "Statistics/Service/QNReportingSession.h"
-#include "tests/session/SessionTestPlatform.h"
+#include "tests/session/SessionTest.h"
 
 namespace qn {
 namespace {
@@ -15,27 +11,9 @@ namespace {
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::MatchesRegex;
-using testing::SessionTestPlatform;
+using testing::Payload;
 using namespace std::chrono_literals;
-
-class DeliveryTest : public ::testing::Test {
- protected:
-  std::shared_ptr<QNReportingSession> NewSession(std::int64_t id = 42) {
-    return QNReportingSession::initWithID(t_.platform, id, Array{});
-  }
-  static std::shared_ptr<const Dictionary> Payload(Dictionary d) {
-    return std::make_shared<const Dictionary>(std::move(d));
-  }
-  std::shared_ptr<QNReportingSession> StartedSession(std::uint16_t serviceType = 2) {
-    auto session = NewSession();
-    session->setServiceType(serviceType);
-    session->start();
-    t_.dispatcher->RunUntilIdle();
-    return session;
-  }
-
-  SessionTestPlatform t_;
-};
+using DeliveryTest = testing::SessionFixture;
 
 TEST_F(DeliveryTest, StartedSessionDeliversConvertedPayloadWithCategoryCut) {
   t_.log->EnableDebug("qnrr");
@@ -95,8 +73,7 @@ TEST_F(DeliveryTest, DeliveriesKeepSubmissionOrder) {
 
 TEST_F(DeliveryTest, MessageBeforeStartIsCountedDiscardedAndSentSingle) {
   t_.log->EnableDebug("qnrr");
-  auto session = NewSession();
-  session->setServiceType(7);
+  auto session = NewSession(42, 7);
   session->sendMessage(Payload({{"k v", 1}}), 0x00010005, 1, nullptr);
   EXPECT_EQ(session->aggregatedPayloadData()->Snapshot().size(), 1u);
   session->start();
@@ -141,18 +118,6 @@ TEST_F(DeliveryTest, MessageAfterStopIsCountedNotAggregatedAndSentSingle) {
   EXPECT_EQ(*singles[0].user_info.Find(kLivoReportingUserInfoServiceName),
             Value("audiodeviceusage"));
   EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
-}
-
-TEST_F(DeliveryTest, TestSessionSendsNothing) {
-  auto session = StartedSession(11);
-  session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
-  session->sendMessage(Payload({{"a", 2}}), 1, 0, nullptr);
-  t_.dispatcher->RunUntilIdle();
-  auto lines = t_.log->Matching("transactions aren't allowed");
-  EXPECT_THAT(lines, ElementsAre(MatchesRegex(".*: transactions aren't allowed on this platform"),
-                                 MatchesRegex(".*: transactions aren't allowed on this platform")));
-  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
-  EXPECT_TRUE(t_.livo->SingleMessages().empty());
 }
 
 TEST_F(DeliveryTest, FrameworkRefusalStaysSilent) {
@@ -230,20 +195,6 @@ TEST_F(DeliveryTest, AlarmSingleMessagesWaitTheirRandomDelay) {
     }
     EXPECT_EQ(t_.livo->SingleMessages().size(), before + 1);
   }
-}
-
-TEST_F(DeliveryTest, DeliveryAfterStopQueuedBeforeFlush) {
-  auto session = StartedSession();
-  session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  // The message and the summary event were delivered through the framework session before
-  // the end sequence dropped it.
-  auto messages = t_.livo->Sessions()[0].messages;
-  ASSERT_EQ(messages.size(), 2u);
-  EXPECT_EQ(messages[1].category, 0xFFFF);
-  EXPECT_EQ(messages[1].type, 0xFFFF);
-  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
 }
 
 }  // namespace

@@ -3,9 +3,6 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
-#include <condition_variable>
-#include <functional>
-#include <mutex>
 
 #include "Statistics/Service/QNReportingSession.h"
 #include "platform/linux/linux_dispatch.h"
@@ -19,49 +16,15 @@ namespace {
 using testing::FakeLivoReporting;
 using namespace std::chrono_literals;
 
-// A LogCapture that wakes waiters on every line, so the test can wait for an event
-// instead of sleeping.
-class NotifyingLog final : public Log {
- public:
-  std::shared_ptr<const LogScope> RegisterScope(bool enabled, std::uint64_t code,
-                                                std::string code_string, std::string subsystem,
-                                                std::string category,
-                                                std::uint32_t flags) override {
-    return capture_.RegisterScope(enabled, code, std::move(code_string), std::move(subsystem),
-                                  std::move(category), flags);
-  }
-  bool LogEnabled(const LogScope* scope, int level) const override {
-    return capture_.LogEnabled(scope, level);
-  }
-  void Write(const LogScope* scope, LogLevel level, const char* file, int line,
-             const char* function, std::string_view message) override {
-    capture_.Write(scope, level, file, line, function, message);
-    std::lock_guard lock(mu_);
-    ++writes_;
-    cv_.notify_all();
-  }
-
-  // Waits until `needle` occurs in at least `count` lines. The limit is only a guard
-  // against a hang; it is far beyond what the work needs.
-  bool WaitForCount(std::string_view needle, int count) {
-    std::unique_lock lock(mu_);
-    return cv_.wait_for(lock, 120s, [&] { return capture_.Count(needle) >= count; });
-  }
-
-  testing::LogCapture& capture() { return capture_; }
-
- private:
-  testing::LogCapture capture_;
-  std::mutex mu_;
-  std::condition_variable cv_;
-  long writes_ = 0;
-};
-
 TEST(SessionLinuxDispatchTest, WaitingStartsDoNotHoldUpOtherSessions) {
   constexpr int kWaiting = 200;
   constexpr int kMessages = 10;
-  auto log = std::make_shared<NotifyingLog>();
-  log->capture().EnableDebug("qnrr");
+  auto log = std::make_shared<testing::LogCapture>();
+  log->EnableDebug("qnrr");
+  // Waits for the lines that mark each step; the limit only guards against a hang.
+  auto wait_for = [&](std::string_view needle, int count) {
+    return log->WaitForCount(needle, count, 120s);
+  };
   auto trace = std::make_shared<testing::TraceRecorder>();
   std::shared_ptr<Dispatcher> dispatcher = NewLinuxDispatcher({.threads = 2});
 
@@ -86,7 +49,7 @@ TEST(SessionLinuxDispatchTest, WaitingStartsDoNotHoldUpOtherSessions) {
     s->sendMessage(std::make_shared<const Dictionary>(Dictionary{{"i", i}}), 1, 0, nullptr);
     waiting.push_back(std::move(s));
   }
-  ASSERT_TRUE(log->WaitForCount("waiting for livoreportingd to find backends", kWaiting));
+  ASSERT_TRUE(wait_for("waiting for livoreportingd to find backends", kWaiting));
 
   // Every start above is now holding its queue. A session whose backends answer at once
   // delivers all of its messages all the same.
@@ -95,28 +58,28 @@ TEST(SessionLinuxDispatchTest, WaitingStartsDoNotHoldUpOtherSessions) {
   for (int i = 0; i < kMessages; ++i) {
     other->sendMessage(std::make_shared<const Dictionary>(Dictionary{{"n", i}}), 1, 0, nullptr);
   }
-  ASSERT_TRUE(log->WaitForCount("LivoReportingAgent", kMessages));
+  ASSERT_TRUE(wait_for("LivoReportingAgent", kMessages));
   EXPECT_EQ(answeringLivo->AllSessionMessages().size(), static_cast<std::size_t>(kMessages));
 
   // ... while none of the waiting sessions has timed out or delivered anything.
-  EXPECT_EQ(log->capture().Count("failed to find backend"), 0);
-  EXPECT_EQ(log->capture().Count("No valid LivoReportingSession"), 0);
+  EXPECT_EQ(log->Count("failed to find backend"), 0);
+  EXPECT_EQ(log->Count("No valid LivoReportingSession"), 0);
   EXPECT_TRUE(silentLivo->AllSessionMessages().empty());
 
   // When the backends turn up, every held queue resumes and delivers its message.
   EXPECT_EQ(silentLivo->AnswerPending(Array{Value("late")}), kWaiting);
-  ASSERT_TRUE(log->WaitForCount("LivoReportingAgent", kMessages + kWaiting));
+  ASSERT_TRUE(wait_for("LivoReportingAgent", kMessages + kWaiting));
   EXPECT_EQ(silentLivo->AllSessionMessages().size(), static_cast<std::size_t>(kWaiting));
-  EXPECT_EQ(log->capture().Count(": continuing"), kWaiting);
+  EXPECT_EQ(log->Count(": continuing"), kWaiting);
 
   // Stop everything (each stop sends one summary event) and let the queued work release
   // the sessions before the dispatcher goes.
   for (auto& s : waiting) s->stop();
   other->stop();
-  ASSERT_TRUE(log->WaitForCount("LivoReportingAgent", kMessages + 2 * kWaiting + 1));
+  ASSERT_TRUE(wait_for("LivoReportingAgent", kMessages + 2 * kWaiting + 1));
   waiting.clear();
   other.reset();
-  ASSERT_TRUE(log->WaitForCount("deallocing this session", kWaiting + 1));
+  ASSERT_TRUE(wait_for("deallocing this session", kWaiting + 1));
 }
 
 }  // namespace

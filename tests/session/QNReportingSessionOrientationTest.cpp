@@ -1,42 +1,24 @@
 // Orientation reporting of telephony and long-form audio sessions on internal builds.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
-
 #include <atomic>
 #include <chrono>
 #include <thread>
 
-#include "Statistics/Service/QNReportingSession.h"
-#include "tests/session/SessionTestPlatform.h"
+#include "tests/session/SessionTest.h"
 
 namespace qn {
 namespace {
 
 using ::testing::ElementsAre;
-using testing::SessionTestPlatform;
+using testing::FakePlatform;
+using testing::Payload;
 using namespace std::chrono_literals;
-
-class OrientationTest : public ::testing::Test {
- protected:
-  std::shared_ptr<QNReportingSession> NewSession(std::uint16_t serviceType) {
-    auto session = QNReportingSession::initWithID(t_.platform, 42, Array{});
-    session->setServiceType(serviceType);
-    return session;
-  }
-  void SetInternal(bool internal, int deviceClass = 1) {
-    t_.device_info->SetAnswer("InternalBuild", internal);
-    t_.device_info->SetAnswer("DeviceClassNumber", deviceClass);
-  }
-
-  SessionTestPlatform t_;
-};
+using OrientationTest = testing::SessionFixture;
 
 TEST_F(OrientationTest, ChangesAreFiledWithTruncatedSecondsAndUnregisteredAtStop) {
   SetInternal(true);
   t_.log->EnableDebug("qnrr");
-  auto session = NewSession(2);
-  session->setConfiguration(std::make_shared<const Dictionary>(
-      Dictionary{{"HostApplicationDisplayID", "org.example.phone"}}));
+  auto session = NewSession(42, 2);
+  session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.phone"}}));
   session->start();
   EXPECT_EQ(session->orientationCallbackID(), "QNReportingService 42");
   ASSERT_TRUE(session->startDate());
@@ -92,7 +74,7 @@ TEST_F(OrientationTest, ChangesAreFiledWithTruncatedSecondsAndUnregisteredAtStop
 TEST_F(OrientationTest, MissingHostAppPrintsNull) {
   SetInternal(true);
   t_.log->EnableDebug("qnrr");
-  auto session = NewSession(7);
+  auto session = NewSession(42, 7);
   session->start();
   t_.orientation->FireUI(99);
   EXPECT_THAT(t_.log->Matching("Orientation handler"),
@@ -111,7 +93,7 @@ TEST_F(OrientationTest, OnlyInternalTelephonyAndLongFormOnOtherDeviceClasses) {
                         {true, 6, 2, false}, {true, 1, 3, false}, {true, 1, 65535, false},
                         {true, 0, 7, true}};
   for (const Case& c : cases) {
-    SessionTestPlatform t;
+    FakePlatform t;
     t.device_info->SetAnswer("InternalBuild", c.internal);
     t.device_info->SetAnswer("DeviceClassNumber", c.deviceClass);
     auto session = QNReportingSession::initWithID(t.platform, 42, Array{});
@@ -129,7 +111,7 @@ TEST_F(OrientationTest, OnlyInternalTelephonyAndLongFormOnOtherDeviceClasses) {
 
 TEST_F(OrientationTest, TypeChangedBeforeStopKeepsTheRegistration) {
   SetInternal(true);
-  auto session = NewSession(2);
+  auto session = NewSession(42, 2);
   session->start();
   session->setServiceType(3);
   session->stop();
@@ -143,7 +125,7 @@ TEST_F(OrientationTest, TypeChangedBeforeStopKeepsTheRegistration) {
 
 TEST_F(OrientationTest, UnregistrationRunsEvenWhenNotStarted) {
   SetInternal(true);
-  auto session = NewSession(7);
+  auto session = NewSession(42, 7);
   session->start();
   session->setStarted(false);
   session->stop();
@@ -155,7 +137,7 @@ TEST_F(OrientationTest, UnregistrationRunsEvenWhenNotStarted) {
 
 TEST_F(OrientationTest, CallbacksRaceWithIntakeAndStop) {
   SetInternal(true);
-  auto session = NewSession(7);
+  auto session = NewSession(42, 7);
   session->start();
   std::atomic<bool> go{true};
   std::thread source([&] {
@@ -165,7 +147,7 @@ TEST_F(OrientationTest, CallbacksRaceWithIntakeAndStop) {
     }
   });
   for (int i = 0; i < 200; ++i) {
-    session->sendMessage(std::make_shared<const Dictionary>(Dictionary{{"i", i}}), 1, 0, nullptr);
+    session->sendMessage(Payload({{"i", i}}), 1, 0, nullptr);
   }
   auto aggregated = session->aggregatedPayloadData();
   session->stop();
@@ -180,7 +162,7 @@ TEST_F(OrientationTest, CallbacksRaceWithIntakeAndStop) {
 
 TEST_F(OrientationTest, CallbacksHoldTheSessionWeakly) {
   SetInternal(true);
-  auto session = NewSession(2);
+  auto session = NewSession(42, 2);
   session->start();
   t_.dispatcher->RunUntilIdle();
   session.reset();

@@ -1,16 +1,12 @@
 // The session summary event and the summary file written at stop.
-#include <gmock/gmock.h>
-#include <gtest/gtest.h>
 #include <sys/stat.h>
 
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
-#include <sstream>
 
-#include "Statistics/Service/QNReportingSession.h"
 #include "common/Json.h"
-#include "tests/session/SessionTestPlatform.h"
+#include "tests/fakes/TempDir.h"
+#include "tests/session/SessionTest.h"
 
 namespace qn {
 namespace {
@@ -19,31 +15,14 @@ namespace fs = std::filesystem;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
 using ::testing::MatchesRegex;
-using testing::SessionTestPlatform;
+using testing::Payload;
+using testing::ReadFileText;
 
-class SummaryTest : public ::testing::Test {
+// Summary files go to a temporary folder.
+class SummaryTest : public testing::SessionFixture {
  protected:
-  void SetUp() override {
-    std::string pattern = (fs::temp_directory_path() / "qn-summary-XXXXXX").string();
-    ASSERT_TRUE(mkdtemp(pattern.data()));
-    tmp_ = pattern;
-    t_.platform->diagnostic_logs_dir = (tmp_ / "DiagnosticLogs/Audio/Reporting").string();
-  }
-  void TearDown() override {
-    std::error_code ec;
-    fs::permissions(tmp_, fs::perms::owner_all, fs::perm_options::add, ec);
-    fs::remove_all(tmp_, ec);
-  }
+  SummaryTest() { t_.platform->diagnostic_logs_dir = tmp_.File("DiagnosticLogs/Audio/Reporting"); }
 
-  std::shared_ptr<QNReportingSession> NewSession(std::uint16_t serviceType) {
-    auto session = QNReportingSession::initWithID(t_.platform, 42, Array{});
-    session->setServiceType(serviceType);
-    return session;
-  }
-  static std::shared_ptr<const Dictionary> Payload(Dictionary d) {
-    return std::make_shared<const Dictionary>(std::move(d));
-  }
-  void SetInternal(bool internal) { t_.device_info->SetAnswer("InternalBuild", internal); }
   std::vector<fs::path> SummaryFiles() const {
     std::vector<fs::path> files;
     std::error_code ec;
@@ -52,19 +31,24 @@ class SummaryTest : public ::testing::Test {
     }
     return files;
   }
-  static std::string Read(const fs::path& p) {
-    std::ifstream in(p);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
+  // Runs a session of `serviceType` with the message {"a": 1} (category 1) from start to
+  // stop, its queued work included.
+  std::shared_ptr<QNReportingSession> OneMessageSession(std::uint16_t serviceType,
+                                                        Dictionary configuration = {}) {
+    auto session = NewSession(42, serviceType);
+    if (!configuration.empty()) session->setConfiguration(Payload(std::move(configuration)));
+    session->start();
+    session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
+    session->stop();
+    t_.dispatcher->RunUntilIdle();
+    return session;
   }
 
-  SessionTestPlatform t_;
-  fs::path tmp_;
+  testing::TempDir tmp_;
 };
 
 TEST_F(SummaryTest, SummaryJoinsValuesPerKeyInPayloadOrder) {
-  auto session = NewSession(3);
+  auto session = NewSession(42, 3);
   session->start();
   session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
   session->sendMessage(Payload({{"a", 2}, {"b", "x"}}), 1, 0, nullptr);
@@ -79,7 +63,7 @@ TEST_F(SummaryTest, SummaryJoinsValuesPerKeyInPayloadOrder) {
 }
 
 TEST_F(SummaryTest, ValuesAreNeitherSummedNorDeduplicated) {
-  auto session = NewSession(65535);
+  auto session = NewSession(42, 65535);
   session->start();
   session->sendMessage(Payload({{"k", 1}, {"QN_Session_Summary_Event", "mine"}}), 1, 0, nullptr);
   session->sendMessage(Payload({{"k", 1}, {"n", Array{Value(1), Value("two")}}}), 1, 0, nullptr);
@@ -93,22 +77,15 @@ TEST_F(SummaryTest, ValuesAreNeitherSummedNorDeduplicated) {
 }
 
 TEST_F(SummaryTest, NothingAggregatedMeansNoSummary) {
-  auto session = NewSession(3);
+  auto session = NewSession(42, 3);
   session->start();
   EXPECT_FALSE(session->createSummaryEventForSession());
   session->stop();
   EXPECT_FALSE(session->createSummaryEventForSession());  // arrays gone
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_FALSE(t_.log->Contains("sending summary event"));
-  EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
 }
 
-TEST_F(SummaryTest, StopSendsSummaryThroughTheSessionAndCountsIt) {
-  auto session = NewSession(3);
-  session->start();
-  session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
+TEST_F(SummaryTest, StopSendsSummaryThroughTheSessionBeforeItsFlushAndCountsIt) {
+  auto session = OneMessageSession(3);
   auto lines = t_.log->Lines();
   auto it = std::find_if(lines.begin(), lines.end(), [](const auto& l) {
     return l.text.find("sending summary event") != std::string::npos;
@@ -117,7 +94,12 @@ TEST_F(SummaryTest, StopSendsSummaryThroughTheSessionAndCountsIt) {
   EXPECT_THAT(it->text, MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*stop.*: sending summary "
                                      "event for reporter 42"));
   EXPECT_EQ(it->level, LogLevel::kDefault);
-  auto messages = t_.livo->AllSessionMessages();
+  // The message and the summary event went through the framework session before the end
+  // sequence flushed and dropped it.
+  auto framework = t_.livo->Sessions();
+  ASSERT_EQ(framework.size(), 1u);
+  EXPECT_EQ(framework[0].flushes, 1);
+  auto messages = framework[0].messages;
   ASSERT_EQ(messages.size(), 2u);
   EXPECT_EQ(messages[1].category, 0xFFFF);
   EXPECT_EQ(messages[1].type, 0xFFFF);
@@ -127,7 +109,7 @@ TEST_F(SummaryTest, StopSendsSummaryThroughTheSessionAndCountsIt) {
 
 TEST_F(SummaryTest, InternalBuildWritesPrettyJsonWithUserInfoFirst) {
   SetInternal(true);
-  auto session = NewSession(0);
+  auto session = NewSession(42, 0);
   session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.app"}}));
   session->start();
   t_.dispatcher->RunUntilIdle();
@@ -149,52 +131,39 @@ TEST_F(SummaryTest, InternalBuildWritesPrettyJsonWithUserInfoFirst) {
                               Dictionary{{"QN_Session_Summary_Event", "0"}, {"a_b", "1"}}}})});
   std::string expected_text;
   ASSERT_FALSE(ToJson(expected, JsonStyle::kPretty, expected_text));
-  EXPECT_EQ(Read(files[0]), expected_text);
+  EXPECT_EQ(ReadFileText(files[0]), expected_text);
   EXPECT_THAT(expected_text, HasSubstr("\n"));
 
   struct stat st {};
   ASSERT_EQ(stat(t_.platform->diagnostic_logs_dir.c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0777u);
-  ASSERT_EQ(stat((tmp_ / "DiagnosticLogs").c_str(), &st), 0);
+  ASSERT_EQ(stat(tmp_.File("DiagnosticLogs").c_str(), &st), 0);
   EXPECT_EQ(st.st_mode & 07777, 0777u);
   for (const auto& l : t_.log->Lines()) EXPECT_NE(l.level, LogLevel::kError) << l.text;
 }
 
 TEST_F(SummaryTest, CustomerBuildWritesNothing) {
   SetInternal(false);
-  auto session = NewSession(2);
-  session->start();
-  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_FALSE(fs::exists(tmp_ / "DiagnosticLogs"));
+  OneMessageSession(2);
+  EXPECT_FALSE(fs::exists(tmp_.File("DiagnosticLogs")));
   EXPECT_EQ(t_.livo->AllSessionMessages().size(), 2u);  // the summary event still went out
 }
 
 TEST_F(SummaryTest, MissingHostAppNamesTheFileUnknown) {
   SetInternal(true);
-  auto session = NewSession(13);
-  session->start();
-  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
+  OneMessageSession(13);
   auto files = SummaryFiles();
   ASSERT_EQ(files.size(), 1u);
   EXPECT_THAT(files[0].filename().string(), MatchesRegex(".*-quenta-unknown-telephony\\.json"));
   Value content;
-  ASSERT_FALSE(ParseJson(Read(files[0]), content));
+  ASSERT_FALSE(ParseJson(ReadFileText(files[0]), content));
   ASSERT_TRUE(content.as_array());
   EXPECT_EQ(content.as_array()->front(), Value(Dictionary{}));
 }
 
 TEST_F(SummaryTest, HostAppCannotLeadOutOfTheDirectory) {
   SetInternal(true);
-  auto session = NewSession(0);
-  session->setConfiguration(Payload({{"HostApplicationDisplayID", "../../escape"}}));
-  session->start();
-  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
+  OneMessageSession(0, {{"HostApplicationDisplayID", "../../escape"}});
   auto files = SummaryFiles();
   ASSERT_EQ(files.size(), 1u);
   EXPECT_THAT(files[0].filename().string(),
@@ -203,14 +172,10 @@ TEST_F(SummaryTest, HostAppCannotLeadOutOfTheDirectory) {
 
 TEST_F(SummaryTest, BlockedDirectoryIsLoggedAndStopGoesOn) {
   SetInternal(true);
-  { std::ofstream(tmp_ / "blocked") << "x"; }
-  const std::string dir = (tmp_ / "blocked" / "Reporting").string();
+  { std::ofstream(tmp_.File("blocked")) << "x"; }
+  const std::string dir = tmp_.File("blocked/Reporting");
   t_.platform->diagnostic_logs_dir = dir;
-  auto session = NewSession(0);
-  session->start();
-  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
+  auto session = OneMessageSession(0);
   auto dirLines = t_.log->Matching("can't create logging directory");
   ASSERT_EQ(dirLines.size(), 1u);
   EXPECT_THAT(dirLines[0], MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*: can't create logging "
@@ -226,7 +191,7 @@ TEST_F(SummaryTest, BlockedDirectoryIsLoggedAndStopGoesOn) {
 
 TEST_F(SummaryTest, SerialiserRefusalIsLoggedAndNothingWritten) {
   SetInternal(true);
-  auto session = NewSession(0);
+  auto session = NewSession(42, 0);
   session->start();
   session->sendMessage(Payload({{"blob", Data{{1, 2, 3}}}}), 5, 1, nullptr);
   session->stop();
@@ -240,7 +205,7 @@ TEST_F(SummaryTest, SerialiserRefusalIsLoggedAndNothingWritten) {
 
 TEST_F(SummaryTest, WritingInsertsUserInfoIntoTheArray) {
   SetInternal(true);
-  auto session = NewSession(0);
+  auto session = NewSession(42, 0);
   session->setConfiguration(Payload({{"x", 1}}));
   session->start();
   session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);

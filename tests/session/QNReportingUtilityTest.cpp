@@ -8,14 +8,14 @@
 #include <thread>
 #include <vector>
 
-#include "tests/session/SessionTestPlatform.h"
+#include "tests/fakes/FakePlatform.h"
 
 namespace qn {
 namespace {
 
 using ::testing::ElementsAre;
+using testing::FakePlatform;
 using ::testing::MatchesRegex;
-using testing::SessionTestPlatform;
 using namespace std::chrono_literals;
 
 TEST(QNReportingUtilityTest, CategoryNames) {
@@ -83,7 +83,7 @@ TEST(QNReportingUtilityTest, InternalBuildAnswerReadAsBoolean) {
                         {Value(1), true},      {Value(0), false},    {Value("YES"), true},
                         {Value("true"), true}, {Value("no"), false}, {Value(""), false}};
   for (const Case& c : cases) {
-    SessionTestPlatform t;
+    FakePlatform t;
     if (c.answer) t.device_info->SetAnswer("InternalBuild", *c.answer);
     EXPECT_EQ(QNReportingIsInternalBuild(*t.platform), c.expected)
         << (c.answer ? c.answer->Description() : "(none)");
@@ -93,7 +93,7 @@ TEST(QNReportingUtilityTest, InternalBuildAnswerReadAsBoolean) {
 }
 
 TEST(QNReportingUtilityTest, InternalBuildAskedOncePerPlatformEvenWhenRacing) {
-  SessionTestPlatform t;
+  FakePlatform t;
   t.device_info->SetAnswer("InternalBuild", true);
   std::vector<std::thread> threads;
   std::atomic<int> yes{0};
@@ -121,7 +121,7 @@ class WaitTest : public ::testing::Test {
     return out;
   }
 
-  SessionTestPlatform t_;
+  FakePlatform t_;
   std::shared_ptr<const LogScope> scope_ = t_.log->RegisterScope(
       true, 0x716E7272, "qnrr", "com.norvel.quenta", "reporting_session_verbose", 31);
   std::shared_ptr<Condition> condition_ = t_.dispatcher->CreateCondition();

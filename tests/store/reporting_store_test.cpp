@@ -9,17 +9,13 @@
 #include <mutex>
 #include <thread>
 
-#include "platform/linux/reporting_store_reader.h"
-#include "tests/fakes/LogCapture.h"
 #include "tests/store/store_test_util.h"
 
 namespace qn {
 namespace {
 
-using testing::LogCapture;
 using testing::ParseJson;
 using testing::ReadRows;
-using testing::TempDir;
 using Table = ReportingStoreRow::Table;
 
 // Holds the writer thread inside a task until Release, so that a test can hand records
@@ -56,19 +52,7 @@ class WriterGate {
   std::thread::id writer_thread_;
 };
 
-class ReportingStoreTest : public ::testing::Test {
- protected:
-  std::shared_ptr<ReportingStore> OpenStore(ReportingStore::Options options = {}) {
-    std::optional<Error> error;
-    auto store = ReportingStore::Open(db_path_, log_, options, &error);
-    EXPECT_TRUE(store) << (error ? error->Description() : "");
-    return store;
-  }
-
-  TempDir dir_;
-  std::string db_path_ = dir_.File("reports.db");
-  std::shared_ptr<LogCapture> log_ = std::make_shared<LogCapture>();
-};
+using ReportingStoreTest = testing::StoreTest;
 
 TEST_F(ReportingStoreTest, EveryKindOfRecordLandsInHandOverOrder) {
   auto store = OpenStore();
@@ -353,24 +337,6 @@ TEST_F(ReportingStoreTest, OpenRefusesNewerSchemasAndNonDatabases) {
   error.reset();
   EXPECT_FALSE(ReportingStore::Open(dir_.File("no/such/dir/reports.db"), log_, &error));
   EXPECT_TRUE(error);
-}
-
-TEST_F(ReportingStoreTest, ReaderSeesCommittedRowsWhileOpenAndAfterClose) {
-  auto store = OpenStore();
-  const std::int64_t id = store->NewSessionId();
-  store->AddSession(id, Value(Dictionary{}), Value(Dictionary{}));
-  store->AddSessionMessage(id, 1, 1, Value(1));
-  store->AddAnalyticsEvent("a", nullptr);
-  store->AddPowerLogEvent(28, "p", Value());
-  store->Drain();
-  EXPECT_EQ(ReadRows(db_path_).size(), 4u);
-
-  store->Close();
-  store.reset();
-  EXPECT_EQ(ReadRows(db_path_).size(), 4u);
-  EXPECT_EQ(ReadRows(db_path_, ReportingSink::kReporting).size(), 2u);
-  EXPECT_EQ(ReadRows(db_path_, ReportingSink::kAnalytics).size(), 1u);
-  EXPECT_EQ(ReadRows(db_path_, ReportingSink::kPowerLog).size(), 1u);
 }
 
 }  // namespace

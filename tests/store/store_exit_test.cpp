@@ -17,7 +17,6 @@ namespace qn {
 namespace {
 
 using testing::ReadRows;
-using testing::TempDir;
 
 constexpr int kRows = 10'000;
 
@@ -59,7 +58,7 @@ std::size_t MessageRows(const std::string& path) {
 }
 
 TEST(StoreExitTest, DrainHookThenUnderscoreExitKeepsEverything) {
-  TempDir dir;
+  testing::TempDir dir;
   const std::string path = dir.File("reports.db");
   int status = RunChild([&] {
     auto store = HandOverRows(path);
@@ -73,7 +72,7 @@ TEST(StoreExitTest, DrainHookThenUnderscoreExitKeepsEverything) {
 }
 
 TEST(StoreExitTest, SigtermHandledByDrainingKeepsEverything) {
-  TempDir dir;
+  testing::TempDir dir;
   const std::string path = dir.File("reports.db");
   int ready[2];
   ASSERT_EQ(pipe(ready), 0);
@@ -107,7 +106,7 @@ TEST(StoreExitTest, SigtermHandledByDrainingKeepsEverything) {
 }
 
 TEST(StoreExitTest, NormalExitWithTheStoreStillOpenKeepsEverything) {
-  TempDir dir;
+  testing::TempDir dir;
   const std::string path = dir.File("reports.db");
   int status = RunChild([&] {
     auto store = HandOverRows(path);

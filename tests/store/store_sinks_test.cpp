@@ -3,35 +3,24 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <functional>
 #include <future>
 #include <thread>
 
 #include "common/Json.h"
 #include "tests/fakes/FakeAnalytics.h"
 #include "tests/fakes/FakeEnerdex.h"
-#include "tests/fakes/LogCapture.h"
 #include "tests/store/store_test_util.h"
 
 namespace qn {
 namespace {
 
-using testing::LogCapture;
 using testing::ParseJson;
 using testing::ReadRows;
-using testing::TempDir;
 using Table = ReportingStoreRow::Table;
-
-std::shared_ptr<ReportingStore> OpenStore(const std::string& path) {
-  std::optional<Error> error;
-  auto store = ReportingStore::Open(path, std::make_shared<LogCapture>(), &error);
-  EXPECT_TRUE(store) << (error ? error->Description() : "");
-  return store;
-}
 
 // ---- Analytics and power log: one contract, run on the store sinks and on the fakes ----
 
-// What an event sink recorded, as (name, payload JSON) or (subsystem, name, payload JSON).
+// What an event sink recorded: subsystem (0 for analytics), name, payload JSON.
 struct RecordedEvent {
   std::int64_t subsystem = 0;
   std::string name;
@@ -43,89 +32,66 @@ void PrintTo(const RecordedEvent& e, std::ostream* os) {
   *os << "{" << e.subsystem << ", " << e.name << ", " << e.payload << "}";
 }
 
-class EventSinkHarness {
- public:
-  virtual ~EventSinkHarness() = default;
-  virtual qn::Analytics& analytics() = 0;
-  virtual qn::Enerdex& enerdex() = 0;
-  virtual std::vector<RecordedEvent> RecordedAnalytics() = 0;
-  virtual std::vector<RecordedEvent> RecordedPowerLog() = 0;
-};
+struct StoreSinks {
+  testing::TempDir dir;
+  std::shared_ptr<ReportingStore> store =
+      ReportingStore::Open(dir.File("reports.db"), nullptr, nullptr);
+  std::shared_ptr<qn::Analytics> analytics = NewStoreAnalytics(store);
+  std::shared_ptr<qn::Enerdex> enerdex = NewStoreEnerdex(store);
 
-class StoreHarness final : public EventSinkHarness {
- public:
-  StoreHarness()
-      : store_(OpenStore(dir_.File("reports.db"))),
-        analytics_(NewStoreAnalytics(store_)),
-        enerdex_(NewStoreEnerdex(store_)) {}
-  qn::Analytics& analytics() override { return *analytics_; }
-  qn::Enerdex& enerdex() override { return *enerdex_; }
-  std::vector<RecordedEvent> RecordedAnalytics() override {
-    return Rows(ReportingSink::kAnalytics);
-  }
-  std::vector<RecordedEvent> RecordedPowerLog() override { return Rows(ReportingSink::kPowerLog); }
-
- private:
-  std::vector<RecordedEvent> Rows(ReportingSink sink) {
-    store_->Drain();
+  std::vector<RecordedEvent> Recorded(ReportingSink sink) {
+    store->Drain();
     std::vector<RecordedEvent> events;
-    for (const auto& row : ReadRows(store_->path(), sink)) {
+    for (const auto& row : ReadRows(store->path(), sink)) {
       events.push_back({row.subsystem, row.name, row.payload});
     }
     return events;
   }
-
-  TempDir dir_;
-  std::shared_ptr<ReportingStore> store_;
-  std::shared_ptr<qn::Analytics> analytics_;
-  std::shared_ptr<qn::Enerdex> enerdex_;
 };
 
-class FakeHarness final : public EventSinkHarness {
- public:
-  qn::Analytics& analytics() override { return analytics_; }
-  qn::Enerdex& enerdex() override { return enerdex_; }
-  std::vector<RecordedEvent> RecordedAnalytics() override {
+struct FakeSinks {
+  std::shared_ptr<testing::FakeAnalytics> analytics = std::make_shared<testing::FakeAnalytics>();
+  std::shared_ptr<testing::FakeEnerdex> enerdex = std::make_shared<testing::FakeEnerdex>();
+
+  std::vector<RecordedEvent> Recorded(ReportingSink sink) {
     std::vector<RecordedEvent> events;
-    for (const auto& e : analytics_.Events())
-      events.push_back({0, e.name, ToJsonLenient(e.payload)});
-    return events;
-  }
-  std::vector<RecordedEvent> RecordedPowerLog() override {
-    std::vector<RecordedEvent> events;
-    for (const auto& e : enerdex_.Events()) {
-      events.push_back({e.subsystem, e.name, ToJsonLenient(e.payload)});
+    if (sink == ReportingSink::kAnalytics) {
+      for (const auto& e : analytics->Events()) {
+        events.push_back({0, e.name, ToJsonLenient(e.payload)});
+      }
+    } else {
+      for (const auto& e : enerdex->Events()) {
+        events.push_back({e.subsystem, e.name, ToJsonLenient(e.payload)});
+      }
     }
     return events;
   }
-
- private:
-  testing::FakeAnalytics analytics_;
-  testing::FakeEnerdex enerdex_;
 };
 
-using HarnessFactory = std::function<std::unique_ptr<EventSinkHarness>()>;
-
-class EventSinkContractTest : public ::testing::TestWithParam<HarnessFactory> {
+template <typename Sinks>
+class EventSinkContractTest : public ::testing::Test {
  protected:
-  std::unique_ptr<EventSinkHarness> sinks_ = GetParam()();
+  Sinks sinks_;
 };
 
-TEST_P(EventSinkContractTest, AnalyticsRecordsEachEventWithItsProvidersPayloadOnce) {
+using SinkKinds = ::testing::Types<StoreSinks, FakeSinks>;
+TYPED_TEST_SUITE(EventSinkContractTest, SinkKinds);
+
+TYPED_TEST(EventSinkContractTest, AnalyticsRecordsEachEventWithItsProvidersPayloadOnce) {
   std::atomic<int> calls{0};
   {
     // The payload lives only in the provider, as the analytics bridge hands it over.
     Value payload(Dictionary{{"HostApplicationDisplayID", "Unknown"}, {"volume", 0.5}});
-    sinks_->analytics().SendEventLazy("com.norvel.quenta.Volume.Stop", [payload, &calls] {
+    this->sinks_.analytics->SendEventLazy("com.norvel.quenta.Volume.Stop", [payload, &calls] {
       ++calls;
       return payload;
     });
   }
-  sinks_->analytics().SendEventLazy("com.norvel.quenta.qnreportingclientuptime", [&calls] {
+  this->sinks_.analytics->SendEventLazy("com.norvel.quenta.qnreportingclientuptime", [&calls] {
     ++calls;
     return Value(Dictionary{{"uptime", 12}});
   });
-  sinks_->analytics().SendEventLazy("empty", nullptr);
+  this->sinks_.analytics->SendEventLazy("empty", nullptr);
 
   std::vector<RecordedEvent> expected = {
       {0, "com.norvel.quenta.Volume.Stop",
@@ -133,56 +99,46 @@ TEST_P(EventSinkContractTest, AnalyticsRecordsEachEventWithItsProvidersPayloadOn
       {0, "com.norvel.quenta.qnreportingclientuptime", R"({"uptime":12})"},
       {0, "empty", "null"},
   };
-  EXPECT_EQ(sinks_->RecordedAnalytics(), expected);
+  EXPECT_EQ(this->sinks_.Recorded(ReportingSink::kAnalytics), expected);
   EXPECT_EQ(calls.load(), 2);
-  EXPECT_TRUE(sinks_->RecordedPowerLog().empty());
+  EXPECT_TRUE(this->sinks_.Recorded(ReportingSink::kPowerLog).empty());
 }
 
-TEST_P(EventSinkContractTest, PowerLogRecordsSubsystemNameAndPayloadInOrder) {
-  sinks_->enerdex().LogRegisteredEvent(
+TYPED_TEST(EventSinkContractTest, PowerLogRecordsSubsystemNameAndPayloadInOrder) {
+  this->sinks_.enerdex->LogRegisteredEvent(
       28, "Vistrel_Haptics",
       Value(Dictionary{{"EngineOnDuration", 1.5}, {"ApplicationName", "Unknown"}}), Value());
-  sinks_->enerdex().LogRegisteredEvent(
+  this->sinks_.enerdex->LogRegisteredEvent(
       28, "LeakedHapticsSessionInfo", Value(Dictionary{{"Haptic_Active_Hardware_Time_Seconds", 3}}),
       Value());
   std::vector<RecordedEvent> expected = {
       {28, "Vistrel_Haptics", R"({"EngineOnDuration":1.5,"ApplicationName":"Unknown"})"},
       {28, "LeakedHapticsSessionInfo", R"({"Haptic_Active_Hardware_Time_Seconds":3})"},
   };
-  EXPECT_EQ(sinks_->RecordedPowerLog(), expected);
-  EXPECT_TRUE(sinks_->RecordedAnalytics().empty());
+  EXPECT_EQ(this->sinks_.Recorded(ReportingSink::kPowerLog), expected);
+  EXPECT_TRUE(this->sinks_.Recorded(ReportingSink::kAnalytics).empty());
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Sinks, EventSinkContractTest,
-    ::testing::Values(HarnessFactory([] { return std::make_unique<StoreHarness>(); }),
-                      HarnessFactory([] { return std::make_unique<FakeHarness>(); })),
-    [](const auto& info) { return info.index == 0 ? std::string("Store") : std::string("Fake"); });
+// ---- The store's sinks alone ----
 
-TEST(StoreAnalyticsTest, ProviderRunsOffTheCallersThread) {
-  TempDir dir;
-  auto store = OpenStore(dir.File("reports.db"));
-  auto analytics = NewStoreAnalytics(store);
+class StoreSinksTest : public testing::StoreTest {
+ protected:
+  std::shared_ptr<ReportingStore> store_ = OpenStore();
+};
+
+TEST_F(StoreSinksTest, AnalyticsProviderRunsOffTheCallersThread) {
+  auto analytics = NewStoreAnalytics(store_);
   std::thread::id provider_thread;
   analytics->SendEventLazy("e", [&] {
     provider_thread = std::this_thread::get_id();
     return Value();
   });
-  store->Drain();
+  store_->Drain();
   EXPECT_NE(provider_thread, std::thread::id());
   EXPECT_NE(provider_thread, std::this_thread::get_id());
 }
 
-// ---- LivoReporting ----
-
-class StoreLivoReportingTest : public ::testing::Test {
- protected:
-  TempDir dir_;
-  std::string db_path_ = dir_.File("reports.db");
-  std::shared_ptr<ReportingStore> store_ = OpenStore(db_path_);
-};
-
-TEST_F(StoreLivoReportingTest, SessionWithMessagesAndFlushLandsAsRowsInOrder) {
+TEST_F(StoreSinksTest, LivoReportingSessionWithMessagesAndFlushLandsAsRowsInOrder) {
   auto livo = NewStoreLivoReporting(store_);
   auto token = livo->NewSecureHierarchyTokenFromParentToken(nullptr);
   auto token2 = livo->NewSecureHierarchyTokenFromParentToken(token.get());
@@ -250,7 +206,7 @@ TEST_F(StoreLivoReportingTest, SessionWithMessagesAndFlushLandsAsRowsInOrder) {
   EXPECT_EQ(rows[4].payload, R"({"summary":"x"})");
 }
 
-TEST_F(StoreLivoReportingTest, WithoutBackendsDiscoveryAnswersNone) {
+TEST_F(StoreSinksTest, LivoReportingWithoutBackendsDiscoveryAnswersNone) {
   auto livo = NewStoreLivoReporting(store_, StoreLivoReportingOptions{std::nullopt});
   auto session = livo->CreateSession(Dictionary{}, Dictionary{}, Array{});
   std::promise<std::optional<Array>> backends;
@@ -263,7 +219,7 @@ TEST_F(StoreLivoReportingTest, WithoutBackendsDiscoveryAnswersNone) {
   EXPECT_NE(handler_thread, std::this_thread::get_id());
 }
 
-TEST_F(StoreLivoReportingTest, SingleMessagesCarryTheirOwnSessionAndUserInfo) {
+TEST_F(StoreSinksTest, LivoReportingSingleMessagesCarryTheirOwnSessionAndUserInfo) {
   auto livo = NewStoreLivoReporting(store_);
   Dictionary session_info{{kLivoReportingSessionInfoClientType, 19},
                           {kLivoReportingSessionInfoClientVersion, 2.0},
@@ -286,7 +242,7 @@ TEST_F(StoreLivoReportingTest, SingleMessagesCarryTheirOwnSessionAndUserInfo) {
   EXPECT_EQ(rows[0].user_info, R"({"ClientName":"com.norvel.quenta","ServiceName":"standalone"})");
 }
 
-TEST_F(StoreLivoReportingTest, ClosedStoreRefusesMessagesWithAnErrorAndStillAnswersFlushes) {
+TEST_F(StoreSinksTest, LivoReportingClosedStoreRefusesMessagesWithAnErrorAndStillAnswersFlushes) {
   auto livo = NewStoreLivoReporting(store_);
   auto session = livo->CreateSession(Dictionary{}, Dictionary{}, Array{});
   store_->Close();

@@ -3,37 +3,31 @@
 #include <gtest/gtest.h>
 #include <nlohmann/json.hpp>
 
-#include <cstdlib>
-#include <filesystem>
+#include <memory>
 #include <optional>
 #include <string>
 #include <vector>
 
+#include "platform/linux/reporting_store.h"
 #include "platform/linux/reporting_store_reader.h"
+#include "tests/fakes/LogCapture.h"
+#include "tests/fakes/TempDir.h"
 
 namespace qn::testing {
 
-// A fresh directory under the system's temporary folder, removed with its contents.
-class TempDir {
- public:
-  TempDir() {
-    std::string pattern = (std::filesystem::temp_directory_path() / "qn-store-XXXXXX").string();
-    char* made = mkdtemp(pattern.data());
-    EXPECT_NE(made, nullptr);
-    path_ = pattern;
+// A reporting store in a fresh folder, its log captured.
+class StoreTest : public ::testing::Test {
+ protected:
+  std::shared_ptr<ReportingStore> OpenStore(ReportingStore::Options options = {}) {
+    std::optional<Error> error;
+    auto store = ReportingStore::Open(db_path_, log_, options, &error);
+    EXPECT_TRUE(store) << (error ? error->Description() : "");
+    return store;
   }
-  ~TempDir() {
-    std::error_code ignored;
-    std::filesystem::remove_all(path_, ignored);
-  }
-  TempDir(const TempDir&) = delete;
-  TempDir& operator=(const TempDir&) = delete;
 
-  const std::string& path() const { return path_; }
-  std::string File(const std::string& name) const { return path_ + "/" + name; }
-
- private:
-  std::string path_;
+  TempDir dir_;
+  std::string db_path_ = dir_.File("reports.db");
+  std::shared_ptr<LogCapture> log_ = std::make_shared<LogCapture>();
 };
 
 // Every row of `sink` (all sinks when nullopt) in the reader's order; fails the test when

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <chrono>
 #include <memory>
 
 #include "platform/platform.h"
@@ -16,10 +17,12 @@
 #include "tests/fakes/LogCapture.h"
 #include "tests/fakes/TraceRecorder.h"
 
-namespace qn::testing::service {
+namespace qn::testing {
 
-// A Platform of fakes for the service tests. Each test makes its own.
-struct ServiceTestPlatform {
+// A Platform made of fakes, one per platform service, each reachable as its fake type. Each
+// test makes its own (the once-computed internal-build flag is per Platform). Summary files
+// go nowhere until a test points diagnostic_logs_dir at a folder of its own.
+struct FakePlatform {
   std::shared_ptr<LogCapture> log = std::make_shared<LogCapture>();
   std::shared_ptr<TraceRecorder> trace = std::make_shared<TraceRecorder>();
   std::shared_ptr<FakeDispatcher> dispatcher = std::make_shared<FakeDispatcher>();
@@ -34,24 +37,28 @@ struct ServiceTestPlatform {
   std::shared_ptr<FakeOstrel> ostrel = std::make_shared<FakeOstrel>();
   std::shared_ptr<Platform> platform = Make();
 
+  // Queued work holds its session, and the session holds this platform: run what is left
+  // (waits for backends and alarm delays included) so that nothing stays referenced.
+  ~FakePlatform() { dispatcher->AdvanceBy(std::chrono::minutes(2)); }
+
  private:
-  std::shared_ptr<Platform> Make() {
+  std::shared_ptr<Platform> Make() const {
     auto p = std::make_shared<Platform>();
     p->log = log;
     p->trace = trace;
     p->dispatcher = dispatcher;
+    p->notify = notify;
+    p->defaults = defaults;
+    p->process = process;
     p->device_info = device_info;
     p->livo_reporting = livo;
     p->orientation = orientation;
-    p->analytics = analytics;
-    p->enerdex = enerdex;
-    p->process = process;
-    p->notify = notify;
-    p->defaults = defaults;
     p->ostrel = ostrel;
-    p->diagnostic_logs_dir = "/nonexistent/qn-service-tests";  // internal build is off
+    p->enerdex = enerdex;
+    p->analytics = analytics;
+    p->diagnostic_logs_dir = "/nonexistent/qn-tests";
     return p;
   }
 };
 
-}  // namespace qn::testing::service
+}  // namespace qn::testing
