@@ -129,25 +129,22 @@ TYPED_TEST(NotifyContractTest, BadRegistrationsAreRefused) {
   EXPECT_EQ(token, -7);
 }
 
-TEST(LinuxNotifyTest, PostingTouchesAFileThatOtherProcessesSee) {
-  testing::TempDir dir;
-  auto dispatcher = NewLinuxDispatcher();
-  auto queue = dispatcher->CreateSerialQueue("server", QualityOfService::kUserInteractive);
-  auto notify = NewLinuxNotify({.runtime_dir = dir.path(), .log = nullptr});
+using LinuxNotifyTest = NotifyContractTest<LinuxNotifyHarness>;
+
+TEST_F(LinuxNotifyTest, PostingTouchesAFileThatOtherProcessesSee) {
   Deliveries seen;
-  int token = 0;
-  ASSERT_EQ(notify->Register(kName, queue, seen.Handler(queue), &token), 0u);
+  Register(seen);
   // The command-line tool posts without a Notify object, from its own process.
   const pid_t child = ::fork();
-  if (child == 0) ::_exit(PostNotification(dir.path(), kName) == 0 ? 0 : 1);
+  if (child == 0) ::_exit(PostNotification(h_.dir.path(), kName) == 0 ? 0 : 1);
   int status = 0;
   ASSERT_EQ(::waitpid(child, &status, 0), child);
   ASSERT_TRUE(WIFEXITED(status) && WEXITSTATUS(status) == 0);
   ASSERT_TRUE(seen.count.WaitFor(1));
-  EXPECT_TRUE(std::filesystem::is_regular_file(dir.File(std::string("notify/") + kName)));
+  EXPECT_TRUE(std::filesystem::is_regular_file(h_.dir.File(std::string("notify/") + kName)));
 }
 
-TEST(LinuxNotifyTest, NamesCannotLeaveTheFolder) {
+TEST(PostNotificationTest, NamesCannotLeaveTheFolder) {
   testing::TempDir dir;
   for (const std::string& name :
        std::vector<std::string>{"", ".", "..", "../x", "a/b", std::string(300, 'n')}) {
@@ -156,38 +153,27 @@ TEST(LinuxNotifyTest, NamesCannotLeaveTheFolder) {
   EXPECT_FALSE(std::filesystem::exists(dir.File("x")));
 }
 
-TEST(LinuxNotifyTest, PostingWithNobodyWatchingSucceeds) {
+TEST(PostNotificationTest, PostingWithNobodyWatchingSucceeds) {
   testing::TempDir dir;
   EXPECT_EQ(PostNotification(dir.path(), kName), 0u);
   EXPECT_FALSE(std::filesystem::exists(dir.File("notify")));
 }
 
-TEST(LinuxNotifyTest, AFifoUnderTheNameDoesNotHangThePoster) {
-  testing::TempDir dir;
-  auto notify = NewLinuxNotify({.runtime_dir = dir.path(), .log = nullptr});
-  auto dispatcher = NewLinuxDispatcher();
-  int token = 0;
-  ASSERT_EQ(notify->Register(
-                kName, dispatcher->CreateSerialQueue("q", QualityOfService::kUtility), [](int) {},
-                &token),
-            0u);
-  ASSERT_EQ(::mkfifo((dir.path() + "/notify/fifo").c_str(), 0644), 0);
-  EXPECT_EQ(notify->Post("fifo"), kNotifyStatusFailed);
+TEST_F(LinuxNotifyTest, AFifoUnderTheNameDoesNotHangThePoster) {
+  Deliveries seen;
+  Register(seen);
+  ASSERT_EQ(::mkfifo((h_.dir.path() + "/notify/fifo").c_str(), 0644), 0);
+  EXPECT_EQ(h_.notify->Post("fifo"), kNotifyStatusFailed);
 }
 
-TEST(LinuxNotifyTest, WatchSurvivesTheFolderBeingRemoved) {
-  testing::TempDir dir;
-  auto dispatcher = NewLinuxDispatcher();
-  auto queue = dispatcher->CreateSerialQueue("server", QualityOfService::kUserInteractive);
-  auto notify = NewLinuxNotify({.runtime_dir = dir.path(), .log = nullptr});
+TEST_F(LinuxNotifyTest, WatchSurvivesTheFolderBeingRemoved) {
   Deliveries seen;
-  int token = 0;
-  ASSERT_EQ(notify->Register(kName, queue, seen.Handler(queue), &token), 0u);
-  std::filesystem::remove_all(dir.File("notify"));
+  Register(seen);
+  std::filesystem::remove_all(h_.dir.File("notify"));
   // The watch thread puts the folder back; posts made after that are seen.
   const auto give_up = std::chrono::steady_clock::now() + testing::kPatience;
   while (seen.count.value() == 0 && std::chrono::steady_clock::now() < give_up) {
-    notify->Post(kName);
+    h_.notify->Post(kName);
     seen.count.WaitFor(1, std::chrono::milliseconds(20));
   }
   EXPECT_GE(seen.count.value(), 1);
