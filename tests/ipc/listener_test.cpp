@@ -429,6 +429,11 @@ TEST(LinuxIpcTest, PeerThatNeverReadsIsClosedPastTheCap) {
 }
 
 TEST(LinuxIpcTest, AcceptRecoversWhenDescriptorsRunOut) {
+#if defined(__SANITIZE_ADDRESS__)
+  // UBSan's vptr check probes memory through a pipe of its own; with every descriptor in
+  // use it cannot, and reports a false error. The normal and TSan builds run this test.
+  GTEST_SKIP() << "needs free descriptors for the sanitizer runtime";
+#endif
   ListenerHarness harness;
   // Sockets made while descriptors are available, connected once they have run out: the
   // listener's accept then fails with EMFILE until the limit is raised again.
