@@ -7,14 +7,14 @@ namespace qn {
 
 namespace {
 
-std::string Printf(const std::string& spec, auto value) {
+std::string Printf(const std::string& conversion, auto value) {
   char buf[128];
-  int n = std::snprintf(buf, sizeof buf, spec.c_str(), value);
+  int n = std::snprintf(buf, sizeof buf, conversion.c_str(), value);
   if (n < 0) return {};
   if (static_cast<std::size_t>(n) < sizeof buf)
     return std::string(buf, static_cast<std::size_t>(n));
   std::string big(static_cast<std::size_t>(n) + 1, '\0');
-  std::snprintf(big.data(), big.size(), spec.c_str(), value);
+  std::snprintf(big.data(), big.size(), conversion.c_str(), value);
   big.resize(static_cast<std::size_t>(n));
   return big;
 }
