@@ -78,23 +78,4 @@ Paths ResolvePaths(const PathOptions& options) {
   return ResolvePaths(options, PathEnvironment::Current());
 }
 
-std::string MakeDirectories(const std::string& path, mode_t mode) {
-  if (path.empty()) return "empty folder name";
-  std::string prefix;
-  std::size_t start = 0;
-  while (start <= path.size()) {
-    std::size_t slash = path.find('/', start);
-    if (slash == std::string::npos) slash = path.size();
-    prefix = path.substr(0, slash);
-    start = slash + 1;
-    if (prefix.empty() || prefix == "." || prefix == "..") continue;
-    if (mkdir(prefix.c_str(), mode) == 0) continue;
-    const int error = errno;
-    struct stat info;
-    if (error == EEXIST && stat(prefix.c_str(), &info) == 0 && S_ISDIR(info.st_mode)) continue;
-    return "cannot create folder " + prefix + ": " + std::strerror(error);
-  }
-  return {};
-}
-
 }  // namespace qn

@@ -44,8 +44,4 @@ struct PathEnvironment {
 Paths ResolvePaths(const PathOptions& options, const PathEnvironment& environment);
 Paths ResolvePaths(const PathOptions& options);
 
-// Creates `path` and any missing parents with `mode` (existing folders are left as they
-// are). Returns an empty string on success, else a description of what failed.
-std::string MakeDirectories(const std::string& path, mode_t mode);
-
 }  // namespace qn

@@ -24,6 +24,7 @@
 
 #include "Statistics/Service/QNReportingServiceDelegate.h"
 #include "Statistics/Service/QNReportingSession.h"
+#include "common/Files.h"
 #include "common/Paths.h"
 #include "platform/linux/linux_defaults.h"
 #include "platform/linux/linux_device_info.h"
@@ -194,8 +195,9 @@ int Run(const Options& options) {
   for (const auto& [dir, mode] :
        {std::pair{paths.runtime_dir, mode_t{0755}}, std::pair{paths.state_dir, mode_t{0750}},
         std::pair{paths.log_dir, mode_t{0750}}}) {
-    if (std::string failure = MakeDirectories(dir, mode); !failure.empty()) {
-      std::fprintf(stderr, "%s: cannot create %s: %s\n", kProgram, dir.c_str(), failure.c_str());
+    if (auto failure = CreateDirectories(dir, mode)) {
+      std::fprintf(stderr, "%s: cannot create %s: %s\n", kProgram, dir.c_str(),
+                   failure->Description().c_str());
       return 1;
     }
   }

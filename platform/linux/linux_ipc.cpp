@@ -15,6 +15,7 @@
 #include <unordered_map>
 #include <utility>
 
+#include "common/Files.h"
 #include "common/Frame.h"
 #include "common/MsgPack.h"
 #include "common/Paths.h"
@@ -109,9 +110,8 @@ ListeningSocket BindPath(const std::string& path) {
   }
   const auto slash = path.rfind('/');
   if (slash != std::string::npos && slash > 0) {
-    std::string problem = MakeDirectories(path.substr(0, slash), 0755);
-    if (!problem.empty()) {
-      result.error = problem;
+    if (auto problem = CreateDirectories(path.substr(0, slash), 0755)) {
+      result.error = problem->Description();
       return result;
     }
   }

@@ -61,23 +61,5 @@ TEST(PathsTest, SocketOptionOverridesOnlyTheSocket) {
   EXPECT_EQ(paths.runtime_dir, "/h/run");
 }
 
-TEST(PathsTest, MakeDirectoriesCreatesParentsAndAcceptsExistingOnes) {
-  testing::TempDir dir;
-  const std::string deep = dir.path() + "/a/b/c";
-  EXPECT_EQ(MakeDirectories(deep, 0755), "");
-  struct stat info;
-  ASSERT_EQ(::stat(deep.c_str(), &info), 0);
-  EXPECT_TRUE(S_ISDIR(info.st_mode));
-  EXPECT_EQ(MakeDirectories(deep, 0755), "");
-
-  // A file in the way is an error that names it.
-  const std::string file = dir.path() + "/a/file";
-  FILE* f = std::fopen(file.c_str(), "w");
-  ASSERT_TRUE(f);
-  std::fclose(f);
-  const std::string problem = MakeDirectories(file + "/d", 0755);
-  EXPECT_NE(problem.find(file), std::string::npos) << problem;
-}
-
 }  // namespace
 }  // namespace qn
