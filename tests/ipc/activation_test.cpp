@@ -27,15 +27,6 @@ int InChild(const std::function<int()>& body) {
   return WIFEXITED(status) ? WEXITSTATUS(status) : 100 + WTERMSIG(status);
 }
 
-int UnixSocket(int type, const std::string& path) {
-  int fd = ::socket(AF_UNIX, type | SOCK_CLOEXEC, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-  if (::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) return -1;
-  return fd;
-}
-
 // Puts `fd` at SD_LISTEN_FDS_START (3) as systemd would, with LISTEN_FDS / LISTEN_PID.
 bool PassAsActivated(int fd) {
   if (::dup2(fd, 3) != 3) return false;
@@ -49,10 +40,10 @@ TEST(LinuxIpcActivationTest, TakesTheSocketSystemdPassesAndNotifiesReadiness) {
   const std::string activated = dir.path() + "/activated.sock";
   const std::string notify = dir.path() + "/notify.sock";
   const int status = InChild([&]() -> int {
-    int listening = UnixSocket(SOCK_STREAM, activated);
+    int listening = BindUnixSocket(SOCK_STREAM, activated);
     if (listening < 0 || ::listen(listening, 8) != 0) return 1;
     if (!PassAsActivated(listening)) return 2;
-    int notifications = UnixSocket(SOCK_DGRAM, notify);
+    int notifications = BindUnixSocket(SOCK_DGRAM, notify);
     if (notifications < 0) return 3;
     ::setenv("NOTIFY_SOCKET", notify.c_str(), 1);
 
@@ -84,7 +75,7 @@ TEST(LinuxIpcActivationTest, PassedSocketThatDoesNotListenIsRefused) {
   TempDir dir;
   const std::string path = dir.path() + "/datagram.sock";
   const int status = InChild([&]() -> int {
-    int datagram = UnixSocket(SOCK_DGRAM, path);
+    int datagram = BindUnixSocket(SOCK_DGRAM, path);
     if (datagram < 0 || !PassAsActivated(datagram)) return 1;
     LinuxIpcOptions options;
     options.socket_path = dir.path() + "/fallback.sock";

@@ -112,6 +112,10 @@ class ListenerHarness {
 };
 
 // A plain blocking socket for bytes a well-behaved client would never send.
+// A Unix socket of `type` (SOCK_STREAM, ...) bound to `path`: its descriptor, or -1 (nothing
+// left open) when binding fails. The caller closes it.
+int BindUnixSocket(int type, const std::string& path);
+
 class RawSocket {
  public:
   // Creates a socket and, when `path` is not empty, connects it.

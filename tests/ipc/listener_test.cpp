@@ -466,15 +466,10 @@ TEST(LinuxIpcTest, AcceptRecoversWhenDescriptorsRunOut) {
 TEST(LinuxIpcListenerSetupTest, StaleSocketFileIsReplaced) {
   TempDir dir;
   const std::string path = dir.path() + "/reporting.sock";
-  {
-    // A socket file whose listener is gone (closed without unlinking).
-    int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-    sockaddr_un address{};
-    address.sun_family = AF_UNIX;
-    std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-    ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
-    ::close(fd);
-  }
+  // A socket file whose listener is gone (closed without unlinking).
+  const int stale = BindUnixSocket(SOCK_STREAM, path);
+  ASSERT_GE(stale, 0);
+  ::close(stale);
   auto log = std::make_shared<LogCapture>();
   auto made = NewLinuxIpcListener(Options(path), log);
   ASSERT_TRUE(made.listener) << made.error;
@@ -490,11 +485,8 @@ TEST(LinuxIpcListenerSetupTest, LiveListenerIsNotReplaced) {
   TempDir dir;
   const std::string path = dir.path() + "/reporting.sock";
   // Something else (no lock file of ours) listens on the path.
-  int fd = ::socket(AF_UNIX, SOCK_STREAM, 0);
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-  ASSERT_EQ(::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
+  const int fd = BindUnixSocket(SOCK_STREAM, path);
+  ASSERT_GE(fd, 0);
   ASSERT_EQ(::listen(fd, 4), 0);
 
   auto made = NewLinuxIpcListener(Options(path), std::make_shared<LogCapture>());
