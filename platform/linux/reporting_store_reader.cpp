@@ -25,13 +25,18 @@ Error ReadError(sqlite3* db, int rc, const std::string& what) {
                what + ": " + (db ? sqlite3_errmsg(db) : sqlite3_errstr(rc))};
 }
 
-// The query of each table, in Table order. Columns are read by ReadRow.
+// The query of each table, in Table order. Columns are read by ReadRow; the parameters are
+// ?1 the last id seen, ?2 the earliest time, ?3 the framework session (NULL: any).
 constexpr std::array<const char*, 4> kQueries = {
-    "SELECT id, created, flushed, session_info, user_info FROM livo_sessions ORDER BY id",
+    "SELECT id, created, flushed, session_info, user_info FROM livo_sessions "
+    "WHERE id > ?1 AND created >= ?2 AND (?3 IS NULL OR id = ?3) ORDER BY id",
     "SELECT id, time, session, category, type, payload, session_info, user_info "
-    "FROM livo_messages ORDER BY id",
-    "SELECT id, time, name, payload FROM analytics_events ORDER BY id",
-    "SELECT id, time, subsystem, name, payload FROM powerlog_events ORDER BY id",
+    "FROM livo_messages WHERE id > ?1 AND time >= ?2 AND (?3 IS NULL OR session = ?3) "
+    "ORDER BY id",
+    "SELECT id, time, name, payload FROM analytics_events "
+    "WHERE id > ?1 AND time >= ?2 AND ?3 IS NULL ORDER BY id",
+    "SELECT id, time, subsystem, name, payload FROM powerlog_events "
+    "WHERE id > ?1 AND time >= ?2 AND ?3 IS NULL ORDER BY id",
 };
 
 std::string Text(sqlite3_stmt* stmt, int column) {
@@ -140,6 +145,11 @@ const char* ReportingStoreRow::table_name() const {
   return "livo_messages";
 }
 
+void ReportingRowFilter::Advance(const ReportingStoreRow& row) {
+  std::int64_t& last = after[static_cast<std::size_t>(row.table)];
+  if (row.id > last) last = row.id;
+}
+
 void ReportingStoreReader::Closer::operator()(sqlite3* db) const { sqlite3_close_v2(db); }
 
 ReportingStoreReader::ReportingStoreReader(Connection db) : db_(std::move(db)) {}
@@ -163,7 +173,7 @@ std::unique_ptr<ReportingStoreReader> ReportingStoreReader::Open(const std::stri
   return std::make_unique<ReportingStoreReader>(std::move(db));
 }
 
-std::optional<Error> ReportingStoreReader::ForEachRow(std::optional<ReportingSink> sink,
+std::optional<Error> ReportingStoreReader::ForEachRow(const ReportingRowFilter& filter,
                                                       const Visitor& visit) {
   sqlite3* db = db_.get();
   // One read transaction: every table is read from the same snapshot.
@@ -177,11 +187,14 @@ std::optional<Error> ReportingStoreReader::ForEachRow(std::optional<ReportingSin
   std::vector<Cursor> cursors;
   for (Table table :
        {Table::kLivoSession, Table::kLivoMessage, Table::kAnalyticsEvent, Table::kPowerLogEvent}) {
-    if (sink && !SinkHasTable(*sink, table)) continue;
+    if (filter.sink && !SinkHasTable(*filter.sink, table)) continue;
     sqlite3_stmt* raw = nullptr;
     rc = sqlite3_prepare_v2(db, kQueries[static_cast<std::size_t>(table)], -1, &raw, nullptr);
     Statement stmt(raw);
     if (rc != SQLITE_OK) return ReadError(db, rc, "query");
+    sqlite3_bind_int64(raw, 1, filter.after[static_cast<std::size_t>(table)]);
+    sqlite3_bind_double(raw, 2, filter.since.value_or(-1e300));
+    if (filter.session) sqlite3_bind_int64(raw, 3, *filter.session);
     cursors.push_back(Cursor{table, std::move(stmt), std::nullopt});
   }
 

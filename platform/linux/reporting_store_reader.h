@@ -65,6 +65,19 @@ struct ReportingStoreRow {
   const char* table_name() const;
 };
 
+// Which rows ForEachRow visits. Every condition set must hold.
+struct ReportingRowFilter {
+  std::optional<ReportingSink> sink;    // only this sink's tables
+  std::optional<double> since;          // only rows at or after this time (seconds)
+  std::optional<std::int64_t> session;  // only this framework session's row and messages
+  // Only rows past these ids, one per table in Table order: for following a store as it
+  // grows, pass the ids of the last rows seen (Advance keeps them).
+  std::int64_t after[4] = {0, 0, 0, 0};
+
+  // Notes `row` as seen, so that the next read starts after it.
+  void Advance(const ReportingStoreRow& row);
+};
+
 // A read-only connection to the store's database. It never writes and never blocks the
 // store's writer (WAL readers do not lock writers out). Not thread-safe: use one reader
 // per thread.
@@ -79,12 +92,18 @@ class ReportingStoreReader {
 
   using Visitor = std::function<bool(const ReportingStoreRow&)>;
 
-  // Calls `visit` for each row of `sink` (all sinks when nullopt), from one consistent
+  // Calls `visit` for each row that `filter` lets through (of `sink`: all sinks when
+  // nullopt), from one consistent
   // snapshot of the database: each table in id order, the tables merged by time (at equal
   // times sessions come first, then messages, analytics and power-log rows). Stops early
   // when `visit` returns false. Returns the error when reading failed (rows visited before
   // it stay visited).
-  std::optional<Error> ForEachRow(std::optional<ReportingSink> sink, const Visitor& visit);
+  std::optional<Error> ForEachRow(const ReportingRowFilter& filter, const Visitor& visit);
+  std::optional<Error> ForEachRow(std::optional<ReportingSink> sink, const Visitor& visit) {
+    ReportingRowFilter filter;
+    filter.sink = sink;
+    return ForEachRow(filter, visit);
+  }
 
   struct Closer {
     void operator()(sqlite3* db) const;

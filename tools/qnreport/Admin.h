@@ -1,31 +1,48 @@
 #pragma once
 
-#include <iosfwd>
+#include <cstdint>
+#include <optional>
+#include <ostream>
 #include <string>
-#include <vector>
 
 #include "common/Paths.h"
+#include "platform/linux/reporting_store_reader.h"
 
 namespace qn::qnreport {
 
 // The administration commands, which work on the daemon's folders directly and need no
-// connection. Each takes the words after its command word, writes its output to `out` and
-// its complaints to `err`, and returns the process exit status (0 success, 1 failure,
-// 2 usage error).
+// connection. Each writes its output to `out` and its complaints to `err`, and returns
+// the process exit status (0 success, 1 failure). Arguments arrive checked by the
+// command line.
 
-// defaults write KEY VALUE | delete KEY | read: the daemon's defaults suite
-// ("com.norvel.quenta"). VALUE is read as JSON when it is JSON (true, 0, "text", {...}),
+// defaults read: the daemon's defaults suite ("com.norvel.quenta") as pretty JSON.
+int RunDefaultsRead(const Paths& paths, std::ostream& out, std::ostream& err);
+// defaults write KEY VALUE: VALUE is read as JSON when it is JSON (true, 0, "text", {...}),
 // else as a plain string (YES).
-int RunDefaults(const Paths& paths, const std::vector<std::string>& args, std::ostream& out,
-                std::ostream& err);
-
+int RunDefaultsWrite(const Paths& paths, const std::string& key, const std::string& value,
+                     std::ostream& err);
+// defaults delete KEY (deleting a key that is not there succeeds).
+int RunDefaultsDelete(const Paths& paths, const std::string& key, std::ostream& err);
 // notify post NAME: posts a system-wide notification to every process watching it.
-int RunNotify(const Paths& paths, const std::vector<std::string>& args, std::ostream& out,
+int RunNotifyPost(const Paths& paths, const std::string& name, std::ostream& err);
+
+struct EventsOptions {
+  ReportingRowFilter filter;
+  bool json = false;    // one JSON object per row instead of aligned columns
+  bool follow = false;  // after the rows there are, print new ones as they arrive
+};
+// events: the rows of the reporting store, oldest first, one per line. With `follow` it
+// returns only when `out` fails (the reader went away).
+int RunEvents(const Paths& paths, const EventsOptions& options, std::ostream& out,
               std::ostream& err);
 
-// events [--sink reporting|analytics|powerlog] [--json]: the rows of the reporting store,
-// oldest first, one per line (a JSON object per line with --json).
-int RunEvents(const Paths& paths, const std::vector<std::string>& args, std::ostream& out,
-              std::ostream& err);
+// session N: one framework session's story: start and stop, message counts by category and
+// type, the summary event, the driver-statistics change and the summary file.
+int RunSession(const Paths& paths, std::int64_t session, std::ostream& out, std::ostream& err);
+
+// A time given on the command line: "2026-11-21 13:05[:SS]", "2026-11-21", "13:05[:SS]"
+// (today), "-90s" / "-15m" / "-2h" / "-1d" (before `now`), or seconds since the epoch.
+// Local time. Returns nullopt when the text is none of these.
+std::optional<double> ParseTimeArgument(const std::string& text, double now);
 
 }  // namespace qn::qnreport
