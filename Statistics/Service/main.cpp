@@ -22,6 +22,8 @@
 #include <utility>
 #include <vector>
 
+#include <CLI/CLI.hpp>
+
 #include "Statistics/Service/QNReportingServiceDelegate.h"
 #include "Statistics/Service/QNReportingSession.h"
 #include "common/Files.h"
@@ -55,34 +57,18 @@ constexpr auto kSessionDrainTimeout = std::chrono::seconds(12);
 // How long it waits for the server queue to run the connection-end steps.
 constexpr auto kServerQueueDrainTimeout = std::chrono::seconds(30);
 
-constexpr const char* kUsage =
-    R"(Usage: qnreportingd [OPTIONS]
+constexpr const char* kDescription =
+    "The quenta reporting daemon. Audio clients connect to it over a Unix socket (through\n"
+    "libqnreporting or the qnreport tool) to open reporting sessions, send messages and stop\n"
+    "them; the daemon aggregates each session, sends a summary when it stops and hands\n"
+    "everything to its reporting store (SQLite), its analytics sink and its power log. Under\n"
+    "systemd it is started on demand by qnreportingd.socket.";
 
-The quenta reporting daemon. Audio clients connect to it over a Unix socket (through
-libqnreporting or the qnreport tool) to open reporting sessions, send messages and stop
-them; the daemon aggregates each session, sends a summary when it stops and hands
-everything to its reporting store (SQLite), its analytics sink and its power log. Under
-systemd it is started on demand by qnreportingd.socket.
-
-Options:
-  --home DIR           keep everything under DIR: the socket and notifications in
-                       DIR/run, the store and the defaults in DIR/state, summary files
-                       in DIR/log
-  --socket PATH        listen on PATH instead of <runtime>/reporting.sock (ignored when
-                       systemd passes a listening socket)
-  --internal-build     behave as on an internal build (summary files, orientation)
-  --device-info FILE   device answers as a JSON object (default
-                       /etc/quenta/device-info.json)
-  --driver-stats DIR   driver statistics counters: DIR/<group>/<subgroup>/<channel>
-                       files holding one integer (default <runtime>/driver-stats)
-  --debug SCOPES       write debug lines of these log scopes: "qnrs" (service),
-                       "qnrr" (sessions), "qnrd" (driver statistics), separated by
-                       commas, or "all"
-  --help               show this text and exit
-  --version            show the version and exit
-
-Folders without --home: root uses /run/quenta, /var/lib/quenta and /var/log/quenta;
-other users $XDG_RUNTIME_DIR/quenta, $XDG_STATE_HOME/quenta and <state>/log.
+constexpr const char* kFooter = R"(
+Folders: with --home DIR, DIR/run (socket, notifications), DIR/state (store, defaults) and
+DIR/log (summary files). Without --home root uses /run/quenta, /var/lib/quenta and
+/var/log/quenta; other users $XDG_RUNTIME_DIR/quenta, $XDG_STATE_HOME/quenta and
+<state>/log.
 Files: <state>/reports.db (the store), <state>/defaults/com.norvel.quenta.json (the
 defaults), <log>/DiagnosticLogs/Audio/Reporting (summary files, internal builds).
 
@@ -94,7 +80,7 @@ Talking to it:
 
 Signals: SIGHUP re-reads the defaults; SIGTERM and SIGINT close the socket, stop every
 client's sessions, write out the store and exit with status 0. A client's killService
-request ends the daemon with status 2.
+request ends the daemon with status 2. See qnreportingd(8).
 )";
 
 struct Options {
@@ -105,71 +91,67 @@ struct Options {
   std::string debug_scopes;
 };
 
-enum class ParseOutcome { kRun, kHelp, kVersion, kError };
+// A CLI11 check that a value is not empty.
+const CLI::Validator kNotEmpty(
+    [](std::string& text) { return text.empty() ? std::string("needs a non-empty value") : ""; },
+    "");
 
-// Parses the command line into `options`; `error` explains a kError.
-ParseOutcome ParseArguments(int argc, char** argv, Options& options, std::string& error) {
-  for (int i = 1; i < argc; ++i) {
-    std::string_view arg = argv[i];
-    std::optional<std::string> inline_value;
-    if (arg.starts_with("--")) {
-      if (auto eq = arg.find('='); eq != std::string_view::npos) {
-        inline_value = std::string(arg.substr(eq + 1));
-        arg = arg.substr(0, eq);
+// The log scopes --debug names, separated by commas.
+const CLI::Validator kDebugScopes(
+    [](std::string& text) {
+      std::string_view rest = text;
+      while (!rest.empty()) {
+        const std::string_view scope = rest.substr(0, rest.find(','));
+        if (scope != "qnrs" && scope != "qnrr" && scope != "qnrd" && scope != "all") {
+          return "unknown log scope \"" + std::string(scope) + "\" (qnrs, qnrr, qnrd or all)";
+        }
+        rest.remove_prefix(std::min(rest.size(), scope.size() + 1));
       }
-    }
-    auto value = [&](std::string& out) {
-      if (inline_value) {
-        out = *inline_value;
-      } else if (i + 1 < argc) {
-        out = argv[++i];
-      } else {
-        error = std::string(arg) + " needs a value";
-        return false;
-      }
-      if (out.empty()) {
-        error = std::string(arg) + " needs a non-empty value";
-        return false;
-      }
-      return true;
-    };
-    auto no_value = [&] {
-      if (!inline_value) return true;
-      error = std::string(arg) + " takes no value";
-      return false;
-    };
+      return std::string();
+    },
+    "");
 
-    std::string text;
-    if (arg == "--help" || arg == "-h") {
-      if (!no_value()) return ParseOutcome::kError;
-      return ParseOutcome::kHelp;
-    } else if (arg == "--version") {
-      if (!no_value()) return ParseOutcome::kError;
-      return ParseOutcome::kVersion;
-    } else if (arg == "--home") {
-      if (!value(text)) return ParseOutcome::kError;
-      options.paths.home = text;
-    } else if (arg == "--socket") {
-      if (!value(text)) return ParseOutcome::kError;
-      options.paths.socket = text;
-    } else if (arg == "--internal-build") {
-      if (!no_value()) return ParseOutcome::kError;
-      options.internal_build = true;
-    } else if (arg == "--device-info") {
-      if (!value(text)) return ParseOutcome::kError;
-      options.device_info = text;
-    } else if (arg == "--driver-stats") {
-      if (!value(text)) return ParseOutcome::kError;
-      options.driver_stats = text;
-    } else if (arg == "--debug") {
-      if (!value(text)) return ParseOutcome::kError;
-      options.debug_scopes = text;
-    } else {
-      error = "unknown argument: " + std::string(argv[i]);
-      return ParseOutcome::kError;
-    }
+// The command line. Returns the exit status when the program should end now (help,
+// version, a usage error), nullopt when it should run with `options`.
+std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
+  CLI::App app(kDescription, kProgram);
+  app.footer(kFooter);
+  app.set_help_flag("-h,--help", "Show this text and exit");
+  app.set_version_flag("--version", std::string(kProgram) + " " + QN_VERSION,
+                       "Show the version and exit");
+  app.add_option("--home", options.paths.home,
+                 "Keep the socket, store, defaults and logs under DIR")
+      ->type_name("DIR")
+      ->check(kNotEmpty);
+  app.add_option("--socket", options.paths.socket,
+                 "Listen on PATH (unless systemd passes a socket)")
+      ->type_name("PATH")
+      ->check(kNotEmpty);
+  app.add_flag("--internal-build", options.internal_build,
+               "Behave as an internal build: write summary files")
+      ->disable_flag_override();
+  app.add_option("--device-info", options.device_info, "Device answers, a JSON object")
+      ->type_name("FILE")
+      ->default_str(kDefaultDeviceInfo)
+      ->check(kNotEmpty);
+  app.add_option("--driver-stats", options.driver_stats,
+                 "Driver counters: DIR/group/subgroup/channel")
+      ->type_name("DIR")
+      ->default_str("<runtime>/driver-stats")
+      ->check(kNotEmpty);
+  app.add_option("--debug", options.debug_scopes, "Debug lines of qnrs, qnrr, qnrd (commas) or all")
+      ->type_name("SCOPES")
+      ->check(kNotEmpty)
+      ->check(kDebugScopes);
+  try {
+    app.parse(argc, argv);
+  } catch (const CLI::ParseError& e) {
+    if (e.get_exit_code() == 0) return app.exit(e);
+    std::fprintf(stderr, "%s: %s\nTry 'qnreportingd --help' for more information.\n", kProgram,
+                 e.what());
+    return 2;
   }
-  return ParseOutcome::kRun;
+  return std::nullopt;
 }
 
 // The signals the daemon handles, blocked in every thread and taken by one waiting thread.
@@ -312,20 +294,6 @@ int main(int argc, char** argv) {
   pthread_sigmask(SIG_BLOCK, &handled, nullptr);
 
   qn::Options options;
-  std::string error;
-  switch (qn::ParseArguments(argc, argv, options, error)) {
-    case qn::ParseOutcome::kHelp:
-      std::fputs(qn::kUsage, stdout);
-      return 0;
-    case qn::ParseOutcome::kVersion:
-      std::printf("%s %s\n", qn::kProgram, QN_VERSION);
-      return 0;
-    case qn::ParseOutcome::kError:
-      std::fprintf(stderr, "%s: %s\nTry 'qnreportingd --help' for more information.\n",
-                   qn::kProgram, error.c_str());
-      return 2;
-    case qn::ParseOutcome::kRun:
-      break;
-  }
+  if (auto status = qn::ParseCommandLine(argc, argv, options)) return *status;
   return qn::Run(options);
 }

@@ -62,6 +62,8 @@ At the end of input the shell waits for pending replies (up to --timeout) and, a
 )";
 
 constexpr const char* kFooter = R"(
+The socket is DIR/run/reporting.sock with --home DIR, else /run/quenta/reporting.sock
+for root and $XDG_RUNTIME_DIR/quenta/reporting.sock for other users.
 Run `qnreport COMMAND --help` for one command; `man qnreport` has the whole story.
 Exit status: 0 when every expected reply arrived, 1 when the daemon could not be reached
 or a reply did not come in time (or an admin command failed), 2 for usage errors.
@@ -84,7 +86,7 @@ const std::vector<Operation>& Operations() {
        "Set a session's service type",
        {{"ID", "reporter ID"}, {"SERVICE_TYPE", "16-bit service type (65535: unknown)"}}},
       {"name",
-       "Print a session's service type (65535 when there is none)",
+       "Print a session's service type (65535: none)",
        {{"ID", "reporter ID; the daemon replies twice for 0"}}},
       {"config",
        "Set a session's configuration",
@@ -101,12 +103,12 @@ const std::vector<Operation>& Operations() {
        {{"JSON", "the payload, a JSON object"},
         {"CATEGORY", "32-bit category"},
         {"TYPE", "16-bit type"},
-        {"IDS", "reporter IDs separated by commas; none: every started session"}},
+        {"IDS", "reporter IDs, comma-separated (none: every session)"}},
        true},
       {"stop", "Stop a session: its summary is sent", {{"ID", "reporter ID"}}},
       {"destroy", "Destroy a session", {{"ID", "reporter ID"}}},
       {"valid",
-       "Print a session's reporter ID and service type (reporter ID 0: no such session)",
+       "Print a session's reporter ID (0: none) and service type",
        {{"ID", "reporter ID"}}},
       {"reporters", "Print the reporter IDs of every session of every client", {}},
       {"kill", "Ask the daemon to exit (status 2) and wait until it has", {}},
@@ -133,10 +135,8 @@ struct Connection {
 
 int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream& out,
                    std::ostream& err) {
-  CLI::App app(
-      "Talks to the quenta reporting daemon (qnreportingd) over its Unix socket, and "
-      "reads what it stored.",
-      "qnreport");
+  CLI::App app("Talks to the quenta reporting daemon (qnreportingd) and reads what it stored.",
+               "qnreport");
   app.set_help_flag("-h,--help", "Show this text; `qnreport COMMAND --help` describes one");
   app.set_version_flag("--version", std::string("qnreport ") + QN_VERSION, "Show the version");
   app.require_subcommand(0, 1);  // none: told below, with the list of commands
@@ -145,12 +145,8 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
 
   PathOptions paths;
   double timeout_seconds = 10;
-  app.add_option("--home", paths.home,
-                 "The daemon's folders are under DIR (socket: DIR/run/reporting.sock)")
-      ->type_name("DIR");
-  app.add_option("--socket", paths.socket,
-                 "The daemon's socket (root: /run/quenta/reporting.sock, others: "
-                 "$XDG_RUNTIME_DIR/quenta/reporting.sock)")
+  app.add_option("--home", paths.home, "The daemon runs with --home DIR")->type_name("DIR");
+  app.add_option("--socket", paths.socket, "The daemon's socket (default: see below)")
       ->type_name("PATH");
   app.add_option("--timeout", timeout_seconds, "How long to wait for replies")
       ->type_name("SECONDS")
@@ -176,7 +172,7 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
     operations.emplace_back(sub, &op);
   }
   CLI::App* shell = app.add_subcommand(
-      "shell", "Run operations read from stdin, one per line, on one connection");
+      "shell", "Run operations from stdin, one per line, on one connection");
   shell->footer(kShellDetails);
 
   // Administration: the daemon's folders, no connection.
@@ -212,23 +208,21 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
   CLI::App* events = app.add_subcommand("events", "Show what the reporting store holds");
   events->footer(
       "\nRows come oldest first, one per line, in aligned columns: framework sessions and their\n"
-      "messages, single messages, analytics and power-log events.\n");
+      "messages, single messages, analytics and power-log events.\n"
+      "TIME is \"2026-11-21 13:05[:SS]\", \"2026-11-21\", \"13:05\" (today), \"-15m\", \"-2h\",\n"
+      "\"-1d\" (before now) or seconds since the epoch, in local time.\n");
   events->add_option("--sink", sink, "Only one sink's rows")
       ->check(CLI::IsMember({"reporting", "analytics", "powerlog"}));
   events->add_flag("--json", events_options.json, "Each row as a JSON object");
   events->add_flag("-f,--follow", events_options.follow,
-                   "After the rows there are, print new rows as they arrive (Ctrl-C ends)");
-  events
-      ->add_option("--since", since,
-                   "Only rows from TIME on: \"2026-11-21 13:05[:SS]\", \"2026-11-21\", "
-                   "\"13:05\" (today), \"-15m\", \"-2h\", \"-1d\" or Unix seconds")
+                   "Then print new rows as they arrive (Ctrl-C ends)");
+  events->add_option("--since", since, "Only rows from TIME on (see below)")
       ->type_name("TIME")
       ->check(Check("is not a time (try \"-15m\" or \"2026-11-21 13:05\")",
                     [](const std::string& t) { return ParseTimeArgument(t, 0).has_value(); }));
   events
       ->add_option("--session", events_options.filter.session,
-                   "Only this framework session's row and messages (its number in the "
-                   "SESSION column)")
+                   "Only framework session N (SESSION column)")
       ->type_name("N");
 
   std::int64_t session_number = 0;
