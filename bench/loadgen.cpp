@@ -8,6 +8,9 @@
 //           sendMessage requests in flight until it has sent M messages, then stops and
 //           destroys its sessions. Payloads are realistic: 8 keys, about 200 bytes.
 // valid:    each client keeps W reporterID:valid: requests in flight, M in all.
+// idle:     each client opens S sessions and holds them while the daemon's RSS is read.
+// first:    one reporterID:valid: on a new connection, timed from before connect() to the
+//           reply: against a socket-activated daemon, its start-up to first reply.
 // pingpong: the reference: a raw Unix-socket echo of the same frame sizes between this
 //           process and a forked child, one at a time (no daemon involved).
 //
@@ -201,6 +204,10 @@ std::int64_t StoredMessages(const std::string& db_path) {
   return count;
 }
 
+// --op idle: clients that have opened their sessions, and the signal to close them.
+std::atomic<int> idle_clients_ready{0};
+std::atomic<bool> idle_release{false};
+
 // --- one client ----------------------------------------------------------------------------
 
 qn::Value Payload(int client, long n) {
@@ -282,6 +289,14 @@ void RunClient(const Options& options, int index, ClientResult& result) {
   }
   // create and type reply at once; each start replies when its session stops.
   Exchange(fd, setup, 2L * options.sessions, next_id);
+  if (options.op == "idle") {  // every session open and started; the main thread measures
+    result.replies += options.messages;
+    idle_clients_ready.fetch_add(1);
+    while (!idle_release) std::this_thread::sleep_for(std::chrono::milliseconds(5));
+    Exchange(fd, teardown, 3L * options.sessions, next_id);
+    ::close(fd);
+    return;
+  }
   const long per_session = options.messages / options.sessions;
   for (int s = 0; s < options.sessions; ++s) {
     qn::Array targets{qn::Value(ids[s])};
@@ -354,8 +369,8 @@ int main(int argc, char** argv) {
   app.add_option("--socket", options.socket, "The daemon's socket");
   app.add_option("--home", options.home, "The daemon's --home (socket and store found there)");
   app.add_option("--daemon", options.daemon, "Start this daemon binary under a temporary home");
-  app.add_option("--op", options.op, "send, valid or pingpong")
-      ->check(CLI::IsMember({"send", "valid", "pingpong"}));
+  app.add_option("--op", options.op, "send, valid, pingpong, idle or first")
+      ->check(CLI::IsMember({"send", "valid", "pingpong", "idle", "first"}));
   app.add_option("--clients", options.clients, "Clients (connections)")->check(CLI::Range(1, 64));
   app.add_option("--sessions", options.sessions, "Sessions per client")->check(CLI::Range(1, 4096));
   app.add_option("--messages", options.messages, "Requests per client")->check(CLI::PositiveNumber);
@@ -381,6 +396,18 @@ int main(int argc, char** argv) {
   }
   const std::string db = options.home.empty() ? "" : options.home + "/state/reports.db";
 
+  if (options.op == "first") {
+    const auto begin = Clock::now();
+    const int fd = ConnectUnix(options.socket);
+    std::uint32_t id = 1;
+    Exchange(fd, {RequestTemplate(9, {qn::Value(std::int64_t{1})})}, 1, id);
+    const double us = std::chrono::duration<double, std::micro>(Clock::now() - begin).count();
+    std::printf(options.json ? "{\"op\":\"first\",\"first_reply_us\":%.0f}\n"
+                             : "first: reply %.0f us after connect\n",
+                us);
+    ::close(fd);
+    return 0;
+  }
   pid_t daemon = 0;
   ProcessUsage before;
   std::int64_t stored_before = 0;
@@ -409,6 +436,16 @@ int main(int argc, char** argv) {
     std::vector<std::thread> threads;
     for (int c = 0; c < options.clients; ++c) {
       threads.emplace_back([&, c] { RunClient(options, c, results[static_cast<std::size_t>(c)]); });
+    }
+    if (options.op == "idle") {
+      while (idle_clients_ready < options.clients) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(5));
+      }
+      std::this_thread::sleep_for(std::chrono::milliseconds(200));
+      const auto idle = Usage(daemon);
+      std::printf("idle: %d client(s) x %d session(s) open: daemon RSS %.1f MiB\n", options.clients,
+                  options.sessions, idle.rss_kib / 1024.0);
+      idle_release = true;
     }
     for (auto& t : threads) t.join();
   }

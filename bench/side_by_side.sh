@@ -4,6 +4,8 @@
 #   - sendMessage, 1 client, window 64     vs Redis XADD -c 1 -P 64 (200-byte values)
 #   - sendMessage, 8 clients, window 64    vs Redis XADD -c 8 -P 64
 #   - daemon CPU per durable message       vs Redis XADD CPU with appendfsync everysec
+# and on its own: socket-activated start to first reply (through systemd-socket-activate)
+# and the daemon's RSS with 1,000 idle sessions.
 # Medians of ROUNDS rounds (default 3). Needs a default build (bench_loadgen, qnreportingd)
 # and Debian's redis-server + redis-tools (installed when missing).
 #   bench/side_by_side.sh [--rounds N] [--json FILE]   (FILE gets every run's raw figures)
@@ -66,9 +68,22 @@ r['p99_us'] = r['p99_us']; r['cpu_s_per_million'] = r.get('daemon_cpu_s_per_mill
 print(json.dumps(r))" >>"$results"
 }
 
+# first_reply: a fresh daemon under systemd-socket-activate, timed from connect to reply.
+first_reply() {
+  local home; home=$(mktemp -d -p "$work")
+  systemd-socket-activate -l "$home/s.sock" "$(dirname "$loadgen")/../Statistics/qnreportingd" \
+    --home "$home" 2>/dev/null &
+  local activator=$!
+  for _ in $(seq 100); do [ -S "$home/s.sock" ] && break; sleep 0.02; done
+  "$loadgen" --json --op first --socket "$home/s.sock" |
+    python3 -c "import json,sys; r=json.load(sys.stdin); r['name']='first'; print(json.dumps(r))" >>"$results"
+  kill "$activator"; wait "$activator" 2>/dev/null || true
+}
+
 for round in $(seq "$rounds"); do
   echo "side_by_side: round $round of $rounds" >&2
   daemon pingpong --op pingpong --messages 50000
+  first_reply
   daemon valid --op valid --window 1 --messages 30000
   redis set_c1_p1 no -n 30000 -c 1 -P 1 -t set -d 200
   daemon send_c1 --op send --window 64 --messages 200000
@@ -98,7 +113,9 @@ print(f"valid p50 {med('valid','p50_us'):.1f} us vs ping-pong p50 {med('pingpong
 print(f"sendMessage c8 W64 p99 {med('send_c8','p99_us'):.0f} us (goal < 2000)")
 cpu = med("send_c1", "cpu_s_per_million"); ref = med("xadd_c1_p64_aof", "cpu_s_per_million")
 print(f"daemon CPU per durable message {cpu:.2f} us vs Redis XADD AOF everysec {ref:.2f} us: {cpu/ref:.1f}x (goal <= 2x)")
-print(f"daemon peak RSS in send c8: {med('send_c8','daemon_peak_rss_kib')/1024:.0f} MiB")
+print(f"daemon peak RSS in send c8: {med('send_c8','daemon_peak_rss_kib')/1024:.0f} MiB, "
+      f"after its sessions were destroyed: {med('send_c8','daemon_rss_after_kib')/1024:.0f} MiB (goal < 64)")
+print(f"socket-activated start to first reply: {med('first','first_reply_us')/1000:.1f} ms (goal < 10)")
 if sys.argv[2]:
     json.dump(rows, open(sys.argv[2], "w"), indent=1)
 PY
