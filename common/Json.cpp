@@ -198,6 +198,12 @@ void PutEscape(Sink& out, unsigned char c) {
   out.Put(escape, 2);
 }
 
+// Our own writer rather than nlohmann/json's dump (whose parser we do use): for the store's
+// hot path, the compact text of a typical 8-key payload (bench_json_writer), this writer
+// takes 220-232 ns; nlohmann takes 1090-1115 ns with the conversion of our Value to its
+// tree that a switch would need, and 575-583 ns for the dump of a ready tree alone (CPU
+// time, medians of 5, the 2-core development machine under load).
+//
 // Writes Values as JSON text, appending to a string. In strict mode the first value without
 // a JSON form stops the writer, and TakeError() tells what and where; in lenient mode
 // everything is written. The store writes every row through here: the common cases (short

@@ -9,7 +9,8 @@
 
 namespace qn {
 
-// MessagePack encoding of Values, as the wire protocol carries them.
+// MessagePack encoding of Values, as the wire protocol carries them (msgpack-cxx underneath:
+// msgpack::packer writes, msgpack::parse with a visitor reads).
 //
 // Encoding: null, bool; integers in their smallest encoding (non-negative ones as unsigned
 // formats); doubles as float64; strings as str; Data as bin; Dates as the timestamp
