@@ -1,5 +1,6 @@
 #include "common/Files.h"
 
+#include <dirent.h>
 #include <fcntl.h>
 #include <sys/stat.h>
 #include <unistd.h>
@@ -60,6 +61,19 @@ std::string TemporaryName(const std::string& dir, const std::string& base) {
 }
 
 }  // namespace
+
+std::size_t RemoveTemporaryFiles(const std::string& dir) {
+  DIR* stream = ::opendir(dir.c_str());
+  if (!stream) return 0;
+  std::size_t removed = 0;
+  while (const dirent* entry = ::readdir(stream)) {
+    const std::string_view name = entry->d_name;
+    if (!name.starts_with('.') || name.find(".tmp-") == std::string_view::npos) continue;
+    if (::unlinkat(::dirfd(stream), entry->d_name, 0) == 0) ++removed;
+  }
+  ::closedir(stream);
+  return removed;
+}
 
 std::optional<Error> CreateDirectories(const std::string& path, mode_t mode) {
   if (path.empty()) return ErrnoError("create directory ''", ENOENT);

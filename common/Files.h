@@ -2,6 +2,7 @@
 
 #include <sys/types.h>
 
+#include <cstddef>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -26,6 +27,12 @@ std::optional<Error> CreateDirectories(const std::string& path, mode_t mode);
 // umask. On failure no temporary file is left behind and the old file is untouched
 // (unless the failure is the final directory fsync, after the rename).
 std::optional<Error> WriteFileAtomically(const std::string& path, std::string_view contents);
+
+// Removes the temporary files that WriteFileAtomically leaves in `dir` when the process
+// ends between creating one and renaming it (".<name>.tmp-<...>"). Call it only while no
+// write into `dir` can be under way. Returns how many were removed; a missing `dir`
+// removes none, and a file that cannot be removed is left.
+std::size_t RemoveTemporaryFiles(const std::string& dir);
 
 // Formats `date` in the local time zone with a date-formatter pattern: "yyyy" year, "MM"
 // month, "dd" day, "HH" hour (00-23), "mm" minute, "ss" second, "SSS" milliseconds, "Z" the

@@ -39,6 +39,10 @@ struct Platform {
 
   // The diagnostic-log directory for audio reporting (summary files).
   std::string diagnostic_logs_dir = "/var/log/quenta/DiagnosticLogs/Audio/Reporting";
+  // The one serial queue that writes summary files, in the order sessions stop, off the
+  // thread that stops them. A stop reply is sent only after the queue has run the write
+  // that stop queued. Null: a session writes its file on the thread that stops it.
+  std::shared_ptr<SerialQueue> summary_queue;
 
   // Process-wide state that is computed once (the internal-build flag). It lives here so
   // that each test's Platform starts afresh.

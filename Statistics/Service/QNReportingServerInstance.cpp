@@ -354,6 +354,15 @@ void QNReportingServerInstance::stopReportingSessionForID(std::int64_t reporterI
       }
     }
     QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault, "%s:%d:%s: stopping %lli", reporterID);
+    // The summary file that the stop queued is renamed into place before the reply leaves,
+    // so a client that has its reply finds the file (and a killService: sent after the
+    // reply cannot lose it). The reply still goes out from the server queue.
+    if (const auto& summaries = ctx.platform->summary_queue) {
+      summaries->Async([server = ctx.serverQueue, reply = std::move(reply)]() mutable {
+        server->Async([reply = std::move(reply)] { reply(true); });
+      });
+      return;
+    }
     reply(true);
   });
 }

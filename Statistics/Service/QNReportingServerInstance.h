@@ -112,6 +112,8 @@ class QNReportingServerInstance final
   // Error code 1 in domain "com.norvel.audio.reporting" when reporting is disabled.
   void sendMessage(MessagePayload message, std::uint32_t category, std::uint16_t type,
                    std::optional<std::vector<std::int64_t>> reporterIDs, ErrorReply reply) override;
+  // The reply leaves after the summary queue (when the platform has one) has written the
+  // summary file that the stop queued.
   void stopReportingSessionForID(std::int64_t reporterID, BoolReply reply) override;
   void destroyReportingSession(std::int64_t reporterID, BoolReply reply) override;
   void reporterIDValid(std::int64_t reporterID, DictionaryReply reply) override;

@@ -506,22 +506,25 @@ void QNReportingSession::writeSummaryJson() {
   if (path.empty() || path.back() != '/') path += '/';
   path += name;
 
-  // The disk work runs on the background queue, so the caller never waits on it.
-  platform_->dispatcher->AsyncGlobal(
-      QualityOfService::kBackground, Duration::zero(),
-      [log = platform_->log, scope = scope_, directory, path = std::move(path),
-       output = std::move(output)] {
-        if (auto error = CreateDirectories(directory, 0777)) {
-          QN_LOG(*log, scope.get(), LogLevel::kError,
-                 "%s:%d:%s: can't create logging directory at %@: %@", directory,
-                 error->Description());
-        }
-        if (!output) return;  // the serialiser refused: nothing to write
-        if (auto error = WriteFileAtomically(path, *output)) {
-          QN_LOG(*log, scope.get(), LogLevel::kError, "%s:%d:%s: jsonOutput writeToURL: %@",
-                 error->Description());
-        }
-      });
+  // The disk work runs on the summary queue when there is one: one writer, in stop order,
+  // so a later file of the same name replaces an earlier one.
+  Task write = [log = platform_->log, scope = scope_, directory, path = std::move(path),
+                output = std::move(output)] {
+    if (auto error = CreateDirectories(directory, 0777)) {
+      QN_LOG(*log, scope.get(), LogLevel::kError,
+             "%s:%d:%s: can't create logging directory at %@: %@", directory, error->Description());
+    }
+    if (!output) return;  // the serialiser refused: nothing to write
+    if (auto error = WriteFileAtomically(path, *output)) {
+      QN_LOG(*log, scope.get(), LogLevel::kError, "%s:%d:%s: jsonOutput writeToURL: %@",
+             error->Description());
+    }
+  };
+  if (platform_->summary_queue) {
+    platform_->summary_queue->Async(std::move(write));
+  } else {
+    write();
+  }
 }
 
 // ---------------------------------------------------------------------------------------

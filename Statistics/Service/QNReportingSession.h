@@ -160,7 +160,8 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   // "<diagnostic_logs_dir>/<yyyyMMdd-HHmmssZ>-quenta-<host app or unknown>-<service name>.json".
   // A "/" in the host application name becomes "_" so the file stays in the directory.
   // The text and the name are fixed here; the directory creation (mode 0777) and the atomic
-  // write run on the global background queue. Failures are logged, never reported.
+  // write run on the platform's summary queue (in the order sessions stop), or here when
+  // the platform has none. Failures are logged, never reported.
   void writeSummaryJson();
 
   // Properties.

@@ -56,6 +56,8 @@ constexpr const char* kDefaultDeviceInfo = "/etc/quenta/device-info.json";
 constexpr auto kSessionDrainTimeout = std::chrono::seconds(12);
 // How long it waits for the server queue to run the connection-end steps.
 constexpr auto kServerQueueDrainTimeout = std::chrono::seconds(30);
+// How long an exit waits for the summary files still queued (each is one small fsynced file).
+constexpr auto kSummaryDrainTimeout = std::chrono::seconds(10);
 
 constexpr const char* kDescription =
     "The quenta reporting daemon. Audio clients connect to it over a Unix socket (through\n"
@@ -172,6 +174,14 @@ bool RunAndWait(SerialQueue& queue, std::chrono::steady_clock::time_point deadli
   return ran.wait_until(deadline) == std::future_status::ready;
 }
 
+// Waits until the summary files queued so far are written (every exit path does).
+void WaitForSummaryFiles(SerialQueue& queue, Log& log) {
+  if (!RunAndWait(queue, std::chrono::steady_clock::now() + kSummaryDrainTimeout)) {
+    QN_LOG(log, nullptr, LogLevel::kError,
+           "%s:%d:%s: the summary files were not written in time; exiting anyway");
+  }
+}
+
 int Run(const Options& options) {
   const Paths paths = ResolvePaths(options.paths);
   for (const auto& [dir, mode] :
@@ -203,8 +213,23 @@ int Run(const Options& options) {
   platform->dispatcher = NewLinuxDispatcher();
   platform->notify = NewLinuxNotify({.runtime_dir = paths.runtime_dir, .log = log});
   platform->defaults = NewLinuxDefaults({.state_dir = paths.state_dir, .log = log});
-  // killService exits at once; what was handed to the store is written out first.
-  platform->process = NewLinuxProcess(store->DrainHook());
+  platform->diagnostic_logs_dir = paths.log_dir + "/DiagnosticLogs/Audio/Reporting";
+  // Summary files that an earlier run was writing when it ended: nothing writes there yet.
+  if (const std::size_t stale = RemoveTemporaryFiles(platform->diagnostic_logs_dir)) {
+    QN_LOG(*log, nullptr, LogLevel::kDefault,
+           "%s:%d:%s: removed %lu unfinished summary files of an earlier run",
+           static_cast<unsigned long>(stale));
+  }
+  platform->summary_queue = platform->dispatcher->CreateSerialQueue(
+      "com.norvel.quenta.reporting.summaries", QualityOfService::kBackground);
+  // killService exits at once; the summary files queued and what was handed to the store
+  // are written out first.
+  platform->process =
+      NewLinuxProcess([summaries = std::weak_ptr<SerialQueue>(platform->summary_queue),
+                       drain_store = store->DrainHook(), log] {
+        if (auto queue = summaries.lock()) WaitForSummaryFiles(*queue, *log);
+        drain_store();
+      });
   platform->device_info = NewLinuxDeviceInfo(
       {.path = options.device_info, .internal_build = options.internal_build, .log = log});
   platform->livo_reporting = NewStoreLivoReporting(store);
@@ -213,7 +238,6 @@ int Run(const Options& options) {
       NewLinuxOstrel(options.driver_stats.value_or(paths.runtime_dir + "/driver-stats"));
   platform->enerdex = NewStoreEnerdex(store);
   platform->analytics = NewStoreAnalytics(store);
-  platform->diagnostic_logs_dir = paths.log_dir + "/DiagnosticLogs/Audio/Reporting";
 
   std::shared_ptr<QNReportingServiceDelegate> delegate =
       QNReportingServiceDelegate::Create(platform);
@@ -270,6 +294,7 @@ int Run(const Options& options) {
       break;
     }
   }
+  WaitForSummaryFiles(*platform->summary_queue, *log);
   store->Drain();
 
   // Work still queued may hold the platform; the dispatcher is released last, here, so that

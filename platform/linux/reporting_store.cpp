@@ -3,11 +3,13 @@
 #include <sqlite3.h>
 #include <time.h>
 
+#include <algorithm>
 #include <atomic>
 #include <condition_variable>
 #include <cstdlib>
 #include <exception>
 #include <mutex>
+#include <span>
 #include <thread>
 #include <utility>
 #include <vector>
@@ -116,10 +118,54 @@ struct Record {
   std::uint16_t type = 0;
   std::int32_t subsystem = 0;
   std::int64_t id = 0;  // session row id (kSession, kFlush, kSessionMessage)
+  bool failed = false;  // set by the writer when the record could not be written
   double time = 0;
   Value payload;
   std::unique_ptr<RecordExtra> extra;
 };
+
+// Whether a failure with SQLite result code `rc` is the database's as a whole (no room,
+// no permission, a lock, an I/O error) rather than one record's: every other record would
+// fail the same way.
+bool FailsEveryRecord(int rc) {
+  switch (rc & 0xff) {
+    case SQLITE_FULL:
+    case SQLITE_READONLY:
+    case SQLITE_BUSY:
+    case SQLITE_LOCKED:
+    case SQLITE_IOERR:
+    case SQLITE_CANTOPEN:
+    case SQLITE_NOMEM:
+    case SQLITE_PERM:
+    case SQLITE_CORRUPT:
+    case SQLITE_NOTADB:
+    case SQLITE_PROTOCOL:
+      return true;
+    default:
+      return false;
+  }
+}
+
+// The name of a record's kind in log lines.
+const char* KindName(RecordKind kind) {
+  switch (kind) {
+    case RecordKind::kSession:
+      return "session";
+    case RecordKind::kFlush:
+      return "session flush";
+    case RecordKind::kSessionMessage:
+    case RecordKind::kSingleMessage:
+      return "message";
+    case RecordKind::kAnalytics:
+      return "analytics event";
+    case RecordKind::kPowerLog:
+      return "power-log event";
+    case RecordKind::kTask:
+    case RecordKind::kExec:
+      break;
+  }
+  return "control";
+}
 
 }  // namespace
 
@@ -253,12 +299,15 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
       RunCallbacks(batch, error);
 
       const std::uint64_t count = batch.size();
+      const auto failed = static_cast<std::uint64_t>(
+          std::count_if(batch.begin(), batch.end(), [](const Record& r) { return r.failed; }));
       batch.clear();
       if (batch.capacity() > kKeptQueueCapacity) batch.shrink_to_fit();
       {
         std::lock_guard lock(mu_);
         ++stats_.batches;
-        (error ? stats_.failed : stats_.committed) += count;
+        stats_.failed += failed;
+        stats_.committed += count - failed;
         written_ = batch_end;
       }
       written_cv_.notify_all();
@@ -292,27 +341,83 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
     (void)db_.release();
   }
 
-  // Writes `batch` in one transaction. Returns the error when the transaction failed (the
-  // whole batch is then rolled back and logged as lost).
+  // Writes `batch` in one transaction; when that fails, once more; when that fails too,
+  // record by record, each in a transaction of its own, so that only a record that fails
+  // on its own is lost (logged and counted each). A failure of the database as a whole
+  // (FailsEveryRecord) loses the rest of the batch at once, as every record would fail the
+  // same way; it is logged when the database enters that state (or its error changes), not
+  // for every batch, and the next commit logs that writing works again. Marks every lost
+  // record `failed`; returns the last error, or nullopt when nothing was lost.
   std::optional<Error> WriteBatch(std::vector<Record>& batch) {
+    const auto all = std::span<Record>(batch);
+    std::optional<Failure> failure = WriteTransaction(all);
+    if (failure) failure = WriteTransaction(all);
+    if (!failure) return std::nullopt;
+    if (FailsEveryRecord(failure->rc)) return LoseAll(all, *failure);
+    std::optional<Error> last;
+    for (std::size_t i = 0; i < batch.size(); ++i) {
+      failure = WriteTransaction(all.subspan(i, 1));
+      if (!failure) continue;
+      if (FailsEveryRecord(failure->rc)) return LoseAll(all.subspan(i), *failure);
+      batch[i].failed = true;
+      QN_STORE_ERROR(
+          "%s:%d:%s: reporting store: dropped a %s record that cannot be written: %s (%d)",
+          KindName(batch[i].kind), failure->message, failure->rc);
+      last = failure->error;
+    }
+    return last;
+  }
+
+  // Why a transaction failed: the step, SQLite's result code and message, as an Error.
+  struct Failure {
+    int rc;
+    std::string message;
+    Error error;
+  };
+
+  // Writes `records` in one transaction and commits; on failure rolls back.
+  std::optional<Failure> WriteTransaction(std::span<Record> records) {
     int rc = Step(begin_.get());
-    if (rc != SQLITE_DONE) return FailBatch(rc, "begin", batch.size());
-    for (Record& record : batch) {
+    if (rc != SQLITE_DONE) return Fail(rc, "begin");
+    for (Record& record : records) {
       rc = WriteRecord(record);
-      if (rc != SQLITE_DONE) return FailBatch(rc, "insert", batch.size());
+      if (rc != SQLITE_DONE) return Fail(rc, "insert");
     }
     rc = Step(commit_.get());
-    if (rc != SQLITE_DONE) return FailBatch(rc, "commit", batch.size());
+    if (rc != SQLITE_DONE) return Fail(rc, "commit");
+    if (failing_rc_ != 0) {
+      if (log_) {
+        QN_LOG(*log_, nullptr, LogLevel::kDefault,
+               "%s:%d:%s: reporting store: writing again; %llu records were lost meanwhile",
+               static_cast<unsigned long long>(lost_while_failing_));
+      }
+      failing_rc_ = 0;
+      lost_while_failing_ = 0;
+    }
     return std::nullopt;
   }
 
-  std::optional<Error> FailBatch(int rc, const char* step, std::size_t count) {
+  Failure Fail(int rc, const char* step) {
     sqlite3* db = db_.get();
-    Error error = SqliteError(db, rc, std::string("reporting store ") + step);
-    QN_STORE_ERROR("%s:%d:%s: reporting store: %s failed, dropped a batch of %llu records: %s (%d)",
-                   step, static_cast<unsigned long long>(count), sqlite3_errmsg(db), rc);
+    Failure failure{rc, sqlite3_errmsg(db),
+                    SqliteError(db, rc, std::string("reporting store ") + step)};
+    failure.message = std::string(step) + " failed: " + failure.message;
     if (!sqlite3_get_autocommit(db)) Step(rollback_.get());
-    return error;
+    return failure;
+  }
+
+  // Marks `records` lost by a failure of the whole database; logs it on a change of state.
+  std::optional<Error> LoseAll(std::span<Record> records, const Failure& failure) {
+    for (Record& r : records) r.failed = true;
+    lost_while_failing_ += records.size();
+    if (failure.rc != failing_rc_) {
+      failing_rc_ = failure.rc;
+      QN_STORE_ERROR(
+          "%s:%d:%s: reporting store: %s (%d), dropped a batch of %llu records; further "
+          "losses are counted until a write succeeds",
+          failure.message, failure.rc, static_cast<unsigned long long>(records.size()));
+    }
+    return failure.error;
   }
 
   // Runs a statement that returns no rows and resets it. Returns SQLite's result code.
@@ -368,11 +473,11 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
         break;
       case RecordKind::kAnalytics: {
         stmt = insert_analytics_.get();
-        Value payload;
-        if (r.extra->provider) payload = CallProvider(r.extra->provider, r.extra->name);
-        r.extra->provider = nullptr;  // called at most once
+        // Called at most once; its payload is kept for a retry of the record.
+        if (r.extra->provider) r.payload = CallProvider(r.extra->provider, r.extra->name);
+        r.extra->provider = nullptr;
         BindText(stmt, 1, r.extra->name);
-        BindJson(stmt, 2, json_payload_, payload);
+        BindJson(stmt, 2, json_payload_, r.payload);
         sqlite3_bind_double(stmt, 3, r.time);
         break;
       }
@@ -414,7 +519,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   void RunCallbacks(std::vector<Record>& batch, const std::optional<Error>& error) {
     for (Record& r : batch) {
       if (r.kind == RecordKind::kFlush && r.extra && r.extra->flushed) {
-        r.extra->flushed(error);
+        r.extra->flushed(r.failed ? error : std::nullopt);
       } else if (r.kind == RecordKind::kTask && r.extra && r.extra->task) {
         r.extra->task();
       }
@@ -433,6 +538,8 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   Statement insert_session_, flush_session_, insert_message_, insert_single_;
   Statement insert_analytics_, insert_powerlog_;
   std::string json_payload_, json_session_info_, json_user_info_;
+  int failing_rc_ = 0;  // the error of the database as a whole while writes fail, else 0
+  std::uint64_t lost_while_failing_ = 0;
 
   const std::shared_ptr<Log> log_;
   const ReportingStore::Options options_;

@@ -36,9 +36,15 @@ class ReportingStoreWriter;
 // The database uses 16 KiB pages (set when the file is created) and keeps its WAL file at
 // most 64 MiB after a checkpoint.
 //
-// Failures: a failed write (disk full, read-only file, database locked beyond the busy
-// timeout) is logged at error level with SQLite's message and the number of records lost;
-// that batch is dropped and later batches try again. When the queue holds
+// Failures: a batch whose transaction fails is tried once more, then record by record,
+// each in a transaction of its own, so that only a record that fails on its own (a
+// constraint, a value too big) is lost; each such loss is logged. A failure of the
+// database as a whole (disk full, read-only file, database locked beyond the busy
+// timeout, I/O error) loses the rest of the batch at once: it is logged at error level
+// with SQLite's message when the store enters that state or its error changes, the losses
+// are counted while it lasts, and the first commit afterwards logs how many records were
+// lost meanwhile. Later batches always try again, so writing resumes once there is room.
+// Every lost record counts in Stats::failed. When the queue holds
 // Options::max_queued_records records, further records are dropped and counted (logged
 // by the writer), so a dead disk cannot eat memory.
 class ReportingStore {
@@ -54,7 +60,7 @@ class ReportingStore {
   struct Stats {
     std::uint64_t handed_over = 0;  // records accepted into the queue
     std::uint64_t committed = 0;    // records in committed transactions
-    std::uint64_t failed = 0;       // records lost with a failed transaction
+    std::uint64_t failed = 0;       // records that could not be written (see Failures)
     std::uint64_t dropped_queue_full = 0;
     std::uint64_t batches = 0;  // transactions attempted
   };
