@@ -118,6 +118,8 @@ const CLI::Validator kDebugScopes(
 std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
   CLI::App app(kDescription, kProgram);
   app.footer(kFooter);
+  // An option given twice takes the last value, as the command-line convention goes.
+  app.option_defaults()->multi_option_policy(CLI::MultiOptionPolicy::TakeLast);
   app.set_help_flag("-h,--help", "Show this text and exit");
   app.set_version_flag("--version", std::string(kProgram) + " " + QN_VERSION,
                        "Show the version and exit");

@@ -142,6 +142,8 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
   app.require_subcommand(0, 1);  // none: told below, with the list of commands
   app.fallthrough();
   app.footer(kFooter);
+  // An option given twice takes the last value, as the command-line convention goes.
+  app.option_defaults()->multi_option_policy(CLI::MultiOptionPolicy::TakeLast);
 
   PathOptions paths;
   double timeout_seconds = 10;
