@@ -71,12 +71,18 @@ void Emit(Log& log, const LogScope* scope, LogLevel level, const char* file, int
 // file's base name, the line and the function's full name as the first three arguments.
 //   QN_LOG(log, scope, qn::LogLevel::kInfo, "%s:%d:%s: created reporting session for ID: %lli", id);
 // `log` is a qn::Log&, `scope` a const qn::LogScope* (null = default log). Debug lines are
-// skipped (arguments unformatted) unless level 5 is enabled for the scope.
-#define QN_LOG(log, scope, level, format, ...)                                          \
-  ::qn::log_detail::Emit((log), (scope), (level), __FILE__, __LINE__, __PRETTY_FUNCTION__, \
-                         (format)__VA_OPT__(, ) __VA_ARGS__)
+// skipped, their arguments not even evaluated, unless level 5 is enabled for the scope.
+#define QN_LOG(log, scope, level, format, ...) \
+  QN_LOG_AS(__PRETTY_FUNCTION__, log, scope, level, format __VA_OPT__(, ) __VA_ARGS__)
 
 // The same with an explicit function name, for lines whose function part is fixed.
-#define QN_LOG_AS(function, log, scope, level, format, ...)                      \
-  ::qn::log_detail::Emit((log), (scope), (level), __FILE__, __LINE__, (function), \
-                         (format)__VA_OPT__(, ) __VA_ARGS__)
+#define QN_LOG_AS(function, log, scope, level, format, ...)                                  \
+  do {                                                                                      \
+    ::qn::Log& qn_log_ = (log);                                                             \
+    const ::qn::LogScope* qn_scope_ = (scope);                                              \
+    const ::qn::LogLevel qn_level_ = (level);                                               \
+    if (qn_level_ != ::qn::LogLevel::kDebug || qn_log_.LogEnabled(qn_scope_, 5)) {          \
+      ::qn::log_detail::Emit(qn_log_, qn_scope_, qn_level_, __FILE__, __LINE__, (function), \
+                             (format)__VA_OPT__(, ) __VA_ARGS__);                           \
+    }                                                                                       \
+  } while (0)

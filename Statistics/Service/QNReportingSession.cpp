@@ -42,9 +42,18 @@ void TracePoint(const Platform& platform, std::uint32_t code) {
   if (platform.trace) platform.trace->TracePoint(code, 0, 0, 0, 0);
 }
 
-// A new dictionary with every entry of `payload`, blanks in string keys replaced by "_".
-// Keys that collapse into one keep the later value. Null gives an empty dictionary.
-std::shared_ptr<const Dictionary> ConvertPayload(const Dictionary* payload) {
+bool HasBlankInKey(const Dictionary& payload) {
+  return std::any_of(payload.begin(), payload.end(), [](const Dictionary::Entry& entry) {
+    const std::string* text = entry.first.as_string();
+    return text && text->find(' ') != std::string::npos;
+  });
+}
+
+// `payload` with blanks in string keys replaced by "_": the payload itself when no key has
+// one (payloads are immutable, so it is shared rather than copied), else a new dictionary
+// in which keys that collapse into one keep the later value. Null gives an empty dictionary.
+std::shared_ptr<const Dictionary> ConvertPayload(const std::shared_ptr<const Dictionary>& payload) {
+  if (payload && !HasBlankInKey(*payload)) return payload;
   auto converted = std::make_shared<Dictionary>();
   if (!payload) return converted;
   converted->Reserve(payload->size());
@@ -345,7 +354,7 @@ void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
                                      ReplyBlock reply) {
   SESSION_LOG(LogLevel::kDebug, "%s:%d:%s: sending message for session owned by %lli",
               reporterID());
-  std::shared_ptr<const Dictionary> converted = ConvertPayload(payload.get());
+  std::shared_ptr<const Dictionary> converted = ConvertPayload(payload);
   std::string messageID = messageIdForCategory(category, type);
 
   Append(aggregatedPayloadData(), Value(converted));
@@ -416,7 +425,7 @@ void QNReportingSession::sendSingleMessage(const std::shared_ptr<const Platform>
         Dictionary userInfo{
             {kLivoReportingUserInfoClientName, kClientName},
             {kLivoReportingUserInfoServiceName, QNReportingServiceTypeName(serviceType)}};
-        std::shared_ptr<const Dictionary> converted = ConvertPayload(payload.get());
+        std::shared_ptr<const Dictionary> converted = ConvertPayload(payload);
         std::optional<Error> error;
         const bool sent = platform->livo_reporting &&
                           platform->livo_reporting->SendOneMessage(

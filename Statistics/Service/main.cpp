@@ -46,6 +46,12 @@
 #define QN_VERSION "0.1.0"
 #endif
 
+// jemalloc's settings (read by the allocator at start-up; harmless without it): a
+// background thread hands memory freed after a burst back to the system within a second or
+// two, instead of keeping it until later allocations happen to purge it.
+extern "C" const char* malloc_conf;
+const char* malloc_conf = "background_thread:true,dirty_decay_ms:1000,muzzy_decay_ms:0";
+
 namespace qn {
 namespace {
 
