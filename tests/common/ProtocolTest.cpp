@@ -26,40 +26,6 @@ RequestHeader MustPass(const Value& request) {
   return {};
 }
 
-TEST(ProtocolTest, OperationTableInDeclaredOrder) {
-  struct Row {
-    Op op;
-    const char* name;
-    std::vector<ArgKind> args;
-  } rows[] = {
-      {Op::kCreateReportingSession, "createReportingSession:reply:", {ArgKind::kInt64}},
-      {Op::kSetServiceType,
-       "setServiceType:reportingSession:reply:",
-       {ArgKind::kUInt16, ArgKind::kInt64}},
-      {Op::kGetServiceNameForReporterID, "getServiceNameForReporterID:reply:", {ArgKind::kInt64}},
-      {Op::kSetConfiguration,
-       "setConfiguration:forReporterID:reply:",
-       {ArgKind::kDictionary, ArgKind::kInt64}},
-      {Op::kStartReportingSession, "startReportingSessionForID:reply:", {ArgKind::kInt64}},
-      {Op::kSendMessage,
-       "sendMessage:withCategory:andType:forReportingIDs:reply:",
-       {ArgKind::kDictionary, ArgKind::kUInt32, ArgKind::kUInt16, ArgKind::kInt64ArrayOrNull}},
-      {Op::kStopReportingSession, "stopReportingSessionForID:reply:", {ArgKind::kInt64}},
-      {Op::kDestroyReportingSession, "destroyReportingSession:reply:", {ArgKind::kInt64}},
-      {Op::kReporterIDValid, "reporterID:valid:", {ArgKind::kInt64}},
-      {Op::kGetAllReporters, "getAllReporters:", {}},
-      {Op::kKillService, "killService:", {}},
-  };
-  std::uint32_t expected_number = kFirstOp;
-  for (const Row& row : rows) {
-    EXPECT_EQ(static_cast<std::uint32_t>(row.op), expected_number++);
-    EXPECT_STREQ(OpName(row.op), row.name);
-    auto args = ArgumentsOf(row.op);
-    EXPECT_EQ(std::vector<ArgKind>(args.begin(), args.end()), row.args) << row.name;
-  }
-  EXPECT_EQ(expected_number, kLastOp + 1);
-}
-
 TEST(ProtocolTest, AcceptsWellFormedRequestsOfEveryOperation) {
   const Dictionary message{{"key", "value"}};
   struct Case {

@@ -503,22 +503,6 @@ TEST_F(SessionLimitTest, TooManySessionsForOneClientAreNotMade) {
   EXPECT_TRUE(b.Session(9));
 }
 
-TEST_F(ServerInstanceTest, RequestsThroughTheConnectionsExportedObject) {
-  Client a = h_.Connect(100);
-  using protocol::Op;
-  a.connection->Request(Op::kCreateReportingSession, {Value(42)}, 1);
-  a.connection->Request(Op::kSetServiceType, {Value(2), Value(42)}, 2);
-  a.connection->Request(Op::kGetServiceNameForReporterID, {Value(0)}, 3);
-  a.connection->Request(Op::kReporterIDValid, {Value(42)}, 4);
-  a.connection->Request(Op::kSendMessage, {Value(Dictionary{}), Value(1), Value(1), Value()}, 5);
-  h_.Run();
-  EXPECT_THAT(a.connection->RepliesFor(1), ElementsAre(Value(true)));
-  EXPECT_THAT(a.connection->RepliesFor(3), ElementsAre(Value(65535), Value(65535)));
-  EXPECT_THAT(a.connection->RepliesFor(4),
-              ElementsAre(Value(Dictionary{{"reporterID", 42}, {"serviceType", 2}})));
-  EXPECT_THAT(a.connection->RepliesFor(5), ElementsAre(Value()));
-}
-
 TEST_F(ServerInstanceTest, TheSessionRegistryListsTheSessionsStillAlive) {
   Client a = h_.Connect(100);
   Client b = h_.Connect(200);

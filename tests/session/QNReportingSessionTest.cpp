@@ -14,47 +14,6 @@ using testing::Payload;
 using namespace std::chrono_literals;
 using SessionTest = testing::SessionFixture;
 
-TEST_F(SessionTest, CreationSetsUpTheRecord) {
-  auto session = NewSession(-7);
-  ASSERT_TRUE(session);
-  EXPECT_EQ(session->reporterID(), -7);
-  EXPECT_EQ(session->serviceType(), 65535);
-  EXPECT_EQ(session->serviceName(), "unknown");
-  EXPECT_THAT(session->processIdentifiers(), ElementsAre(Value(1234)));
-  EXPECT_FALSE(session->started());
-  EXPECT_FALSE(session->livoReportingSessionStarted());
-  EXPECT_TRUE(session->userInfo()->empty());
-  EXPECT_TRUE(session->messageTypeCounts()->empty());
-  ASSERT_TRUE(session->aggregatedPayloadData());
-  ASSERT_TRUE(session->nestedAggregatedPayloadData());
-  EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
-  EXPECT_FALSE(session->orientationCallbackID());
-  EXPECT_FALSE(session->startDate());
-  EXPECT_FALSE(session->livoReportingSession());
-  EXPECT_FALSE(session->driverSnapShot());
-  EXPECT_FALSE(session->transactionCompleteBlock());
-
-  auto queues = t_.dispatcher->CreatedQueues();
-  ASSERT_EQ(queues.size(), 1u);
-  EXPECT_EQ(queues[0].first, "com.norvel.quenta.session.livoreporting");
-  EXPECT_EQ(queues[0].second, QualityOfService::kUtility);
-  EXPECT_EQ(session->livoReportingQueue()->label(), "com.norvel.quenta.session.livoreporting");
-
-  auto lines = t_.log->Lines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_THAT(lines[0].text, MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*initWithID.*: "
-                                          "created reporting session for ID: -7"));
-  EXPECT_EQ(lines[0].scope, "qnrr");
-  EXPECT_EQ(lines[0].level, LogLevel::kInfo);
-  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u));
-
-  session.reset();
-  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u, 0x21042834u));
-  EXPECT_THAT(t_.log->Matching("deallocing"),
-              ElementsAre(MatchesRegex(".*: deallocing this session -7")));
-  EXPECT_TRUE(t_.trace->AllArgumentsZero());
-}
-
 TEST_F(SessionTest, CreationNeedsLogAndDispatcher) {
   auto bare = std::make_shared<Platform>();
   EXPECT_FALSE(QNReportingSession::initWithID(bare, 1, {}));
@@ -363,25 +322,6 @@ TEST_F(SessionTest, RestartBeginsAFreshPeriodAndCountsContinue) {
             Value(2));
   t_.dispatcher->RunUntilIdle();
   EXPECT_EQ(t_.livo->Sessions()[1].messages.size(), 1u);
-}
-
-TEST_F(SessionTest, HeldPropertiesAreOnlyHeld) {
-  auto session = NewSession();
-  std::vector<bool> calls;
-  session->setTransactionCompleteBlock([&calls](bool ok) { calls.push_back(ok); });
-  session->setDriverSnapShot(std::make_shared<const Dictionary>(Dictionary{{"Speaker-(null)", 1}}));
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_TRUE(calls.empty());
-  ASSERT_TRUE(session->transactionCompleteBlock());
-  session->transactionCompleteBlock()(true);
-  EXPECT_THAT(calls, ElementsAre(true));
-  session->setTransactionCompleteBlock(nullptr);
-  EXPECT_FALSE(session->transactionCompleteBlock());
-  ASSERT_TRUE(session->driverSnapShot());
-  EXPECT_TRUE(session->driverSnapShot()->Contains("Speaker-(null)"));
 }
 
 TEST_F(SessionTest, QueuedWorkKeepsTheSessionAlive) {

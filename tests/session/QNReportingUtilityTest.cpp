@@ -18,52 +18,6 @@ using testing::FakePlatform;
 using ::testing::MatchesRegex;
 using namespace std::chrono_literals;
 
-TEST(QNReportingUtilityTest, CategoryNames) {
-  EXPECT_EQ(QNReportingCategoryName(11), "Volume");
-  EXPECT_EQ(QNReportingCategoryName(0), "Undefined");
-  EXPECT_EQ(QNReportingCategoryName(1), "Generic");
-  EXPECT_EQ(QNReportingCategoryName(4), "PlaybackAndRecord");
-  EXPECT_EQ(QNReportingCategoryName(9), "Ostreling");
-  EXPECT_EQ(QNReportingCategoryName(10), "Performance");
-  EXPECT_EQ(QNReportingCategoryName(12), "Undefined");
-  EXPECT_EQ(QNReportingCategoryName(0xFFFF), "Undefined");
-  // Origins: one flag word each; anything else gives only the separator.
-  EXPECT_EQ(QNReportingCategoryName(0x80000009), "Toolbox_Ostreling");
-  EXPECT_EQ(QNReportingCategoryName(0x40000007), "Routing_RouteChange");
-  EXPECT_EQ(QNReportingCategoryName(0x20000003), "HAL_Playback");
-  EXPECT_EQ(QNReportingCategoryName(0x10000008), "DSP_Error");
-  EXPECT_EQ(QNReportingCategoryName(0x08000006), "Session_ClientRequest");
-  EXPECT_EQ(QNReportingCategoryName(0x30000001), "_Generic");
-  EXPECT_EQ(QNReportingCategoryName(0x00010002), "_Record");
-  EXPECT_EQ(QNReportingCategoryName(0x00FF0005), "_Setup");
-  EXPECT_EQ(QNReportingCategoryName(0x8000000C), "Toolbox_Undefined");
-  // All ones is not an origin: no prefix.
-  EXPECT_EQ(QNReportingCategoryName(0xFFFFFFFF), "Undefined");
-  EXPECT_EQ(QNReportingCategoryName(0xFFFFFFFE), "_Undefined");
-}
-
-TEST(QNReportingUtilityTest, TypeNames) {
-  const char* expected[] = {"Generic", "Start", "Stop", "Setup", "Error", "IssueDetector"};
-  for (std::uint16_t t = 0; t < 6; ++t) EXPECT_EQ(QNReportingTypeName(t), expected[t]);
-  EXPECT_EQ(QNReportingTypeName(6), "Undefined");
-  EXPECT_EQ(QNReportingTypeName(65534), "Undefined");
-  EXPECT_EQ(QNReportingTypeName(65535), "Unknown");
-}
-
-TEST(QNReportingUtilityTest, ServiceTypeNames) {
-  const char* expected[] = {"generic",          "vessa",         "telephony",
-                            "haptics",          "alarms",        "standalone",
-                            "soundautoconfig",  "longformaudio", "nonlongformaudio",
-                            "audiodeviceusage", "alerts",        "test",
-                            "apiusage"};
-  for (std::uint32_t t = 0; t < 13; ++t) EXPECT_EQ(QNReportingServiceTypeName(t), expected[t]);
-  EXPECT_EQ(QNReportingServiceTypeName(13), "telephony");
-  EXPECT_EQ(QNReportingServiceTypeName(65534), "telephony");
-  EXPECT_EQ(QNReportingServiceTypeName(65535), "unknown");
-  EXPECT_EQ(QNReportingServiceTypeName(65536), "telephony");
-  EXPECT_EQ(QNReportingServiceTypeName(0xFFFFFFFF), "telephony");
-}
-
 TEST(QNReportingUtilityTest, HostApplicationName) {
   EXPECT_EQ(QNReportingHostApplicationName(static_cast<const Dictionary*>(nullptr)), "Unknown");
   Dictionary empty;

@@ -189,44 +189,6 @@ TEST_F(ReportingStoreTest, DrainOnTheWriterThreadReturnsAndDrainHookOutlivesTheS
   hook();  // the store is gone: nothing to do, nothing to crash
 }
 
-TEST_F(ReportingStoreTest, DiskFullLogsTheErrorDropsTheBatchAndLaterBatchesSucceed) {
-  auto store = OpenStore();
-  store->AddPowerLogEvent(1, "before", Value());
-  store->Drain();
-
-  // The database may not grow: every batch that needs a new page fails. The gate makes the
-  // limit, the rows and the flush one batch.
-  WriterGate gate;
-  gate.Close(*store);
-  store->ExecuteForTesting("PRAGMA max_page_count = 1");
-  const std::string big(4000, 'x');
-  for (int i = 0; i < 100; ++i) store->AddPowerLogEvent(1, "lost", Value(big));
-  std::promise<std::optional<Error>> flush_result;
-  store->MarkSessionFlushed(1, [&](std::optional<Error> e) { flush_result.set_value(e); });
-  gate.Release();
-  store->Drain();
-
-  auto flush_error = flush_result.get_future().get();
-  ASSERT_TRUE(flush_error);
-  EXPECT_EQ(flush_error->code, SQLITE_FULL);
-  auto errors = log_->Matching("dropped a batch of");
-  ASSERT_EQ(errors.size(), 1u);
-  EXPECT_NE(errors[0].find("database or disk is full"), std::string::npos) << errors[0];
-  EXPECT_NE(errors[0].find("dropped a batch of 102 records"), std::string::npos) << errors[0];
-  EXPECT_EQ(log_->Lines()[0].level, LogLevel::kError);
-  EXPECT_GE(store->stats().failed, 101u);
-
-  // Still running: once there is room again, writes go through.
-  store->ExecuteForTesting("PRAGMA max_page_count = 1073741823");
-  for (int i = 0; i < 100; ++i) store->AddPowerLogEvent(1, "after", Value(big));
-  store->Drain();
-  auto rows = ReadRows(db_path_, ReportingSink::kPowerLog);
-  ASSERT_EQ(rows.size(), 101u);
-  EXPECT_EQ(rows.front().name, "before");
-  for (std::size_t i = 1; i < rows.size(); ++i) EXPECT_EQ(rows[i].name, "after");
-  EXPECT_EQ(log_->Count("dropped a batch of"), 1);
-}
-
 TEST_F(ReportingStoreTest, DatabaseLockedByAnotherProcessDropsTheBatchUntilReleased) {
   ReportingStore::Options options;
   options.busy_timeout_ms = 50;
