@@ -26,40 +26,6 @@ RequestHeader MustPass(const Value& request) {
   return {};
 }
 
-TEST(ProtocolTest, OperationTableInDeclaredOrder) {
-  struct Row {
-    Op op;
-    const char* name;
-    std::vector<ArgKind> args;
-  } rows[] = {
-      {Op::kCreateReportingSession, "createReportingSession:reply:", {ArgKind::kInt64}},
-      {Op::kSetServiceType,
-       "setServiceType:reportingSession:reply:",
-       {ArgKind::kUInt16, ArgKind::kInt64}},
-      {Op::kGetServiceNameForReporterID, "getServiceNameForReporterID:reply:", {ArgKind::kInt64}},
-      {Op::kSetConfiguration,
-       "setConfiguration:forReporterID:reply:",
-       {ArgKind::kDictionary, ArgKind::kInt64}},
-      {Op::kStartReportingSession, "startReportingSessionForID:reply:", {ArgKind::kInt64}},
-      {Op::kSendMessage,
-       "sendMessage:withCategory:andType:forReportingIDs:reply:",
-       {ArgKind::kDictionary, ArgKind::kUInt32, ArgKind::kUInt16, ArgKind::kInt64ArrayOrNull}},
-      {Op::kStopReportingSession, "stopReportingSessionForID:reply:", {ArgKind::kInt64}},
-      {Op::kDestroyReportingSession, "destroyReportingSession:reply:", {ArgKind::kInt64}},
-      {Op::kReporterIDValid, "reporterID:valid:", {ArgKind::kInt64}},
-      {Op::kGetAllReporters, "getAllReporters:", {}},
-      {Op::kKillService, "killService:", {}},
-  };
-  std::uint32_t expected_number = kFirstOp;
-  for (const Row& row : rows) {
-    EXPECT_EQ(static_cast<std::uint32_t>(row.op), expected_number++);
-    EXPECT_STREQ(OpName(row.op), row.name);
-    auto args = ArgumentsOf(row.op);
-    EXPECT_EQ(std::vector<ArgKind>(args.begin(), args.end()), row.args) << row.name;
-  }
-  EXPECT_EQ(expected_number, kLastOp + 1);
-}
-
 TEST(ProtocolTest, AcceptsWellFormedRequestsOfEveryOperation) {
   const Dictionary message{{"key", "value"}};
   struct Case {
@@ -179,28 +145,6 @@ TEST(ProtocolTest, IntegersMustFitTheirKind) {
             "argument 4 of sendMessage:withCategory:andType:forReportingIDs:reply: must be an "
             "array of signed 64-bit integers or nil, got an array (element 1 is "
             "18446744073709551615) (request 9)");
-}
-
-TEST(ProtocolTest, AnyIntegerEncodingThatFitsIsAccepted) {
-  // [2, 1, 5 as int64, 42 as uint64]: setServiceType with wide encodings.
-  const std::string body("\x94\x02\x01\xd3\0\0\0\0\0\0\0\x05\xcf\0\0\0\0\0\0\0\x2a", 21);
-  auto decoded = DecodeMsgPack(body);
-  ASSERT_TRUE(std::holds_alternative<Value>(decoded));
-  RequestHeader header = MustPass(std::get<Value>(decoded));
-  EXPECT_EQ(header.op, Op::kSetServiceType);
-}
-
-TEST(ProtocolTest, ConnectionErrorFrameBody) {
-  Value error = MakeConnectionError(ConnectionError::kUnknownOp, "unknown op 12");
-  Value expected(Array{
-      0,
-      Dictionary{{"domain", "com.norvel.quenta.ipc"}, {"code", 5}, {"message", "unknown op 12"}}});
-  EXPECT_EQ(error, expected);
-  // Key order is part of the frame.
-  const Dictionary& map = *(*error.as_array())[1].as_dictionary();
-  std::vector<std::string> keys;
-  for (const auto& [k, v] : map) keys.push_back(*k.as_string());
-  EXPECT_EQ(keys, (std::vector<std::string>{"domain", "code", "message"}));
 }
 
 }  // namespace

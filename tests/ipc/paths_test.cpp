@@ -42,24 +42,5 @@ TEST(PathsTest, OtherUsersUseTheXdgFolders) {
   EXPECT_EQ(paths.socket_path, "/run/user/1000/quenta/reporting.sock");
 }
 
-TEST(PathsTest, OtherUsersFallBackWithoutXdgVariables) {
-  PathEnvironment user;
-  user.uid = 1000;
-  user.home = "/home/u";
-  Paths paths = ResolvePaths({}, user);
-  EXPECT_EQ(paths.runtime_dir, "/tmp/quenta-1000");
-  EXPECT_EQ(paths.state_dir, "/home/u/.local/state/quenta");
-  EXPECT_EQ(paths.log_dir, "/home/u/.local/state/quenta/log");
-}
-
-TEST(PathsTest, SocketOptionOverridesOnlyTheSocket) {
-  PathEnvironment user;
-  user.uid = 1000;
-  user.home = "/home/u";
-  Paths paths = ResolvePaths(PathOptions{"/h", "/elsewhere/s.sock"}, user);
-  EXPECT_EQ(paths.socket_path, "/elsewhere/s.sock");
-  EXPECT_EQ(paths.runtime_dir, "/h/run");
-}
-
 }  // namespace
 }  // namespace qn

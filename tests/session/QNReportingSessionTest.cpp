@@ -14,72 +14,6 @@ using testing::Payload;
 using namespace std::chrono_literals;
 using SessionTest = testing::SessionFixture;
 
-TEST_F(SessionTest, CreationSetsUpTheRecord) {
-  auto session = NewSession(-7);
-  ASSERT_TRUE(session);
-  EXPECT_EQ(session->reporterID(), -7);
-  EXPECT_EQ(session->serviceType(), 65535);
-  EXPECT_EQ(session->serviceName(), "unknown");
-  EXPECT_THAT(session->processIdentifiers(), ElementsAre(Value(1234)));
-  EXPECT_FALSE(session->started());
-  EXPECT_FALSE(session->livoReportingSessionStarted());
-  EXPECT_TRUE(session->userInfo()->empty());
-  EXPECT_TRUE(session->messageTypeCounts()->empty());
-  ASSERT_TRUE(session->aggregatedPayloadData());
-  ASSERT_TRUE(session->nestedAggregatedPayloadData());
-  EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
-  EXPECT_FALSE(session->orientationCallbackID());
-  EXPECT_FALSE(session->startDate());
-  EXPECT_FALSE(session->livoReportingSession());
-  EXPECT_FALSE(session->driverSnapShot());
-  EXPECT_FALSE(session->transactionCompleteBlock());
-
-  auto queues = t_.dispatcher->CreatedQueues();
-  ASSERT_EQ(queues.size(), 1u);
-  EXPECT_EQ(queues[0].first, "com.norvel.quenta.session.livoreporting");
-  EXPECT_EQ(queues[0].second, QualityOfService::kUtility);
-  EXPECT_EQ(session->livoReportingQueue()->label(), "com.norvel.quenta.session.livoreporting");
-
-  auto lines = t_.log->Lines();
-  ASSERT_EQ(lines.size(), 1u);
-  EXPECT_THAT(lines[0].text, MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*initWithID.*: "
-                                          "created reporting session for ID: -7"));
-  EXPECT_EQ(lines[0].scope, "qnrr");
-  EXPECT_EQ(lines[0].level, LogLevel::kInfo);
-  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u));
-
-  session.reset();
-  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u, 0x21042834u));
-  EXPECT_THAT(t_.log->Matching("deallocing"),
-              ElementsAre(MatchesRegex(".*: deallocing this session -7")));
-  EXPECT_TRUE(t_.trace->AllArgumentsZero());
-}
-
-TEST_F(SessionTest, CreationNeedsLogAndDispatcher) {
-  auto bare = std::make_shared<Platform>();
-  EXPECT_FALSE(QNReportingSession::initWithID(bare, 1, {}));
-  EXPECT_FALSE(QNReportingSession::initWithID(nullptr, 1, {}));
-}
-
-TEST_F(SessionTest, SetServiceTypeStoresTypeAndName) {
-  auto session = NewSession();
-  session->setServiceType(2);
-  EXPECT_EQ(session->serviceType(), 2);
-  EXPECT_EQ(session->serviceName(), "telephony");
-  session->setServiceType(12);
-  EXPECT_EQ(session->serviceName(), "apiusage");
-  session->setServiceType(13);
-  EXPECT_EQ(session->serviceType(), 13);
-  EXPECT_EQ(session->serviceName(), "telephony");
-  session->setServiceType(65535);
-  EXPECT_EQ(session->serviceName(), "unknown");
-  EXPECT_THAT(t_.log->Matching("setting service type"),
-              ElementsAre(HasSubstr(": setting service type telephony"),
-                          HasSubstr(": setting service type apiusage"),
-                          HasSubstr(": setting service type telephony"),
-                          HasSubstr(": setting service type unknown")));
-}
-
 TEST_F(SessionTest, ConfigurationAndDefaultsMergeIntoUserInfo) {
   auto session = NewSession();
   session->setConfiguration(Payload({{"a", 1}, {"b", 2}}));
@@ -147,16 +81,6 @@ TEST_F(SessionTest, StartCreatesFrameworkSessionOnItsQueue) {
   // Backends answered at once: the wait saw the flag set and logged nothing.
   EXPECT_FALSE(t_.log->Contains("waiting for livoreportingd"));
   EXPECT_EQ(t_.dispatcher->PendingTimers(), 0);
-}
-
-TEST_F(SessionTest, ClientKeysMayReplaceFrameworkUserInfo) {
-  auto session = NewSession();
-  session->setConfiguration(Payload({{kLivoReportingUserInfoServiceName, "custom"}}));
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  ASSERT_EQ(t_.livo->Sessions().size(), 1u);
-  EXPECT_EQ(*t_.livo->Sessions()[0].user_info.Find(kLivoReportingUserInfoServiceName),
-            Value("custom"));
 }
 
 TEST_F(SessionTest, UnsetServiceTypeGivesUnknownSessionAndApiUsageFlags) {
@@ -272,21 +196,6 @@ TEST_F(SessionTest, LateBackendsReleaseQueuedDeliveries) {
   EXPECT_FALSE(t_.log->Contains("failed to find backend"));
 }
 
-TEST_F(SessionTest, StartTwiceIsRefused) {
-  auto session = NewSession();
-  session->start();
-  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
-  auto aggregated = session->aggregatedPayloadData();
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_THAT(t_.log->Matching("already started"),
-              ElementsAre(MatchesRegex(".*: 42 is already started")));
-  EXPECT_EQ(session->aggregatedPayloadData(), aggregated);
-  EXPECT_EQ(aggregated->Snapshot().size(), 1u);
-  EXPECT_EQ(t_.livo->Sessions().size(), 1u);
-  EXPECT_EQ(t_.trace->Count(0x2104282C), 1);
-}
-
 TEST_F(SessionTest, StopFlushesDropsAndClears) {
   t_.log->EnableDebug("qnrr");
   auto session = NewSession();
@@ -317,82 +226,6 @@ TEST_F(SessionTest, FlushErrorIsLogged) {
   t_.dispatcher->RunUntilIdle();
   EXPECT_THAT(t_.log->Matching("flush error"),
               ElementsAre(MatchesRegex(".*: flush error disk full")));
-}
-
-TEST_F(SessionTest, StopTwiceAndStopUnstartedDoNothingMore) {
-  t_.log->EnableDebug("qnrr");
-  auto never = NewSession(7);
-  never->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_EQ(t_.log->Count(": ending session 7"), 1);
-  EXPECT_EQ(t_.trace->Count(0x21042830), 0);
-  EXPECT_TRUE(never->aggregatedPayloadData());  // untouched
-
-  auto session = NewSession();
-  session->start();
-  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_EQ(t_.log->Count(": ending session 42"), 3);
-  EXPECT_EQ(t_.trace->Count(0x21042830), 1);
-  EXPECT_EQ(t_.log->Count("sending summary event"), 1);
-  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
-}
-
-TEST_F(SessionTest, RestartBeginsAFreshPeriodAndCountsContinue) {
-  auto session = NewSession();
-  session->start();
-  session->sendMessage(Payload({{"n", 1}}), 5, 1, nullptr);
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  ASSERT_TRUE(session->aggregatedPayloadData());
-  EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
-  EXPECT_TRUE(session->nestedAggregatedPayloadData()->Snapshot().empty());
-  session->sendMessage(Payload({{"n", 2}}), 5, 1, nullptr);
-  auto nested = session->nestedAggregatedPayloadData()->Snapshot();
-  ASSERT_EQ(nested.size(), 1u);
-  EXPECT_TRUE(nested[0].as_dictionary()->Contains("Setup_Start_2"));
-  EXPECT_EQ(t_.livo->Sessions().size(), 2u);
-  EXPECT_EQ(t_.livo->TokensMade(), 2);
-  EXPECT_EQ(*t_.livo->Sessions()[1].session_info.Find(kLivoReportingSessionInfoHierarchyToken),
-            Value(2));
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_EQ(t_.livo->Sessions()[1].messages.size(), 1u);
-}
-
-TEST_F(SessionTest, HeldPropertiesAreOnlyHeld) {
-  auto session = NewSession();
-  std::vector<bool> calls;
-  session->setTransactionCompleteBlock([&calls](bool ok) { calls.push_back(ok); });
-  session->setDriverSnapShot(std::make_shared<const Dictionary>(Dictionary{{"Speaker-(null)", 1}}));
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_TRUE(calls.empty());
-  ASSERT_TRUE(session->transactionCompleteBlock());
-  session->transactionCompleteBlock()(true);
-  EXPECT_THAT(calls, ElementsAre(true));
-  session->setTransactionCompleteBlock(nullptr);
-  EXPECT_FALSE(session->transactionCompleteBlock());
-  ASSERT_TRUE(session->driverSnapShot());
-  EXPECT_TRUE(session->driverSnapShot()->Contains("Speaker-(null)"));
-}
-
-TEST_F(SessionTest, QueuedWorkKeepsTheSessionAlive) {
-  t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kNever);
-  auto session = NewSession();
-  session->start();
-  session.reset();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_FALSE(t_.log->Contains("deallocing"));
-  t_.dispatcher->AdvanceBy(9s);
-  EXPECT_TRUE(t_.log->Contains("deallocing this session 42"));
 }
 
 }  // namespace

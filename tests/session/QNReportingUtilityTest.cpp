@@ -18,81 +18,7 @@ using testing::FakePlatform;
 using ::testing::MatchesRegex;
 using namespace std::chrono_literals;
 
-TEST(QNReportingUtilityTest, CategoryNames) {
-  EXPECT_EQ(QNReportingCategoryName(11), "Volume");
-  EXPECT_EQ(QNReportingCategoryName(0), "Undefined");
-  EXPECT_EQ(QNReportingCategoryName(1), "Generic");
-  EXPECT_EQ(QNReportingCategoryName(4), "PlaybackAndRecord");
-  EXPECT_EQ(QNReportingCategoryName(9), "Ostreling");
-  EXPECT_EQ(QNReportingCategoryName(10), "Performance");
-  EXPECT_EQ(QNReportingCategoryName(12), "Undefined");
-  EXPECT_EQ(QNReportingCategoryName(0xFFFF), "Undefined");
-  // Origins: one flag word each; anything else gives only the separator.
-  EXPECT_EQ(QNReportingCategoryName(0x80000009), "Toolbox_Ostreling");
-  EXPECT_EQ(QNReportingCategoryName(0x40000007), "Routing_RouteChange");
-  EXPECT_EQ(QNReportingCategoryName(0x20000003), "HAL_Playback");
-  EXPECT_EQ(QNReportingCategoryName(0x10000008), "DSP_Error");
-  EXPECT_EQ(QNReportingCategoryName(0x08000006), "Session_ClientRequest");
-  EXPECT_EQ(QNReportingCategoryName(0x30000001), "_Generic");
-  EXPECT_EQ(QNReportingCategoryName(0x00010002), "_Record");
-  EXPECT_EQ(QNReportingCategoryName(0x00FF0005), "_Setup");
-  EXPECT_EQ(QNReportingCategoryName(0x8000000C), "Toolbox_Undefined");
-  // All ones is not an origin: no prefix.
-  EXPECT_EQ(QNReportingCategoryName(0xFFFFFFFF), "Undefined");
-  EXPECT_EQ(QNReportingCategoryName(0xFFFFFFFE), "_Undefined");
-}
-
-TEST(QNReportingUtilityTest, TypeNames) {
-  const char* expected[] = {"Generic", "Start", "Stop", "Setup", "Error", "IssueDetector"};
-  for (std::uint16_t t = 0; t < 6; ++t) EXPECT_EQ(QNReportingTypeName(t), expected[t]);
-  EXPECT_EQ(QNReportingTypeName(6), "Undefined");
-  EXPECT_EQ(QNReportingTypeName(65534), "Undefined");
-  EXPECT_EQ(QNReportingTypeName(65535), "Unknown");
-}
-
-TEST(QNReportingUtilityTest, ServiceTypeNames) {
-  const char* expected[] = {"generic",          "vessa",         "telephony",
-                            "haptics",          "alarms",        "standalone",
-                            "soundautoconfig",  "longformaudio", "nonlongformaudio",
-                            "audiodeviceusage", "alerts",        "test",
-                            "apiusage"};
-  for (std::uint32_t t = 0; t < 13; ++t) EXPECT_EQ(QNReportingServiceTypeName(t), expected[t]);
-  EXPECT_EQ(QNReportingServiceTypeName(13), "telephony");
-  EXPECT_EQ(QNReportingServiceTypeName(65534), "telephony");
-  EXPECT_EQ(QNReportingServiceTypeName(65535), "unknown");
-  EXPECT_EQ(QNReportingServiceTypeName(65536), "telephony");
-  EXPECT_EQ(QNReportingServiceTypeName(0xFFFFFFFF), "telephony");
-}
-
-TEST(QNReportingUtilityTest, HostApplicationName) {
-  EXPECT_EQ(QNReportingHostApplicationName(static_cast<const Dictionary*>(nullptr)), "Unknown");
-  Dictionary empty;
-  EXPECT_EQ(QNReportingHostApplicationName(&empty), "Unknown");
-  Dictionary info{{"HostApplicationDisplayID", "org.example.player"}, {"other", 1}};
-  EXPECT_EQ(QNReportingHostApplicationName(&info), "org.example.player");
-  auto shared = std::make_shared<const Dictionary>(info);
-  EXPECT_EQ(QNReportingHostApplicationName(shared), "org.example.player");
-}
-
-TEST(QNReportingUtilityTest, InternalBuildAnswerReadAsBoolean) {
-  struct Case {
-    std::optional<Value> answer;
-    bool expected;
-  };
-  const Case cases[] = {{std::nullopt, false}, {Value(true), true},  {Value(false), false},
-                        {Value(1), true},      {Value(0), false},    {Value("YES"), true},
-                        {Value("true"), true}, {Value("no"), false}, {Value(""), false}};
-  for (const Case& c : cases) {
-    FakePlatform t;
-    if (c.answer) t.device_info->SetAnswer("InternalBuild", *c.answer);
-    EXPECT_EQ(QNReportingIsInternalBuild(*t.platform), c.expected)
-        << (c.answer ? c.answer->Description() : "(none)");
-  }
-  auto bare = std::make_shared<Platform>();  // no device information at all
-  EXPECT_FALSE(QNReportingIsInternalBuild(*bare));
-}
-
-TEST(QNReportingUtilityTest, InternalBuildAskedOncePerPlatformEvenWhenRacing) {
+TEST(QNReportingUtilityTest, InternalBuildAskedOnceEvenWhenRacing) {
   FakePlatform t;
   t.device_info->SetAnswer("InternalBuild", true);
   std::vector<std::thread> threads;
@@ -187,15 +113,6 @@ TEST_F(WaitTest, WakeWithoutFlagWaitsAFullNewPeriod) {
   t_.dispatcher->AdvanceBy(1ms);
   EXPECT_THAT(results_, ElementsAre(false));
   EXPECT_EQ(t_.log->Count("the thing never came"), 1);
-}
-
-TEST_F(WaitTest, NullLogGoesToDefaultLog) {
-  QNReportingUtilityWait(*t_.platform, condition_, done_, "w", "t", nullptr, 0.5,
-                         [this](bool ok) { results_.push_back(ok); });
-  t_.dispatcher->AdvanceBy(500ms);
-  EXPECT_THAT(results_, ElementsAre(false));
-  for (const auto& l : t_.log->Lines()) EXPECT_EQ(l.scope, "");
-  EXPECT_EQ(t_.log->Lines().size(), 2u);
 }
 
 }  // namespace
