@@ -35,30 +35,6 @@ std::unique_ptr<Client> Connect(const std::string& path) {
   return client;
 }
 
-TEST(LinuxIpcTest, RequestReachesTheExportedObjectAndTheReplyComesBack) {
-  ListenerHarness harness;
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-
-  EXPECT_EQ(client->createReportingSessionSync(42), true);
-  auto valid = client->reporterIDValidSync(-9);
-  ASSERT_TRUE(valid);
-  EXPECT_EQ(*valid, (Dictionary{{"reporterID", -9}, {"serviceType", 7}}));
-  EXPECT_EQ(client->getAllReportersSync(), (std::vector<std::int64_t>{1, 2, 3}));
-
-  auto accepted = harness.delegate().accepted();
-  ASSERT_EQ(accepted.size(), 1u);
-  auto object = accepted[0].object.lock();
-  ASSERT_TRUE(object);
-  auto calls = object->calls();
-  ASSERT_EQ(calls.size(), 3u);
-  EXPECT_EQ(calls[0].op, Op::kCreateReportingSession);
-  EXPECT_EQ(calls[0].args, (Array{42}));
-  EXPECT_EQ(calls[1].op, Op::kReporterIDValid);
-  EXPECT_EQ(calls[2].op, Op::kGetAllReporters);
-  EXPECT_TRUE(calls[2].args.empty());
-}
-
 TEST(LinuxIpcTest, SocketFileHasMode0660AndGoesAwayWhenStopped) {
   auto harness = std::make_unique<ListenerHarness>();
   const std::string path = harness->socket_path();

@@ -28,22 +28,6 @@ class BridgesTest : public ::testing::Test {
 
 // --- Analytics bridge ---------------------------------------------------------------------
 
-TEST_F(BridgesTest, StatlynEventNameAndHostApplication) {
-  auto session = SessionOf("com.example.player");
-  Dictionary message{{"route", "speaker"}, {"volume", 0.5}, {"HostApplicationDisplayID", "forged"}};
-  QNReportingStatlynBridge::handleEvent(*env_.platform, &message, 11, 2, session.get());
-
-  auto events = env_.analytics->Events();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].name, "com.norvel.quenta.Volume.Stop");
-  EXPECT_EQ(events[0].payload,
-            Value(Dictionary{{"route", "speaker"},
-                             {"volume", 0.5},
-                             {"HostApplicationDisplayID", "com.example.player"}}));
-  // The message's own host application is replaced; the caller's payload is not touched.
-  EXPECT_EQ(*message.Find("HostApplicationDisplayID"), Value("forged"));
-}
-
 TEST_F(BridgesTest, StatlynUsesOriginWordsAndUndefinedNames) {
   QNReportingStatlynBridge::handleEvent(*env_.platform, nullptr, 12, 7, nullptr);
   QNReportingStatlynBridge::handleEvent(*env_.platform, nullptr, 0x10000008, 1, nullptr);

@@ -14,17 +14,6 @@ using testing::Payload;
 using namespace std::chrono_literals;
 using SessionTest = testing::SessionFixture;
 
-TEST_F(SessionTest, ConfigurationAndDefaultsMergeIntoUserInfo) {
-  auto session = NewSession();
-  session->setConfiguration(Payload({{"a", 1}, {"b", 2}}));
-  auto before = session->userInfo();
-  session->updateDefaults(Payload({{"b", 3}, {"device_name", "box"}}));
-  session->setConfiguration(static_cast<const Dictionary*>(nullptr));
-  EXPECT_EQ(*session->userInfo(), (Dictionary{{"a", 1}, {"b", 3}, {"device_name", "box"}}));
-  // Earlier snapshots are not changed under their readers.
-  EXPECT_EQ(*before, (Dictionary{{"a", 1}, {"b", 2}}));
-}
-
 TEST_F(SessionTest, MessageIdentifiersCountPerPair) {
   auto session = NewSession();
   EXPECT_EQ(session->messageIdForCategory(5, 1), "Setup_Start_1");
@@ -34,53 +23,6 @@ TEST_F(SessionTest, MessageIdentifiersCountPerPair) {
   EXPECT_EQ(session->messageIdForCategory(0xFFFFFFFF, 0xFFFF), "Undefined_Unknown_1");
   EXPECT_EQ(*session->messageTypeCounts(),
             (Dictionary{{"Setup_Start", 3}, {"DSP_Error_Error", 1}, {"Undefined_Unknown", 1}}));
-}
-
-TEST_F(SessionTest, StartCreatesFrameworkSessionOnItsQueue) {
-  t_.log->EnableDebug("qnrr");
-  auto session = NewSession();
-  session->setServiceType(2);
-  session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.phone"}}));
-  session->start();
-  EXPECT_TRUE(session->started());
-  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u, 0x2104282Cu));
-  EXPECT_TRUE(t_.livo->Sessions().empty());  // the start sequence has not run yet
-
-  // Configuration that reaches the session before the start sequence copies it is kept.
-  session->setConfiguration(Payload({{"late", true}}));
-  t_.dispatcher->RunUntilIdle();
-
-  auto sessions = t_.livo->Sessions();
-  ASSERT_EQ(sessions.size(), 1u);
-  EXPECT_EQ(sessions[0].session_info,
-            (Dictionary{{kLivoReportingSessionInfoClientType, 19},
-                        {kLivoReportingSessionInfoClientVersion, 2.0},
-                        {kLivoReportingSessionInfoSessionID, 42},
-                        {kLivoReportingSessionInfoBatchEvent, true},
-                        {kLivoReportingSessionInfoHierarchyToken, 1},
-                        {kLivoReportingSessionInfoContainsRealtimeEvents, false}}));
-  EXPECT_TRUE(sessions[0].session_info.Find(kLivoReportingSessionInfoClientVersion)->kind() ==
-              Value::Kind::kDouble);
-  EXPECT_TRUE(sessions[0].session_info.Find(kLivoReportingSessionInfoBatchEvent)->is_bool());
-  EXPECT_EQ(sessions[0].user_info,
-            (Dictionary{{kLivoReportingUserInfoClientName, "com.norvel.quenta"},
-                        {kLivoReportingUserInfoServiceName, "telephony_session"},
-                        {"HostApplicationDisplayID", "org.example.phone"},
-                        {"late", true}}));
-  EXPECT_TRUE(sessions[0].frameworks_to_check.empty());
-  EXPECT_TRUE(sessions[0].configuration_started);
-  EXPECT_EQ(session->livoReportingSession() != nullptr, true);
-  ASSERT_TRUE(session->livoReportingAgentToken());
-  EXPECT_EQ(session->livoReportingAgentToken()->id, 1u);
-  EXPECT_FALSE(session->livoReportingSessionStarted());  // never set true on the record
-
-  EXPECT_EQ(t_.log->Count(": starting session owned by 42"), 1);
-  EXPECT_THAT(t_.log->Matching("List of backends"),
-              ElementsAre(MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*: List of backends "
-                                       "\\(\n    fake-backend\n\\)")));
-  // Backends answered at once: the wait saw the flag set and logged nothing.
-  EXPECT_FALSE(t_.log->Contains("waiting for livoreportingd"));
-  EXPECT_EQ(t_.dispatcher->PendingTimers(), 0);
 }
 
 TEST_F(SessionTest, UnsetServiceTypeGivesUnknownSessionAndApiUsageFlags) {

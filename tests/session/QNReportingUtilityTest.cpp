@@ -55,14 +55,6 @@ class WaitTest : public ::testing::Test {
   std::vector<bool> results_;
 };
 
-TEST_F(WaitTest, FlagAlreadySetCompletesAtOnceWithoutLogging) {
-  *done_ = true;
-  StartWait();
-  EXPECT_THAT(results_, ElementsAre(true));
-  EXPECT_TRUE(t_.log->Lines().empty());
-  EXPECT_EQ(t_.dispatcher->PendingTimers(), 0);
-}
-
 TEST_F(WaitTest, TimesOutWithErrorLine) {
   StartWait();
   EXPECT_TRUE(results_.empty());
@@ -79,24 +71,6 @@ TEST_F(WaitTest, TimesOutWithErrorLine) {
   EXPECT_THAT(lines[1].text, MatchesRegex("QNReportingUtility\\.cpp:[0-9]+:QNReportingUtilityWait: "
                                           "the thing never came"));
   EXPECT_EQ(lines[1].level, LogLevel::kError);
-}
-
-TEST_F(WaitTest, SignalWithFlagSetCompletesTrue) {
-  StartWait();
-  std::thread signaller([this] {
-    condition_->lock();
-    *done_ = true;
-    condition_->Signal();
-    condition_->unlock();
-  });
-  signaller.join();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_THAT(results_, ElementsAre(true));
-  EXPECT_THAT(Texts(), ElementsAre(::testing::HasSubstr(": waiting for the thing"),
-                                   MatchesRegex(".*:QNReportingUtilityWait: continuing")));
-  // The deadline of the finished wait no longer fires anything.
-  t_.dispatcher->AdvanceBy(20s);
-  EXPECT_EQ(results_.size(), 1u);
 }
 
 TEST_F(WaitTest, WakeWithoutFlagWaitsAFullNewPeriod) {
