@@ -57,48 +57,6 @@ TEST_F(FilesTest, CreatedDirectoriesGetExactlyTheModeDespiteTheUmask) {
   EXPECT_EQ(ModeOf(root_ + "/private/x"), 0700u);
 }
 
-TEST_F(FilesTest, RelativePathsWork) {
-  const fs::path cwd = fs::current_path();
-  fs::current_path(root_);
-  auto error = CreateDirectories("rel/sub", 0755);
-  fs::current_path(cwd);
-  EXPECT_FALSE(error);
-  EXPECT_TRUE(fs::is_directory(root_ + "/rel/sub"));
-}
-
-TEST_F(FilesTest, AComponentThatIsAFileFails) {
-  const std::string file = root_ + "/plain";
-  std::ofstream(file) << "x";
-  for (const std::string& path : {file, file + "/sub", file + "/sub/deeper"}) {
-    auto error = CreateDirectories(path, 0777);
-    ASSERT_TRUE(error) << path;
-    EXPECT_EQ(error->domain, "posix");
-    EXPECT_EQ(error->code, ENOTDIR);
-    EXPECT_NE(error->description.find(file), std::string::npos) << error->description;
-  }
-  EXPECT_FALSE(fs::exists(file + "/sub"));
-  EXPECT_TRUE(CreateDirectories("", 0777));
-}
-
-TEST_F(FilesTest, AtomicWriteCreatesAndReplaces) {
-  const std::string path = root_ + "/summary.json";
-  ASSERT_FALSE(WriteFileAtomically(path, "first"));
-  EXPECT_EQ(testing::ReadFileText(path), "first");
-  EXPECT_EQ(ModeOf(path), 0644u);  // 0666 less the umask
-  struct stat before;
-  ASSERT_EQ(stat(path.c_str(), &before), 0);
-
-  const std::string big(3 << 20, 'b');
-  ASSERT_FALSE(WriteFileAtomically(path, big));
-  EXPECT_EQ(testing::ReadFileText(path), big);
-  struct stat after;
-  ASSERT_EQ(stat(path.c_str(), &after), 0);
-  EXPECT_NE(before.st_ino, after.st_ino);  // a new file moved into place, not rewritten
-  ASSERT_FALSE(WriteFileAtomically(path, ""));
-  EXPECT_EQ(testing::ReadFileText(path), "");
-  EXPECT_EQ(Listing(root_), (std::vector<std::string>{"summary.json"}));  // no temporaries
-}
-
 TEST_F(FilesTest, AtomicWriteFailuresLeaveNothingBehind) {
   // Target is a directory: the rename fails after the temporary was written.
   ASSERT_FALSE(CreateDirectories(root_ + "/dir.json", 0755));
@@ -139,26 +97,6 @@ class ScopedTimeZone {
  private:
   std::optional<std::string> old_;
 };
-
-TEST(FormatLocalTimeTest, SummaryFileNamePattern) {
-  const Date when{1705325405.123};  // 2024-01-15 13:30:05.123 UTC
-  {
-    ScopedTimeZone zone("CET-1");
-    EXPECT_EQ(FormatLocalTime(when, "yyyyMMdd-HHmmssZ"), "20240115-143005+0100");
-  }
-  {
-    ScopedTimeZone zone("EST5");
-    EXPECT_EQ(FormatLocalTime(when, "yyyyMMdd-HHmmssZ"), "20240115-083005-0500");
-  }
-  {
-    ScopedTimeZone zone("IST-5:30");
-    EXPECT_EQ(FormatLocalTime(when, "yyyyMMdd-HHmmssZ"), "20240115-190005+0530");
-  }
-  ScopedTimeZone zone("UTC0");
-  EXPECT_EQ(FormatLocalTime(when, "yyyy-MM-dd'T'HH:mm:ss.SSS 'o''clock' yy''"),
-            "2024-01-15T13:30:05.123 o'clock 24'");
-  EXPECT_EQ(FormatLocalTime(Date{std::nan("")}, "yyyyMMdd-HHmmssZ"), "19700101-000000+0000");
-}
 
 }  // namespace
 }  // namespace qn

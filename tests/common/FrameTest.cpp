@@ -50,12 +50,6 @@ std::vector<Value> FeedInPieces(FrameDecoder& decoder, std::string_view stream,
   return out;
 }
 
-TEST(FrameTest, HeaderIsTheBigEndianBodyLength) {
-  std::string buffer = "prefix";
-  ASSERT_TRUE(AppendFrame(buffer, Value(Array{1, 2})));
-  EXPECT_EQ(buffer, "prefix" + Header(3) + "\x92\x01\x02");
-}
-
 TEST(FrameTest, AnyChunkingYieldsEveryBodyInOrder) {
   const std::string stream = SampleStream() + SampleStream();
   std::vector<Value> expected = SampleValues();
@@ -72,28 +66,6 @@ TEST(FrameTest, AnyChunkingYieldsEveryBodyInOrder) {
     EXPECT_FALSE(decoder.error());
     EXPECT_EQ(decoder.buffered(), 0u);
   }
-}
-
-TEST(FrameTest, HoldsOnlyWhatIsNotYetConsumed) {
-  std::string stream = SampleStream();
-  FrameDecoder decoder;
-  decoder.Feed(stream);
-  int frames = 0;
-  while (decoder.Next()) ++frames;
-  EXPECT_EQ(frames, 5);
-  EXPECT_EQ(decoder.buffered(), 0u);
-  // A partial frame stays; consumed frames before it are dropped.
-  std::string two;
-  AppendFrame(two, Value(1));
-  AppendFrame(two, Value(2));
-  decoder.Feed(std::string_view(two).substr(0, two.size() - 1));
-  EXPECT_TRUE(decoder.Next());
-  EXPECT_FALSE(decoder.Next());
-  EXPECT_EQ(decoder.buffered(), 4u);  // the second frame's header, its body byte missing
-  decoder.Feed(two.substr(two.size() - 1));
-  auto body = decoder.Next();
-  ASSERT_TRUE(body);
-  EXPECT_EQ(*body, "\x02");
 }
 
 TEST(FrameTest, ZeroLengthIsAPermanentError) {
@@ -144,15 +116,6 @@ TEST(FrameTest, ExactlyTheMaximumIsAccepted) {
   ASSERT_TRUE(body);
   EXPECT_EQ(body->size(), kMaxBodyBytes);
   EXPECT_EQ(body->back(), 'b');
-}
-
-TEST(FrameTest, AppendRefusesABodyOverTheMaximum) {
-  std::string buffer = "keep";
-  EXPECT_FALSE(AppendFrame(buffer, Value(std::string(kMaxBodyBytes, 'x'))));
-  EXPECT_EQ(buffer, "keep");
-  // A string of kMaxBodyBytes - 5 bytes plus its 5-byte str32 header is exactly the maximum.
-  EXPECT_TRUE(AppendFrame(buffer, Value(std::string(kMaxBodyBytes - 5, 'x'))));
-  EXPECT_EQ(buffer.size(), 4 + 4 + kMaxBodyBytes);
 }
 
 }  // namespace

@@ -147,27 +147,5 @@ TEST(ProtocolTest, IntegersMustFitTheirKind) {
             "18446744073709551615) (request 9)");
 }
 
-TEST(ProtocolTest, AnyIntegerEncodingThatFitsIsAccepted) {
-  // [2, 1, 5 as int64, 42 as uint64]: setServiceType with wide encodings.
-  const std::string body("\x94\x02\x01\xd3\0\0\0\0\0\0\0\x05\xcf\0\0\0\0\0\0\0\x2a", 21);
-  auto decoded = DecodeMsgPack(body);
-  ASSERT_TRUE(std::holds_alternative<Value>(decoded));
-  RequestHeader header = MustPass(std::get<Value>(decoded));
-  EXPECT_EQ(header.op, Op::kSetServiceType);
-}
-
-TEST(ProtocolTest, ConnectionErrorFrameBody) {
-  Value error = MakeConnectionError(ConnectionError::kUnknownOp, "unknown op 12");
-  Value expected(Array{
-      0,
-      Dictionary{{"domain", "com.norvel.quenta.ipc"}, {"code", 5}, {"message", "unknown op 12"}}});
-  EXPECT_EQ(error, expected);
-  // Key order is part of the frame.
-  const Dictionary& map = *(*error.as_array())[1].as_dictionary();
-  std::vector<std::string> keys;
-  for (const auto& [k, v] : map) keys.push_back(*k.as_string());
-  EXPECT_EQ(keys, (std::vector<std::string>{"domain", "code", "message"}));
-}
-
 }  // namespace
 }  // namespace qn::protocol

@@ -32,16 +32,7 @@ class DriverUtilityTest : public ::testing::Test {
   std::shared_ptr<const Platform> platform_;
 };
 
-TEST_F(DriverUtilityTest, DescriptionsPrintAbsentNamesAsNull) {
-  EXPECT_EQ(QNReportingDriver::driverWithGroupName(std::nullopt, "MCA")->Description(),
-            "(null)-MCA");
-  EXPECT_EQ(QNReportingDriver::driverWithGroupName("NorvelKT5MCA", std::nullopt)->Description(),
-            "NorvelKT5MCA-(null)");
-  EXPECT_EQ(QNReportingDriver::driverWithGroupName("Haptics", "Stats")->Description(),
-            "Haptics-Stats");
-}
-
-TEST_F(DriverUtilityTest, DeviceWithoutDriversSubscribesNothingAndReportsNothing) {
+TEST_F(DriverUtilityTest, NoDriversSubscribesAndReportsNothing) {
   // Speaker exists but has no channels; the other three groups are unknown to the library.
   ostrel_->AddGroup("Speaker", "Amp");
   auto utility = Make();
@@ -61,7 +52,7 @@ TEST_F(DriverUtilityTest, DeviceWithoutDriversSubscribesNothingAndReportsNothing
   }
 }
 
-TEST_F(DriverUtilityTest, LookupErrorIsLoggedButReturnedChannelsAreStillSubscribed) {
+TEST_F(DriverUtilityTest, LookupErrorIsLoggedChannelsStillSubscribed) {
   ostrel_->SetCounter("Haptics", "Stats", "on_time", 3);
   ostrel_->FailLookup(std::string("Haptics"), std::string("Stats"), 42, true);
   auto utility = Make();
@@ -96,7 +87,7 @@ TEST_F(DriverUtilityTest, DeltaReportsOnlyCountersThatGrew) {
   EXPECT_EQ(log_->Count("getting latest samples"), 4);  // two lines per driver
 }
 
-TEST_F(DriverUtilityTest, WithoutSnapshotOrWithoutTheDriverInItAbsoluteValuesAreReported) {
+TEST_F(DriverUtilityTest, NoSnapshotOfTheDriverGivesAbsoluteValues) {
   ostrel_->SetCounter("Speaker", "Amp", "underruns", 5);
   ostrel_->SetCounter("Speaker", "Amp", "idle", 0);
   auto utility = Make();
@@ -132,13 +123,6 @@ TEST_F(DriverUtilityTest, SamplingFailureLeavesTheDriverOut) {
   EXPECT_EQ(delta->size(), 1u);
   EXPECT_EQ(At(*delta, "Haptics_Stats_on_time"), 4);
   EXPECT_EQ(log_->Count("OstrelCreateSamples error 5"), 2);
-}
-
-TEST_F(DriverUtilityTest, NothingPositiveAnywhereGivesNoDelta) {
-  ostrel_->SetCounter("Speaker", "Amp", "underruns", 5);
-  auto utility = Make();
-  Dictionary snapshot = utility.getSnapShot();
-  EXPECT_FALSE(utility.getDriverStatisticsRelativeToSnapShot(&snapshot).has_value());
 }
 
 }  // namespace

@@ -78,9 +78,9 @@ TEST_F(BadInputTest, EachKindGetsItsErrorFrameAndOnlyThatConnectionCloses) {
   const std::pair<std::string, ConnectionError> cases[] = {
       // "this" read as a length is far over the limit.
       {"this is not a frame at all\n", ConnectionError::kBadLength},
-      {std::string("\x00\x10\x00\x01", 4) + std::string(4096, 'x'), ConnectionError::kBadLength},
+      {std::string("\x00\x10\x00\x01", 4).append(4096, 'x'), ConnectionError::kBadLength},
       {RawConnection::RawFrame(std::string("\x92\x01", 2)), ConnectionError::kBadMessagePack},
-      {RawConnection::RawFrame(std::string(1000, '\x91') + "\xc0"), ConnectionError::kTooDeep},
+      {RawConnection::RawFrame(std::string(1000, '\x91').append("\xc0")), ConnectionError::kTooDeep},
       {RawConnection::Frame(Value("hello")), ConnectionError::kBadRequest},
       {RawConnection::Frame(Value(Array{12, 1})), ConnectionError::kUnknownOp},
       {RawConnection::Frame(Value(Array{2, 1, 70000, 5})), ConnectionError::kBadArguments},

@@ -15,6 +15,7 @@
 #include "common/Value.h"
 #include "platform/linux/reporting_store_reader.h"
 #include "qnreporting/Client.h"
+#include "tests/fakes/RawConnection.h"
 #include "tests/fakes/TempDir.h"
 
 namespace qn::e2e {
@@ -106,35 +107,6 @@ Value Json(const std::string& text);
 std::vector<ReportingStoreRow> AnalyticsNamed(const std::vector<ReportingStoreRow>& rows,
                                               const std::string& name);
 
-// A raw connection to the daemon's socket, for bytes the client library would never send.
-class RawConnection {
- public:
-  explicit RawConnection(const std::string& socket_path, int receive_buffer = 0);
-  ~RawConnection();
-  bool connected() const { return fd_ >= 0; }
-
-  // Writes every byte (false when the peer closed first).
-  bool Write(const std::string& bytes);
-  // One frame: [4-byte big-endian length][MessagePack body].
-  static std::string Frame(const Value& body);
-  static std::string RawFrame(const std::string& body);
-
-  // The next decoded frame; nullopt when the peer closed or `timeout` passed first.
-  std::optional<Value> ReadFrame(std::chrono::milliseconds timeout = kPatience);
-  // Reads until the peer closes or `timeout` passes; returns the decoded frames read and
-  // sets *closed when the peer closed.
-  std::vector<Value> ReadUntilClosed(bool* closed, std::chrono::milliseconds timeout = kPatience);
-  // Waits, without reading, until the peer has closed its end.
-  bool WaitForPeerClose(std::chrono::milliseconds timeout = kPatience);
-
- private:
-  // Receives once (waiting at most until `deadline`) and decodes what came. Returns false
-  // when the peer closed or the deadline passed.
-  bool Receive(std::chrono::steady_clock::time_point deadline, bool* closed);
-
-  int fd_ = -1;
-  FrameDecoder decoder_;
-  std::vector<Value> pending_;  // decoded, not yet returned
-};
+using testing::RawConnection;
 
 }  // namespace qn::e2e

@@ -33,7 +33,7 @@ const Value* Field(const Value& dictionary, const char* key) {
   return d ? d->Find(key) : nullptr;
 }
 
-TEST(SessionFlowTest, CreateTypeConfigureStartSendStopDestroyLandsInTheStore) {
+TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   testing::TempDir stats;
   const std::string counter = stats.path() + "/Speaker/Main/frames";
   WriteCounter(counter, 10);  // the daemon subscribes to its drivers at start-up
@@ -113,54 +113,6 @@ TEST(SessionFlowTest, CreateTypeConfigureStartSendStopDestroyLandsInTheStore) {
   EXPECT_EQ(*Field(uptime_payload, "processName"), Value(OwnCommandName()));
   ASSERT_TRUE(Field(uptime_payload, "seconds"));
   EXPECT_GE(Field(uptime_payload, "seconds")->as_double().value_or(-1), 0.0);
-}
-
-TEST(SessionFlowTest, ClientsSharingAnIDAndTheQueries) {
-  Daemon daemon;
-  ASSERT_TRUE(daemon.started());
-  auto first = daemon.Connect();
-  auto second = daemon.Connect();
-  auto third = daemon.Connect();
-  ASSERT_TRUE(first && second && third);
-
-  EXPECT_EQ(first->createReportingSessionSync(7), true);
-  EXPECT_EQ(first->setServiceTypeSync(2, 7), true);
-  EXPECT_EQ(first->createReportingSessionSync(3), true);
-  EXPECT_EQ(second->createReportingSessionSync(7), true);
-  EXPECT_EQ(second->setServiceTypeSync(4, 7), true);
-  EXPECT_EQ(second->createReportingSessionSync(1), true);
-
-  // Another client's lookup finds the first-connected client's session.
-  EXPECT_EQ(third->reporterIDValidSync(7), (Dictionary{{"reporterID", 7}, {"serviceType", 2}}));
-  EXPECT_EQ(second->reporterIDValidSync(7), (Dictionary{{"reporterID", 7}, {"serviceType", 4}}));
-  EXPECT_EQ(third->reporterIDValidSync(99),
-            (Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
-  EXPECT_EQ(third->getServiceNameForReporterIDSync(7), 2);
-  EXPECT_THAT(*third->getAllReportersSync(), ElementsAre(7, 3, 7, 1));
-
-  // ID 0: two replies to one request.
-  std::mutex mu;
-  std::vector<std::uint16_t> names;
-  third->getServiceNameForReporterID(0, [&](std::uint16_t type) {
-    std::lock_guard lock(mu);
-    names.push_back(type);
-  });
-  ASSERT_TRUE(third->WaitForReplies());
-  {
-    std::lock_guard lock(mu);
-    EXPECT_THAT(names, ElementsAre(65535, 65535));
-  }
-
-  // Once the first client has gone, the second one's session answers.
-  first.reset();
-  Dictionary answer;
-  for (auto deadline = std::chrono::steady_clock::now() + kPatience;
-       std::chrono::steady_clock::now() < deadline;) {
-    answer = third->reporterIDValidSync(7).value_or(Dictionary{});
-    if (answer == Dictionary{{"reporterID", 7}, {"serviceType", 4}}) break;
-  }
-  EXPECT_EQ(answer, (Dictionary{{"reporterID", 7}, {"serviceType", 4}}));
-  EXPECT_THAT(*third->getAllReportersSync(), ElementsAre(7, 1));
 }
 
 TEST(SessionFlowTest, BroadcastWithoutAStartedSessionIsOneStandaloneMessage) {

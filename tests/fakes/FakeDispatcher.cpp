@@ -102,13 +102,9 @@ FakeDispatcher::FakeDispatcher()
 FakeDispatcher::~FakeDispatcher() = default;
 
 std::shared_ptr<SerialQueue> FakeDispatcher::CreateSerialQueue(std::string label,
-                                                               QualityOfService qos) {
+                                                               QualityOfService) {
   auto state = std::make_shared<QueueState>();
-  state->label = label;
-  {
-    std::lock_guard g(mu_);
-    created_.emplace_back(std::move(label), qos);
-  }
+  state->label = std::move(label);
   return std::make_shared<FakeSerialQueue>(*this, std::move(state));
 }
 
@@ -227,24 +223,9 @@ void FakeDispatcher::AdvanceBy(Duration d) {
   RunUntilIdle();
 }
 
-bool FakeDispatcher::HasReadyTasks() const {
-  std::lock_guard g(mu_);
-  return !ready_.empty();
-}
-
 int FakeDispatcher::PendingTimers() const {
   std::lock_guard g(mu_);
   return static_cast<int>(timers_.size());
-}
-
-std::vector<std::pair<std::string, QualityOfService>> FakeDispatcher::CreatedQueues() const {
-  std::lock_guard g(mu_);
-  return created_;
-}
-
-int FakeDispatcher::CreatedConditions() const {
-  std::lock_guard g(mu_);
-  return static_cast<int>(conditions_.size());
 }
 
 void FakeDispatcher::WakeAllConditions() {

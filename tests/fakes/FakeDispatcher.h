@@ -34,12 +34,8 @@ class FakeDispatcher final : public Dispatcher {
   int RunUntilIdle();
   // Advances the clock by `d`, firing due timers in order (running ready tasks after each).
   void AdvanceBy(Duration d);
-  // Whether any task is ready to run now, or any timer is pending.
-  bool HasReadyTasks() const;
+  // Timers not yet fired.
   int PendingTimers() const;
-  // Labels and quality-of-service classes of the queues created so far.
-  std::vector<std::pair<std::string, QualityOfService>> CreatedQueues() const;
-  int CreatedConditions() const;
   // Wakes every waiting condition as a signal would (without anyone setting a flag): a
   // spurious wake-up, as a framework that wakes its waiter without result would cause.
   void WakeAllConditions();
@@ -67,7 +63,6 @@ class FakeDispatcher final : public Dispatcher {
   SteadyTime now_;
   std::chrono::system_clock::time_point wall_start_;
   SteadyTime steady_start_;
-  std::vector<std::pair<std::string, QualityOfService>> created_;
   std::vector<std::weak_ptr<ConditionState>> conditions_;
 };
 

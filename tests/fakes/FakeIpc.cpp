@@ -65,14 +65,6 @@ std::vector<FakeIpcConnection::Reply> FakeIpcConnection::Replies() const {
   return shared_->replies;
 }
 
-std::vector<Value> FakeIpcConnection::RepliesFor(std::uint32_t request_id) const {
-  std::vector<Value> out;
-  for (auto& reply : Replies()) {
-    if (reply.request_id == request_id) out.push_back(reply.result);
-  }
-  return out;
-}
-
 void FakeIpcConnection::Interrupt() {
   std::function<void()> handler;
   {

@@ -46,8 +46,6 @@ class FakeIpcConnection final : public IpcConnection {
   // REQUIRES: an exported object is set.
   void Request(protocol::Op op, Array args, std::uint32_t request_id);
   std::vector<Reply> Replies() const;
-  // The results replied for `request_id`, in order.
-  std::vector<Value> RepliesFor(std::uint32_t request_id) const;
 
   // Calls the interruption handler (the connection stays open).
   void Interrupt();

@@ -142,17 +142,6 @@ void FakeLivoReporting::SetDiscovery(Discovery mode, Duration late_delay) {
   state_->late_delay = late_delay;
 }
 
-void FakeLivoReporting::SetBackends(Array backends) {
-  std::lock_guard lock(state_->mu);
-  state_->backends = std::move(backends);
-}
-
-void FakeLivoReporting::FailSessionSends(bool fail, std::optional<Error> error) {
-  std::lock_guard lock(state_->mu);
-  state_->fail_session_sends = fail;
-  state_->session_send_error = std::move(error);
-}
-
 void FakeLivoReporting::FailSingleSends(bool fail, std::optional<Error> error) {
   std::lock_guard lock(state_->mu);
   state_->fail_single_sends = fail;

@@ -60,9 +60,7 @@ class FakeLivoReporting final : public LivoReporting {
 
   // Settings (take effect for later calls).
   void SetDiscovery(Discovery mode, Duration late_delay = Duration::zero());
-  void SetBackends(Array backends);
   // A failing SendMessage / SendOneMessage returns false, with `error` when given.
-  void FailSessionSends(bool fail, std::optional<Error> error = std::nullopt);
   void FailSingleSends(bool fail, std::optional<Error> error = std::nullopt);
   void FailFlushes(std::optional<Error> error);
 

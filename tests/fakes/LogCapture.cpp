@@ -59,12 +59,6 @@ int LogCapture::CountLocked(std::string_view needle) const {
   return n;
 }
 
-bool LogCapture::WaitForCount(std::string_view needle, int count,
-                              std::chrono::seconds patience) const {
-  std::unique_lock lock(mu_);
-  return written_.wait_for(lock, patience, [&] { return CountLocked(needle) >= count; });
-}
-
 std::vector<std::string> LogCapture::Matching(std::string_view needle) const {
   std::lock_guard lock(mu_);
   std::vector<std::string> out;
@@ -72,12 +66,6 @@ std::vector<std::string> LogCapture::Matching(std::string_view needle) const {
     if (l.text.find(needle) != std::string::npos) out.push_back(l.text);
   }
   return out;
-}
-
-int LogCapture::Registrations(const std::string& code_string) const {
-  std::lock_guard lock(mu_);
-  auto it = registrations_.find(code_string);
-  return it == registrations_.end() ? 0 : it->second;
 }
 
 void LogCapture::Clear() {

@@ -38,13 +38,8 @@ class LogCapture final : public Log {
   // Number of lines whose text contains `needle`.
   int Count(std::string_view needle) const;
   bool Contains(std::string_view needle) const { return Count(needle) > 0; }
-  // Waits until `count` lines contain `needle`; false when `patience` ran out first (it only
-  // bounds a failing test).
-  bool WaitForCount(std::string_view needle, int count, std::chrono::seconds patience) const;
   // Texts of the lines that contain `needle`, in order.
   std::vector<std::string> Matching(std::string_view needle) const;
-  // How many times RegisterScope was called for a code.
-  int Registrations(const std::string& code_string) const;
   void Clear();
 
  private:

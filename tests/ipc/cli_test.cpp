@@ -12,54 +12,13 @@
 namespace qn::testing {
 namespace {
 
-using qnreport::Command;
 using qnreport::ParseCommand;
-using Kind = Command::Kind;
-
-Command Parsed(std::string_view line) {
-  auto result = ParseCommand(line);
-  if (auto* problem = std::get_if<std::string>(&result)) {
-    ADD_FAILURE() << line << ": " << *problem;
-    return {};
-  }
-  return std::get<Command>(result);
-}
 
 std::string Problem(std::string_view line) {
   auto result = ParseCommand(line);
   if (auto* problem = std::get_if<std::string>(&result)) return *problem;
   ADD_FAILURE() << line << " was accepted";
   return {};
-}
-
-TEST(QnreportParseTest, ReporterIDCommands) {
-  EXPECT_EQ(Parsed("create 42").kind, Kind::kCreate);
-  EXPECT_EQ(Parsed("  destroy\t-9223372036854775808 ").reporterID, INT64_MIN);
-  EXPECT_EQ(Parsed("valid 0x10").reporterID, 16);
-  Command type = Parsed("type 42 65535");
-  EXPECT_EQ(type.kind, Kind::kType);
-  EXPECT_EQ(type.reporterID, 42);
-  EXPECT_EQ(type.serviceType, 65535);
-  EXPECT_EQ(Parsed("").kind, Kind::kNothing);
-  EXPECT_EQ(Parsed("# create 1").kind, Kind::kNothing);
-}
-
-TEST(QnreportParseTest, JsonArgumentsMayHoldBlanksAndBrackets) {
-  Command config = Parsed(R"(config 7 {"a": [1, {"b": "}"}], "c": "x \" ] y"})");
-  EXPECT_EQ(config.kind, Kind::kConfig);
-  EXPECT_EQ(config.reporterID, 7);
-  Value expected;
-  ASSERT_FALSE(ParseJson(R"({"a": [1, {"b": "}"}], "c": "x \" ] y"})", expected));
-  EXPECT_EQ(config.payload, expected);
-
-  Command send = Parsed(R"(send {"route": "speaker"} 0xFFFFFFFF 65535 [1, -2, 3])");
-  EXPECT_EQ(send.kind, Kind::kSend);
-  EXPECT_EQ(send.category, 0xFFFFFFFFu);
-  EXPECT_EQ(send.type, 65535);
-  EXPECT_EQ(send.reporterIDs, (std::vector<std::int64_t>{1, -2, 3}));
-  EXPECT_EQ(Parsed("send {} 5 1 42,43").reporterIDs, (std::vector<std::int64_t>{42, 43}));
-  EXPECT_EQ(Parsed("send {} 5 1 []").reporterIDs, std::vector<std::int64_t>{});
-  EXPECT_FALSE(Parsed("send {} 5 1").reporterIDs.has_value());
 }
 
 TEST(QnreportParseTest, BadLinesSayWhatIsWrong) {
@@ -141,27 +100,6 @@ reporters
   EXPECT_EQ(replies, expected) << out.str();
   // One connection served all of it.
   EXPECT_EQ(harness.delegate().accepted().size(), 1u);
-}
-
-TEST(QnreportShellTest, ConnectionErrorAndEndAreReported) {
-  std::atomic<bool> asked{false};
-  ListenerHarness harness([&](protocol::Op, const Array&, IpcReply) { asked = true; });
-  std::string error;
-  auto client = client::Client::Connect(harness.socket_path(), &error);
-  ASSERT_TRUE(client) << error;
-  // The listener stops once the create arrived; its reply never comes.
-  std::istringstream in("create 1\n");
-  std::ostringstream out;
-  std::thread stopper([&] {
-    EXPECT_TRUE(Eventually([&] { return asked.load(); }));
-    harness.Stop();
-  });
-  EXPECT_EQ(qnreport::RunShell(*client, in, out, std::chrono::seconds(20)), 1)
-      << "the create reply never came";
-  stopper.join();
-  auto lines = JsonLines(out.str());
-  ASSERT_FALSE(lines.empty()) << out.str();
-  EXPECT_EQ(lines.front(), Json(R"({"event":"closed"})")) << out.str();
 }
 
 }  // namespace

@@ -28,51 +28,6 @@ TEST(ClientTest, ConnectToAMissingSocketFailsWithAReason) {
   EXPECT_NE(error.find(dir.path() + "/nothing.sock"), std::string::npos) << error;
 }
 
-TEST(ClientTest, TypedOperationsDecodeTheirReplies) {
-  ListenerHarness harness([](Op op, const Array& args, IpcReply reply) {
-    switch (op) {
-      case Op::kSendMessage:
-        if (args[1] == Value(1)) {
-          reply(Value(Dictionary{
-              {"domain", "com.norvel.audio.reporting"}, {"code", 1}, {"userInfo", Value()}}));
-        } else {
-          reply(Value());
-        }
-        return;
-      case Op::kGetServiceNameForReporterID:
-        reply(Value(65535));
-        return;
-      default:
-        FakeExportedObject::DefaultReply(op, args, reply);
-    }
-  });
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-  EXPECT_EQ(client->setServiceTypeSync(2, 42), true);
-  EXPECT_EQ(client->setConfigurationSync(Value(Dictionary{{"k", "v"}}), 42), true);
-  EXPECT_EQ(client->startReportingSessionForIDSync(42), true);
-  EXPECT_EQ(client->stopReportingSessionForIDSync(42), true);
-  EXPECT_EQ(client->destroyReportingSessionSync(42), true);
-  EXPECT_EQ(client->getServiceNameForReporterIDSync(42), 65535);
-
-  auto ok = client->sendMessageSync(Value(Dictionary{{"a", 1}}), 5, 1, std::nullopt);
-  ASSERT_TRUE(ok);
-  EXPECT_FALSE(ok->has_value());
-  auto refused = client->sendMessageSync(Value(Dictionary{}), 1, 1, std::vector<std::int64_t>{});
-  ASSERT_TRUE(refused && refused->has_value());
-  EXPECT_EQ((*refused)->domain, "com.norvel.audio.reporting");
-  EXPECT_EQ((*refused)->code, 1);
-  EXPECT_TRUE((*refused)->userInfo.is_null());
-
-  // What went on the wire, argument by argument.
-  auto calls = harness.delegate().accepted()[0].object.lock()->calls();
-  ASSERT_GE(calls.size(), 8u);
-  EXPECT_EQ(calls[0].args, (Array{2, 42}));
-  EXPECT_EQ(calls[1].args, (Array{Dictionary{{"k", "v"}}, 42}));
-  EXPECT_EQ(calls[6].args, (Array{Dictionary{{"a", 1}}, 5, 1, Value()}));
-  EXPECT_EQ(calls[7].args, (Array{Dictionary{}, 1, 1, Array{}}));
-}
-
 TEST(ClientTest, WrongResultTypeEndsTheConnectionWithALocalError) {
   ListenerHarness harness([](Op, const Array&, IpcReply reply) { reply(Value("yes")); });
   auto client = Connect(harness.socket_path());
@@ -123,20 +78,6 @@ TEST(ClientTest, BlockingCallFromACallbackReturnsInsteadOfDeadlocking) {
   EXPECT_EQ(future.get(), std::nullopt);
 }
 
-TEST(ClientTest, ClientDestroyedFromItsOwnCallback) {
-  ListenerHarness harness;
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-  std::promise<void> done;
-  Client* raw = client.release();
-  raw->createReportingSession(1, [&, raw](bool) {
-    delete raw;
-    done.set_value();
-  });
-  ASSERT_EQ(done.get_future().wait_for(std::chrono::seconds(20)), std::future_status::ready);
-  EXPECT_TRUE(Eventually([&] { return harness.delegate().invalidations() == 1; }));
-}
-
 TEST(ClientTest, RequestTooLargeForAFrameIsNotSent) {
   ListenerHarness harness;
   auto client = Connect(harness.socket_path());
@@ -145,47 +86,6 @@ TEST(ClientTest, RequestTooLargeForAFrameIsNotSent) {
   EXPECT_EQ(client->sendMessage(huge, 1, 1, std::nullopt, nullptr), 0u);
   EXPECT_EQ(client->outstanding(), 0u);
   EXPECT_EQ(client->createReportingSessionSync(1), true);
-}
-
-TEST(ClientTest, ManyThreadsShareOneClient) {
-  ListenerHarness harness;
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-  std::atomic<int> replies{0};
-  std::vector<std::thread> threads;
-  for (int t = 0; t < 4; ++t) {
-    threads.emplace_back([&, t] {
-      for (int i = 0; i < 250; ++i) {
-        const std::int64_t id = t * 1000 + i;
-        if (i % 50 == 0) {
-          auto d = client->reporterIDValidSync(id);
-          if (d && d->Find("reporterID")->as_int64() == id) ++replies;
-        } else {
-          client->reporterIDValid(id, [&, id](const Dictionary& d) {
-            if (d.Find("reporterID")->as_int64() == id) ++replies;
-          });
-        }
-      }
-    });
-  }
-  for (auto& t : threads) t.join();
-  ASSERT_TRUE(client->WaitForReplies(std::chrono::seconds(60)));
-  EXPECT_EQ(replies, 1000);
-}
-
-TEST(ClientTest, FlushWritesQueuedRequestsBeforeClose) {
-  std::atomic<int> kills{0};
-  ListenerHarness harness([&](Op op, const Array&, IpcReply) {
-    if (op == Op::kKillService) ++kills;
-  });
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-  for (int i = 0; i < 100; ++i) client->killService();  // no replies expected
-  EXPECT_EQ(client->outstanding(), 0u);
-  EXPECT_TRUE(client->Flush());
-  client->Close();
-  EXPECT_TRUE(Eventually([&] { return harness.delegate().invalidations() == 1; }));
-  EXPECT_EQ(kills, 100);
 }
 
 }  // namespace

@@ -9,22 +9,6 @@
 
 namespace qn::testing {
 
-TempDir::TempDir() {
-  const char* base = std::getenv("TMPDIR");
-  std::string pattern = std::string(base && *base ? base : "/tmp") + "/qn-ipc-XXXXXX";
-  char* made = ::mkdtemp(pattern.data());
-  if (made == nullptr) {
-    ADD_FAILURE() << "mkdtemp failed";
-    return;
-  }
-  path_ = made;
-}
-
-TempDir::~TempDir() {
-  std::error_code ignored;
-  if (!path_.empty()) std::filesystem::remove_all(path_, ignored);
-}
-
 bool Eventually(const std::function<bool()>& condition, std::chrono::milliseconds timeout) {
   const auto deadline = std::chrono::steady_clock::now() + timeout;
   while (!condition()) {
@@ -140,68 +124,5 @@ int BindUnixSocket(int type, const std::string& path) {
   }
   return fd;
 }
-
-RawSocket::RawSocket(const std::string& path) {
-  fd_ = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
-  if (!path.empty()) Connect(path);
-}
-
-bool RawSocket::Connect(const std::string& path) {
-  sockaddr_un address{};
-  address.sun_family = AF_UNIX;
-  std::snprintf(address.sun_path, sizeof address.sun_path, "%s", path.c_str());
-  connected_ = ::connect(fd_, reinterpret_cast<sockaddr*>(&address), sizeof address) == 0;
-  return connected_;
-}
-
-RawSocket::~RawSocket() {
-  if (fd_ >= 0) ::close(fd_);
-}
-
-void RawSocket::Send(const std::string& bytes) {
-  std::size_t sent = 0;
-  while (sent < bytes.size()) {
-    ssize_t n = ::send(fd_, bytes.data() + sent, bytes.size() - sent, MSG_NOSIGNAL);
-    if (n < 0 && errno == EINTR) continue;
-    if (n <= 0) return;  // the service may already have closed us; the test checks the rest
-    sent += static_cast<std::size_t>(n);
-  }
-}
-
-void RawSocket::ShutdownWrite() { ::shutdown(fd_, SHUT_WR); }
-
-std::vector<Value> RawSocket::ReadUntilEnd(bool* clean_end) {
-  std::vector<Value> frames;
-  FrameDecoder decoder;
-  bool clean = false;
-  char buffer[65536];
-  while (true) {
-    pollfd p{fd_, POLLIN, 0};
-    if (::poll(&p, 1, 20000) <= 0) break;
-    ssize_t n = ::recv(fd_, buffer, sizeof buffer, 0);
-    if (n < 0 && errno == EINTR) continue;
-    if (n < 0) break;  // ECONNRESET: the service closed with our bytes unread
-    if (n == 0) {
-      clean = true;
-      break;
-    }
-    decoder.Feed(std::string_view(buffer, static_cast<std::size_t>(n)));
-    while (auto body = decoder.Next()) {
-      auto decoded = DecodeMsgPack(*body);
-      if (auto* value = std::get_if<Value>(&decoded)) frames.push_back(*value);
-    }
-  }
-  if (clean_end) *clean_end = clean;
-  return frames;
-}
-
-std::string RawFrame(const std::string& body) {
-  const auto n = static_cast<std::uint32_t>(body.size());
-  std::string frame = {static_cast<char>(n >> 24), static_cast<char>(n >> 16),
-                       static_cast<char>(n >> 8), static_cast<char>(n)};
-  return frame + body;
-}
-
-std::string EncodedFrame(const Value& value) { return RawFrame(EncodeMsgPack(value)); }
 
 }  // namespace qn::testing

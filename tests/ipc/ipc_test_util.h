@@ -17,19 +17,9 @@
 #include "platform/ipc.h"
 #include "platform/linux/linux_ipc.h"
 #include "tests/fakes/LogCapture.h"
+#include "tests/fakes/TempDir.h"
 
 namespace qn::testing {
-
-// A fresh folder under $TMPDIR (or /tmp), removed with everything in it.
-class TempDir {
- public:
-  TempDir();
-  ~TempDir();
-  const std::string& path() const { return path_; }
-
- private:
-  std::string path_;
-};
 
 // Polls `condition` until it holds or `timeout` passes; for conditions with no event to
 // wait on (log lines written by another thread).
@@ -111,33 +101,8 @@ class ListenerHarness {
   std::thread thread_;
 };
 
-// A plain blocking socket for bytes a well-behaved client would never send.
 // A Unix socket of `type` (SOCK_STREAM, ...) bound to `path`: its descriptor, or -1 (nothing
 // left open) when binding fails. The caller closes it.
 int BindUnixSocket(int type, const std::string& path);
-
-class RawSocket {
- public:
-  // Creates a socket and, when `path` is not empty, connects it.
-  explicit RawSocket(const std::string& path);
-  ~RawSocket();
-  bool Connect(const std::string& path);
-  bool connected() const { return connected_; }
-  void Send(const std::string& bytes);
-  void ShutdownWrite();
-  // Reads until end of stream (or an error such as a reset, or 20 s of silence) and
-  // returns the decoded frames; `clean_end` tells whether the stream ended normally.
-  std::vector<Value> ReadUntilEnd(bool* clean_end = nullptr);
-  int fd() const { return fd_; }
-
- private:
-  int fd_ = -1;
-  bool connected_ = false;
-};
-
-// A frame with `body` as its bytes (the length header is computed).
-std::string RawFrame(const std::string& body);
-// A frame holding the MessagePack encoding of `value`.
-std::string EncodedFrame(const Value& value);
 
 }  // namespace qn::testing

@@ -158,13 +158,6 @@ TEST_F(LinuxDefaultsTest, MalformedSuiteReadsEmptyAndIsNotOverwritten) {
   EXPECT_EQ(FileText(), "{\"disable_reporting\": YES}");
 }
 
-TEST_F(LinuxDefaultsTest, ValuesWithoutJsonFormAreRefused) {
-  ASSERT_EQ(WriteDefault(dir_.path(), kSuite, "a", 1), std::nullopt);
-  const std::string before = FileText();
-  EXPECT_TRUE(WriteDefault(dir_.path(), kSuite, "blob", Data{{1, 2, 3}}));
-  EXPECT_EQ(FileText(), before);
-}
-
 TEST_F(LinuxDefaultsTest, SuiteNamesCannotLeaveTheFolder) {
   for (const std::string& name :
        std::vector<std::string>{"", "../escape", "a/b", ".hidden", std::string(201, 'x')}) {
@@ -176,24 +169,6 @@ TEST_F(LinuxDefaultsTest, SuiteNamesCannotLeaveTheFolder) {
     EXPECT_EQ(defaults_->OpenSuite(name)->ObjectForKey("k"), std::nullopt);
   }
   EXPECT_FALSE(std::filesystem::exists(dir_.File("escape.json")));
-}
-
-TEST_F(LinuxDefaultsTest, ConcurrentWritersAllLand) {
-  constexpr int kWriters = 4;
-  constexpr int kKeys = 25;
-  std::vector<std::thread> writers;
-  for (int w = 0; w < kWriters; ++w) {
-    writers.emplace_back([&, w] {
-      for (int k = 0; k < kKeys; ++k) {
-        EXPECT_EQ(WriteDefault(dir_.path(), kSuite, std::to_string(w) + "." + std::to_string(k), k),
-                  std::nullopt);
-      }
-    });
-  }
-  for (auto& t : writers) t.join();
-  Dictionary read;
-  ASSERT_EQ(ReadSuite(dir_.path(), kSuite, read), std::nullopt);
-  EXPECT_EQ(read.size(), static_cast<std::size_t>(kWriters * kKeys));
 }
 
 }  // namespace

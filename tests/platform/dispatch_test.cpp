@@ -78,37 +78,6 @@ TEST(LinuxDispatchTest, BusyQueueYieldsToOthersOnASingleThread) {
   EXPECT_LT(flood_when_other_ran.load(), kFlood) << "a busy queue kept the only thread";
 }
 
-TEST(LinuxDispatchTest, GlobalTasksRunConcurrently) {
-  auto dispatcher = NewLinuxDispatcher({.threads = 2});
-  // Two tasks that each wait for the other can only both finish side by side.
-  std::atomic<int> arrived{0};
-  Counter finished;
-  for (int i = 0; i < 2; ++i) {
-    dispatcher->AsyncGlobal(QualityOfService::kBackground, Duration::zero(), [&] {
-      arrived.fetch_add(1);
-      const auto give_up = std::chrono::steady_clock::now() + testing::kPatience;
-      while (arrived.load() < 2 && std::chrono::steady_clock::now() < give_up) {
-        std::this_thread::yield();
-      }
-      if (arrived.load() == 2) finished.Add();
-    });
-  }
-  EXPECT_TRUE(finished.WaitFor(2));
-}
-
-TEST(LinuxDispatchTest, DelayedGlobalTaskRunsAfterItsDelay) {
-  auto dispatcher = NewLinuxDispatcher();
-  const SteadyTime submitted = dispatcher->Now();
-  std::atomic<SteadyTime::rep> ran_at{0};
-  Counter ran;
-  dispatcher->AsyncGlobal(QualityOfService::kBackground, milliseconds(50), [&] {
-    ran_at = dispatcher->Now().time_since_epoch().count();
-    ran.Add();
-  });
-  ASSERT_TRUE(ran.WaitFor(1));
-  EXPECT_GE(SteadyTime(Duration(ran_at.load())) - submitted, milliseconds(50));
-}
-
 // A waiter's callback: counts calls, remembers the outcome, and takes the condition's
 // lock (so a callback run while the lock is held would deadlock the test).
 struct Waiter {
@@ -185,77 +154,6 @@ TEST(LinuxConditionTest, SignalRacingTheDeadlineCallsBackExactlyOnce) {
   }
   // Most deadlines are in the past by the time of the signal; that is fine either way.
   RecordProperty("timeouts", timeouts);
-}
-
-TEST(LinuxConditionTest, SuspendedQueueResumedByTheWaiter) {
-  // The shape of a bounded wait: the task parks its queue on a condition and the
-  // callback resumes it; the next task sees what the signaller set.
-  auto dispatcher = NewLinuxDispatcher();
-  auto queue = dispatcher->CreateSerialQueue("waiting", QualityOfService::kUtility);
-  auto condition = dispatcher->CreateCondition();
-  bool done_flag = false;  // guarded by the condition's lock
-  std::atomic<int> outcome{-1};
-  Counter finished;
-  queue->Async([&, q = queue.get()] {
-    condition->lock();
-    q->Suspend();
-    condition->WaitUntil(dispatcher->Now() + std::chrono::hours(1), [&, q](bool timed_out) {
-      outcome = timed_out ? 1 : 0;
-      q->Resume();
-    });
-    condition->unlock();
-  });
-  std::atomic<bool> saw_flag{false};
-  queue->Async([&] {
-    {
-      std::lock_guard lock(*condition);
-      saw_flag = done_flag;
-    }
-    finished.Add();
-  });
-  std::this_thread::sleep_for(milliseconds(20));
-  {
-    std::lock_guard lock(*condition);
-    done_flag = true;
-    condition->Signal();
-  }
-  ASSERT_TRUE(finished.WaitFor(1));
-  EXPECT_TRUE(saw_flag.load());
-  EXPECT_EQ(outcome.load(), 0);
-}
-
-TEST(LinuxDispatchTest, DestructionDropsPendingWorkWithoutRunningIt) {
-  auto dispatcher = NewLinuxDispatcher();
-  auto queue = dispatcher->CreateSerialQueue("late", QualityOfService::kUtility);
-  auto parked = dispatcher->CreateSerialQueue("parked", QualityOfService::kUtility);
-  auto condition = dispatcher->CreateCondition();
-  auto sentinel = std::make_shared<int>(0);
-  std::weak_ptr<int> watch = sentinel;
-  std::atomic<int> ran{0};
-
-  queue->AsyncAfter(std::chrono::hours(1), [&ran, sentinel] { ran.fetch_add(1); });
-  dispatcher->AsyncGlobal(QualityOfService::kBackground, std::chrono::hours(1),
-                          [&ran, sentinel] { ran.fetch_add(1); });
-  parked->Suspend();
-  parked->Async([&ran, sentinel] { ran.fetch_add(1); });
-  condition->lock();
-  condition->WaitUntil(dispatcher->Now() + std::chrono::hours(1),
-                       [&ran, sentinel](bool) { ran.fetch_add(1); });
-  condition->unlock();
-  sentinel.reset();
-
-  dispatcher.reset();
-  EXPECT_EQ(ran.load(), 0);
-  // Queues outliving the dispatcher take work and drop it.
-  queue->Async([&ran] { ran.fetch_add(1); });
-  parked->Resume();
-  condition->lock();
-  condition->Signal();
-  condition->unlock();
-  EXPECT_EQ(ran.load(), 0);
-  parked.reset();
-  condition.reset();
-  EXPECT_TRUE(watch.expired()) << "pending work was kept alive after the dispatcher went";
 }
 
 }  // namespace

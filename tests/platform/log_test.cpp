@@ -96,28 +96,6 @@ TEST(LinuxLogTest, DebugLinesOnlyForEnabledScopes) {
   EXPECT_NE(text.find("server default"), std::string::npos);
 }
 
-TEST(LinuxLogTest, AllEnablesDebugEverywhere) {
-  auto log = StreamLog(-1, "all");
-  EXPECT_TRUE(log->LogEnabled(Register(*log, "qnrs"), 5));
-  EXPECT_TRUE(log->LogEnabled(nullptr, 5));
-  EXPECT_FALSE(StreamLog(-1, "")->LogEnabled(nullptr, 5));
-}
-
-TEST(LinuxLogTest, RegisterScopeReturnsTheSameScopePerCode) {
-  auto log = StreamLog(-1);
-  auto a = log->RegisterScope(true, 0x716E7272, "qnrr", "com.norvel.quenta",
-                              "reporting_session_verbose", 31);
-  auto b = log->RegisterScope(true, 0x716E7272, "qnrr", "com.norvel.quenta",
-                              "reporting_session_verbose", 31);
-  auto c = log->RegisterScope(true, 0x716E7273, "qnrs", "com.norvel.quenta",
-                              "reporting_server_verbose", 31);
-  ASSERT_NE(a, nullptr);
-  EXPECT_EQ(a, b);
-  EXPECT_NE(a, c);
-  EXPECT_EQ(a->code_string, "qnrr");
-  EXPECT_EQ(a->category, "reporting_session_verbose");
-}
-
 TEST(LinuxLogTest, LinesFromManyThreadsNeverInterleave) {
   PipeReader pipe;
   auto log = StreamLog(pipe.write_fd());
@@ -148,36 +126,6 @@ TEST(LinuxLogTest, LinesFromManyThreadsNeverInterleave) {
     start = end + 1;
   }
   EXPECT_EQ(lines, kThreads * kLines);
-}
-
-TEST(LinuxLogTest, JournalStreamMatchesDeviceAndInode) {
-  testing::TempDir dir;
-  const std::string path = dir.path() + "/stream";
-  const int fd = ::open(path.c_str(), O_CREAT | O_WRONLY | O_CLOEXEC, 0600);
-  ASSERT_GE(fd, 0);
-  struct stat st;
-  ASSERT_EQ(fstat(fd, &st), 0);
-  const std::string match = std::to_string(st.st_dev) + ":" + std::to_string(st.st_ino);
-  const std::string other = std::to_string(st.st_dev) + ":" + std::to_string(st.st_ino + 1);
-  EXPECT_TRUE(IsJournalStream(fd, match.c_str()));
-  EXPECT_FALSE(IsJournalStream(fd, other.c_str()));
-  EXPECT_FALSE(IsJournalStream(fd, (match + "x").c_str()));
-  EXPECT_FALSE(IsJournalStream(fd, ""));
-  EXPECT_FALSE(IsJournalStream(fd, nullptr));
-  ::close(fd);
-}
-
-TEST(LinuxLogTest, JournalSinkUsesTheStreamWhenNoJournalRuns) {
-  if (::access("/run/systemd/journal/socket", F_OK) == 0) {
-    GTEST_SKIP() << "a journal runs here; its entries are not read back";
-  }
-  PipeReader pipe;
-  LinuxLogOptions options;
-  options.sink = LinuxLogOptions::Sink::kJournal;
-  options.fd = pipe.write_fd();
-  auto log = NewLinuxLog(options);
-  log->Write(nullptr, LogLevel::kError, "f.cpp", 7, "f", "f.cpp:7:f: no journal");
-  EXPECT_EQ(pipe.Finish(), "f.cpp:7:f: no journal\n");
 }
 
 }  // namespace

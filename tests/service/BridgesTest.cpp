@@ -28,22 +28,6 @@ class BridgesTest : public ::testing::Test {
 
 // --- Analytics bridge ---------------------------------------------------------------------
 
-TEST_F(BridgesTest, StatlynNamesTheEventByCategoryAndTypeAndAddsTheHostApplication) {
-  auto session = SessionOf("com.example.player");
-  Dictionary message{{"route", "speaker"}, {"volume", 0.5}, {"HostApplicationDisplayID", "forged"}};
-  QNReportingStatlynBridge::handleEvent(*env_.platform, &message, 11, 2, session.get());
-
-  auto events = env_.analytics->Events();
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].name, "com.norvel.quenta.Volume.Stop");
-  EXPECT_EQ(events[0].payload,
-            Value(Dictionary{{"route", "speaker"},
-                             {"volume", 0.5},
-                             {"HostApplicationDisplayID", "com.example.player"}}));
-  // The message's own host application is replaced; the caller's payload is not touched.
-  EXPECT_EQ(*message.Find("HostApplicationDisplayID"), Value("forged"));
-}
-
 TEST_F(BridgesTest, StatlynUsesOriginWordsAndUndefinedNames) {
   QNReportingStatlynBridge::handleEvent(*env_.platform, nullptr, 12, 7, nullptr);
   QNReportingStatlynBridge::handleEvent(*env_.platform, nullptr, 0x10000008, 1, nullptr);
@@ -111,18 +95,6 @@ TEST_F(BridgesTest, EnerdexWritesLeakedSessionInfoWithOptionalClients) {
   EXPECT_EQ(events[0].payload, Value(Dictionary{{"Haptic_Active_Hardware_Time_Seconds", 9.25},
                                                 {"Active_Clients", Value(Array{"a", "b"})}}));
   EXPECT_EQ(events[1].payload, Value(Dictionary{{"Haptic_Active_Hardware_Time_Seconds", 4}}));
-  EXPECT_TRUE(env_.log->Lines().empty());
-}
-
-TEST_F(BridgesTest, EnerdexIgnoresOtherMessages) {
-  Dictionary onlyClients{{"Active_Clients", 2}};
-  Dictionary haptics{{"EngineOnTime", 1}, {"Haptic_Active_Hardware_Time_Seconds", 2}};
-  QNReportingEnerdexUtility::handleEvent(*env_.platform, &onlyClients, 1, 6, nullptr);
-  for (std::uint16_t type : {0, 1, 5, 7, 0xFFFF}) {
-    QNReportingEnerdexUtility::handleEvent(*env_.platform, &haptics, 6, type, nullptr);
-  }
-  QNReportingEnerdexUtility::handleEvent(*env_.platform, nullptr, 1, 6, nullptr);
-  EXPECT_TRUE(env_.enerdex->Events().empty());
   EXPECT_TRUE(env_.log->Lines().empty());
 }
 

@@ -37,32 +37,6 @@ class DefaultsTest : public ::testing::Test {
   ServiceHarness h_;
 };
 
-TEST(QNReportingDefaultsTest, ReadsTheSuiteAsSettingsAreRead) {
-  FakePlatform env;
-  EXPECT_EQ(QNReportingDefaults(*env.platform), (Dictionary{{"disable_reporting", 0}}));
-  // Absent: the integer 0; present: the boolean reading.
-  EXPECT_TRUE(QNReportingDefaults(*env.platform).Find("disable_reporting")->is_integer());
-
-  env.defaults->Set(kSuite, "device_name", "kitchen");
-  env.defaults->Set(kSuite, "disable_reporting", "YES");
-  env.defaults->Set("other.suite", "device_name", "elsewhere");
-  EXPECT_EQ(QNReportingDefaults(*env.platform),
-            (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", true}}));
-
-  env.defaults->Set(kSuite, "device_name", 12);
-  env.defaults->Set(kSuite, "disable_reporting", 0);
-  EXPECT_EQ(QNReportingDefaults(*env.platform),
-            (Dictionary{{"device_name", "12"}, {"disable_reporting", false}}));
-}
-
-TEST_F(DefaultsTest, BeforeTheFirstNotificationReportingIsOnWhateverTheSuiteSays) {
-  Write("disable_reporting", true);
-  Client a = h_.Connect(100);
-  EXPECT_FALSE(Send(a, std::nullopt));
-  EXPECT_FALSE(h_.delegate->getDefaults());
-  EXPECT_EQ(h_.env.log->Count("re-reading"), 0);
-}
-
 TEST_F(DefaultsTest, ANotificationReReadsTheSuiteAndPushesItToEverySession) {
   Client a = h_.Connect(100);
   Client b = h_.Connect(200);
@@ -95,7 +69,7 @@ TEST_F(DefaultsTest, ANotificationReReadsTheSuiteAndPushesItToEverySession) {
   EXPECT_NE(h_.delegate->getDefaults(), defaults);  // a fresh dictionary each time
 }
 
-TEST_F(DefaultsTest, DisabledReportingRefusesSendsAndHidesOtherClientsSessions) {
+TEST_F(DefaultsTest, DisabledReportingRefusesSendsHidesOthers) {
   Client a = h_.Connect(100);
   Client b = h_.Connect(200);
   BoolReplies r;
@@ -135,26 +109,7 @@ TEST_F(DefaultsTest, DisabledReportingRefusesSendsAndHidesOtherClientsSessions) 
   EXPECT_EQ(h_.env.enerdex->Events().size(), 1u);
 }
 
-TEST_F(DefaultsTest, ANotificationWithoutClientsOnlyUpdatesDefaultsAndSwitch) {
-  Write("disable_reporting", 1);
-  h_.PostDefaults();
-  EXPECT_FALSE(h_.delegate->isReportingEnabled());
-  EXPECT_EQ(*h_.delegate->getDefaults(), (Dictionary{{"disable_reporting", true}}));
-}
-
-TEST_F(DefaultsTest, ADeliveryWithAnotherTokenIsIgnored) {
-  Write("disable_reporting", true);
-  h_.env.notify->PostWithToken(kQNReportingDefaultsNotification, 999);
-  h_.Run();
-  EXPECT_EQ(h_.env.log->Count("re-reading"), 0);
-  EXPECT_TRUE(h_.delegate->isReportingEnabled());
-  h_.env.notify->PostWithToken(kQNReportingDefaultsNotification, std::nullopt);
-  h_.Run();
-  EXPECT_EQ(h_.env.log->Count("re-reading"), 1);
-  EXPECT_FALSE(h_.delegate->isReportingEnabled());
-}
-
-TEST(DefaultsRegistrationTest, AFailedRegistrationIsLoggedAndLeavesReportingOn) {
+TEST(DefaultsRegistrationTest, FailedRegistrationLeavesReportingOn) {
   ServiceHarness h([](FakePlatform& env) {
     env.notify->FailRegistrations(5);
     env.defaults->Set(kSuite, "disable_reporting", true);
@@ -163,14 +118,6 @@ TEST(DefaultsRegistrationTest, AFailedRegistrationIsLoggedAndLeavesReportingOn) 
   h.PostDefaults();
   EXPECT_TRUE(h.delegate->isReportingEnabled());
   EXPECT_FALSE(h.delegate->getDefaults());
-}
-
-TEST(DefaultsRegistrationTest, TheRegistrationEndsWithTheDelegate) {
-  FakePlatform env;
-  auto delegate = QNReportingServiceDelegate::Create(env.platform);
-  EXPECT_EQ(env.notify->Registrations(kQNReportingDefaultsNotification), 1);
-  delegate.reset();
-  EXPECT_EQ(env.notify->Registrations(kQNReportingDefaultsNotification), 0);
 }
 
 }  // namespace

@@ -88,9 +88,4 @@ class ServiceHarness {
   std::shared_ptr<QNReportingServiceDelegate> delegate;
 };
 
-// The user info of a framework session, as the fake recorded it.
-inline const Value* UserInfoValue(const FakeLivoReporting::SessionRecord& record, const char* key) {
-  return record.user_info.Find(key);
-}
-
 }  // namespace qn::testing::service

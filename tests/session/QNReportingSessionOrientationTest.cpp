@@ -14,7 +14,7 @@ using testing::Payload;
 using namespace std::chrono_literals;
 using OrientationTest = testing::SessionFixture;
 
-TEST_F(OrientationTest, ChangesAreFiledWithTruncatedSecondsAndUnregisteredAtStop) {
+TEST_F(OrientationTest, ChangesFiledInSecondsUnregisteredAtStop) {
   SetInternal(true);
   t_.log->EnableDebug("qnrr");
   auto session = NewSession(42, 2);
@@ -71,70 +71,6 @@ TEST_F(OrientationTest, ChangesAreFiledWithTruncatedSecondsAndUnregisteredAtStop
   t_.dispatcher->RunUntilIdle();
 }
 
-TEST_F(OrientationTest, MissingHostAppPrintsNull) {
-  SetInternal(true);
-  t_.log->EnableDebug("qnrr");
-  auto session = NewSession(42, 7);
-  session->start();
-  t_.orientation->FireUI(99);
-  EXPECT_THAT(t_.log->Matching("Orientation handler"),
-              ElementsAre(::testing::HasSubstr(
-                  "mode=ui orientation=\"Unknown\" app=\"(null)\", time=-0, id=")));
-}
-
-TEST_F(OrientationTest, OnlyInternalTelephonyAndLongFormOnOtherDeviceClasses) {
-  struct Case {
-    bool internal;
-    int deviceClass;
-    std::uint16_t type;
-    bool registers;
-  };
-  const Case cases[] = {{true, 1, 2, true},  {true, 1, 7, true},  {false, 1, 2, false},
-                        {true, 6, 2, false}, {true, 1, 3, false}, {true, 1, 65535, false},
-                        {true, 0, 7, true}};
-  for (const Case& c : cases) {
-    FakePlatform t;
-    t.device_info->SetAnswer("InternalBuild", c.internal);
-    t.device_info->SetAnswer("DeviceClassNumber", c.deviceClass);
-    auto session = QNReportingSession::initWithID(t.platform, 42, Array{});
-    session->setServiceType(c.type);
-    EXPECT_EQ(session->shouldReportOrientation(), c.registers);
-    session->start();
-    EXPECT_EQ(session->orientationCallbackID().has_value(), c.registers)
-        << c.internal << " " << c.deviceClass << " " << c.type;
-    EXPECT_EQ(t.orientation->Events().size(), c.registers ? 2u : 0u);
-    EXPECT_EQ(session->startDate().has_value(), c.registers);
-    session->stop();
-    t.dispatcher->RunUntilIdle();
-  }
-}
-
-TEST_F(OrientationTest, TypeChangedBeforeStopKeepsTheRegistration) {
-  SetInternal(true);
-  auto session = NewSession(42, 2);
-  session->start();
-  session->setServiceType(3);
-  session->stop();
-  EXPECT_EQ(session->orientationCallbackID(), "QNReportingService 42");
-  EXPECT_EQ(t_.orientation->Events().size(), 2u);  // no unregistration
-  // A change after stop finds no array and adds nothing.
-  EXPECT_EQ(t_.orientation->FireDevice(1), 1);
-  EXPECT_FALSE(session->aggregatedPayloadData());
-  t_.dispatcher->RunUntilIdle();
-}
-
-TEST_F(OrientationTest, UnregistrationRunsEvenWhenNotStarted) {
-  SetInternal(true);
-  auto session = NewSession(42, 7);
-  session->start();
-  session->setStarted(false);
-  session->stop();
-  EXPECT_FALSE(session->orientationCallbackID());
-  EXPECT_EQ(t_.orientation->Events().size(), 4u);
-  EXPECT_EQ(t_.trace->Count(0x21042830), 0);  // the rest of stop did not run
-  t_.dispatcher->RunUntilIdle();
-}
-
 TEST_F(OrientationTest, CallbacksRaceWithIntakeAndStop) {
   SetInternal(true);
   auto session = NewSession(42, 7);
@@ -158,17 +94,6 @@ TEST_F(OrientationTest, CallbacksRaceWithIntakeAndStop) {
   EXPECT_GE(aggregated->Snapshot().size(), 200u);
   EXPECT_FALSE(session->aggregatedPayloadData());
   t_.dispatcher->RunUntilIdle();
-}
-
-TEST_F(OrientationTest, CallbacksHoldTheSessionWeakly) {
-  SetInternal(true);
-  auto session = NewSession(42, 2);
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  session.reset();
-  EXPECT_TRUE(t_.log->Contains("deallocing this session 42"));
-  EXPECT_EQ(t_.orientation->FireDevice(1), 1);  // the stale callback does nothing
-  EXPECT_EQ(t_.orientation->FireUI(1), 1);
 }
 
 }  // namespace

@@ -64,14 +64,6 @@ TEST_F(SummaryTest, SummaryJoinsValuesPerKeyInPayloadOrder) {
   EXPECT_EQ(session->aggregatedPayloadData()->Snapshot().size(), 3u);
 }
 
-TEST_F(SummaryTest, NothingAggregatedMeansNoSummary) {
-  auto session = NewSession(42, 3);
-  session->start();
-  EXPECT_FALSE(session->createSummaryEventForSession());
-  session->stop();
-  EXPECT_FALSE(session->createSummaryEventForSession());  // arrays gone
-}
-
 TEST_F(SummaryTest, StopSendsSummaryThroughTheSessionBeforeItsFlushAndCountsIt) {
   auto session = OneMessageSession(3);
   auto lines = t_.log->Lines();
@@ -134,18 +126,6 @@ TEST_F(SummaryTest, CustomerBuildWritesNothing) {
   EXPECT_EQ(t_.livo->AllSessionMessages().size(), 2u);  // the summary event still went out
 }
 
-TEST_F(SummaryTest, MissingHostAppNamesTheFileUnknown) {
-  SetInternal(true);
-  OneMessageSession(13);
-  auto files = SummaryFiles();
-  ASSERT_EQ(files.size(), 1u);
-  EXPECT_THAT(files[0].filename().string(), MatchesRegex(".*-quenta-unknown-telephony\\.json"));
-  Value content;
-  ASSERT_FALSE(ParseJson(ReadFileText(files[0]), content));
-  ASSERT_TRUE(content.as_array());
-  EXPECT_EQ(content.as_array()->front(), Value(Dictionary{}));
-}
-
 TEST_F(SummaryTest, HostAppCannotLeadOutOfTheDirectory) {
   SetInternal(true);
   OneMessageSession(0, {{"HostApplicationDisplayID", "../../escape"}});
@@ -172,35 +152,6 @@ TEST_F(SummaryTest, BlockedDirectoryIsLoggedAndStopGoesOn) {
   EXPECT_EQ(errors, 2);
   EXPECT_FALSE(session->started());
   EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
-}
-
-TEST_F(SummaryTest, SerialiserRefusalIsLoggedAndNothingWritten) {
-  SetInternal(true);
-  auto session = NewSession(42, 0);
-  session->start();
-  session->sendMessage(Payload({{"blob", Data{{1, 2, 3}}}}), 5, 1, nullptr);
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_THAT(t_.log->Matching("dataWithJSONObject"),
-              ElementsAre(MatchesRegex(".*: dataWithJSONObject: .+")));
-  EXPECT_TRUE(fs::is_directory(t_.platform->diagnostic_logs_dir));
-  EXPECT_TRUE(SummaryFiles().empty());
-  EXPECT_FALSE(t_.log->Contains("writeToURL"));
-}
-
-TEST_F(SummaryTest, WritingInsertsUserInfoIntoTheArray) {
-  SetInternal(true);
-  auto session = NewSession(42, 0);
-  session->setConfiguration(Payload({{"x", 1}}));
-  session->start();
-  session->sendMessage(Payload({{"a", 1}}), 5, 1, nullptr);
-  session->writeSummaryJson();
-  session->writeSummaryJson();
-  auto nested = session->nestedAggregatedPayloadData()->Snapshot();
-  ASSERT_EQ(nested.size(), 3u);
-  EXPECT_EQ(nested[0], Value(Dictionary{{"x", 1}}));
-  EXPECT_EQ(nested[1], Value(Dictionary{{"x", 1}}));
-  t_.dispatcher->RunUntilIdle();
 }
 
 }  // namespace

@@ -14,42 +14,6 @@ using testing::Payload;
 using namespace std::chrono_literals;
 using SessionTest = testing::SessionFixture;
 
-TEST_F(SessionTest, CreationNeedsLogAndDispatcher) {
-  auto bare = std::make_shared<Platform>();
-  EXPECT_FALSE(QNReportingSession::initWithID(bare, 1, {}));
-  EXPECT_FALSE(QNReportingSession::initWithID(nullptr, 1, {}));
-}
-
-TEST_F(SessionTest, SetServiceTypeStoresTypeAndName) {
-  auto session = NewSession();
-  session->setServiceType(2);
-  EXPECT_EQ(session->serviceType(), 2);
-  EXPECT_EQ(session->serviceName(), "telephony");
-  session->setServiceType(12);
-  EXPECT_EQ(session->serviceName(), "apiusage");
-  session->setServiceType(13);
-  EXPECT_EQ(session->serviceType(), 13);
-  EXPECT_EQ(session->serviceName(), "telephony");
-  session->setServiceType(65535);
-  EXPECT_EQ(session->serviceName(), "unknown");
-  EXPECT_THAT(t_.log->Matching("setting service type"),
-              ElementsAre(HasSubstr(": setting service type telephony"),
-                          HasSubstr(": setting service type apiusage"),
-                          HasSubstr(": setting service type telephony"),
-                          HasSubstr(": setting service type unknown")));
-}
-
-TEST_F(SessionTest, ConfigurationAndDefaultsMergeIntoUserInfo) {
-  auto session = NewSession();
-  session->setConfiguration(Payload({{"a", 1}, {"b", 2}}));
-  auto before = session->userInfo();
-  session->updateDefaults(Payload({{"b", 3}, {"device_name", "box"}}));
-  session->setConfiguration(static_cast<const Dictionary*>(nullptr));
-  EXPECT_EQ(*session->userInfo(), (Dictionary{{"a", 1}, {"b", 3}, {"device_name", "box"}}));
-  // Earlier snapshots are not changed under their readers.
-  EXPECT_EQ(*before, (Dictionary{{"a", 1}, {"b", 2}}));
-}
-
 TEST_F(SessionTest, MessageIdentifiersCountPerPair) {
   auto session = NewSession();
   EXPECT_EQ(session->messageIdForCategory(5, 1), "Setup_Start_1");
@@ -59,63 +23,6 @@ TEST_F(SessionTest, MessageIdentifiersCountPerPair) {
   EXPECT_EQ(session->messageIdForCategory(0xFFFFFFFF, 0xFFFF), "Undefined_Unknown_1");
   EXPECT_EQ(*session->messageTypeCounts(),
             (Dictionary{{"Setup_Start", 3}, {"DSP_Error_Error", 1}, {"Undefined_Unknown", 1}}));
-}
-
-TEST_F(SessionTest, StartCreatesFrameworkSessionOnItsQueue) {
-  t_.log->EnableDebug("qnrr");
-  auto session = NewSession();
-  session->setServiceType(2);
-  session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.phone"}}));
-  session->start();
-  EXPECT_TRUE(session->started());
-  EXPECT_THAT(t_.trace->Codes(), ElementsAre(0x21042828u, 0x2104282Cu));
-  EXPECT_TRUE(t_.livo->Sessions().empty());  // the start sequence has not run yet
-
-  // Configuration that reaches the session before the start sequence copies it is kept.
-  session->setConfiguration(Payload({{"late", true}}));
-  t_.dispatcher->RunUntilIdle();
-
-  auto sessions = t_.livo->Sessions();
-  ASSERT_EQ(sessions.size(), 1u);
-  EXPECT_EQ(sessions[0].session_info,
-            (Dictionary{{kLivoReportingSessionInfoClientType, 19},
-                        {kLivoReportingSessionInfoClientVersion, 2.0},
-                        {kLivoReportingSessionInfoSessionID, 42},
-                        {kLivoReportingSessionInfoBatchEvent, true},
-                        {kLivoReportingSessionInfoHierarchyToken, 1},
-                        {kLivoReportingSessionInfoContainsRealtimeEvents, false}}));
-  EXPECT_TRUE(sessions[0].session_info.Find(kLivoReportingSessionInfoClientVersion)->kind() ==
-              Value::Kind::kDouble);
-  EXPECT_TRUE(sessions[0].session_info.Find(kLivoReportingSessionInfoBatchEvent)->is_bool());
-  EXPECT_EQ(sessions[0].user_info,
-            (Dictionary{{kLivoReportingUserInfoClientName, "com.norvel.quenta"},
-                        {kLivoReportingUserInfoServiceName, "telephony_session"},
-                        {"HostApplicationDisplayID", "org.example.phone"},
-                        {"late", true}}));
-  EXPECT_TRUE(sessions[0].frameworks_to_check.empty());
-  EXPECT_TRUE(sessions[0].configuration_started);
-  EXPECT_EQ(session->livoReportingSession() != nullptr, true);
-  ASSERT_TRUE(session->livoReportingAgentToken());
-  EXPECT_EQ(session->livoReportingAgentToken()->id, 1u);
-  EXPECT_FALSE(session->livoReportingSessionStarted());  // never set true on the record
-
-  EXPECT_EQ(t_.log->Count(": starting session owned by 42"), 1);
-  EXPECT_THAT(t_.log->Matching("List of backends"),
-              ElementsAre(MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*: List of backends "
-                                       "\\(\n    fake-backend\n\\)")));
-  // Backends answered at once: the wait saw the flag set and logged nothing.
-  EXPECT_FALSE(t_.log->Contains("waiting for livoreportingd"));
-  EXPECT_EQ(t_.dispatcher->PendingTimers(), 0);
-}
-
-TEST_F(SessionTest, ClientKeysMayReplaceFrameworkUserInfo) {
-  auto session = NewSession();
-  session->setConfiguration(Payload({{kLivoReportingUserInfoServiceName, "custom"}}));
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  ASSERT_EQ(t_.livo->Sessions().size(), 1u);
-  EXPECT_EQ(*t_.livo->Sessions()[0].user_info.Find(kLivoReportingUserInfoServiceName),
-            Value("custom"));
 }
 
 TEST_F(SessionTest, UnsetServiceTypeGivesUnknownSessionAndApiUsageFlags) {
@@ -231,21 +138,6 @@ TEST_F(SessionTest, LateBackendsReleaseQueuedDeliveries) {
   EXPECT_FALSE(t_.log->Contains("failed to find backend"));
 }
 
-TEST_F(SessionTest, StartTwiceIsRefused) {
-  auto session = NewSession();
-  session->start();
-  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
-  auto aggregated = session->aggregatedPayloadData();
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_THAT(t_.log->Matching("already started"),
-              ElementsAre(MatchesRegex(".*: 42 is already started")));
-  EXPECT_EQ(session->aggregatedPayloadData(), aggregated);
-  EXPECT_EQ(aggregated->Snapshot().size(), 1u);
-  EXPECT_EQ(t_.livo->Sessions().size(), 1u);
-  EXPECT_EQ(t_.trace->Count(0x2104282C), 1);
-}
-
 TEST_F(SessionTest, StopFlushesDropsAndClears) {
   t_.log->EnableDebug("qnrr");
   auto session = NewSession();
@@ -276,63 +168,6 @@ TEST_F(SessionTest, FlushErrorIsLogged) {
   t_.dispatcher->RunUntilIdle();
   EXPECT_THAT(t_.log->Matching("flush error"),
               ElementsAre(MatchesRegex(".*: flush error disk full")));
-}
-
-TEST_F(SessionTest, StopTwiceAndStopUnstartedDoNothingMore) {
-  t_.log->EnableDebug("qnrr");
-  auto never = NewSession(7);
-  never->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_EQ(t_.log->Count(": ending session 7"), 1);
-  EXPECT_EQ(t_.trace->Count(0x21042830), 0);
-  EXPECT_TRUE(never->aggregatedPayloadData());  // untouched
-
-  auto session = NewSession();
-  session->start();
-  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_EQ(t_.log->Count(": ending session 42"), 3);
-  EXPECT_EQ(t_.trace->Count(0x21042830), 1);
-  EXPECT_EQ(t_.log->Count("sending summary event"), 1);
-  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
-}
-
-TEST_F(SessionTest, RestartBeginsAFreshPeriodAndCountsContinue) {
-  auto session = NewSession();
-  session->start();
-  session->sendMessage(Payload({{"n", 1}}), 5, 1, nullptr);
-  t_.dispatcher->RunUntilIdle();
-  session->stop();
-  session->start();
-  t_.dispatcher->RunUntilIdle();
-  ASSERT_TRUE(session->aggregatedPayloadData());
-  EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
-  EXPECT_TRUE(session->nestedAggregatedPayloadData()->Snapshot().empty());
-  session->sendMessage(Payload({{"n", 2}}), 5, 1, nullptr);
-  auto nested = session->nestedAggregatedPayloadData()->Snapshot();
-  ASSERT_EQ(nested.size(), 1u);
-  EXPECT_TRUE(nested[0].as_dictionary()->Contains("Setup_Start_2"));
-  EXPECT_EQ(t_.livo->Sessions().size(), 2u);
-  EXPECT_EQ(t_.livo->TokensMade(), 2);
-  EXPECT_EQ(*t_.livo->Sessions()[1].session_info.Find(kLivoReportingSessionInfoHierarchyToken),
-            Value(2));
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_EQ(t_.livo->Sessions()[1].messages.size(), 1u);
-}
-
-TEST_F(SessionTest, QueuedWorkKeepsTheSessionAlive) {
-  t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kNever);
-  auto session = NewSession();
-  session->start();
-  session.reset();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_FALSE(t_.log->Contains("deallocing"));
-  t_.dispatcher->AdvanceBy(9s);
-  EXPECT_TRUE(t_.log->Contains("deallocing this session 42"));
 }
 
 }  // namespace

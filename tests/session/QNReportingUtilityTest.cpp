@@ -18,35 +18,7 @@ using testing::FakePlatform;
 using ::testing::MatchesRegex;
 using namespace std::chrono_literals;
 
-TEST(QNReportingUtilityTest, HostApplicationName) {
-  EXPECT_EQ(QNReportingHostApplicationName(static_cast<const Dictionary*>(nullptr)), "Unknown");
-  Dictionary empty;
-  EXPECT_EQ(QNReportingHostApplicationName(&empty), "Unknown");
-  Dictionary info{{"HostApplicationDisplayID", "org.example.player"}, {"other", 1}};
-  EXPECT_EQ(QNReportingHostApplicationName(&info), "org.example.player");
-  auto shared = std::make_shared<const Dictionary>(info);
-  EXPECT_EQ(QNReportingHostApplicationName(shared), "org.example.player");
-}
-
-TEST(QNReportingUtilityTest, InternalBuildAnswerReadAsBoolean) {
-  struct Case {
-    std::optional<Value> answer;
-    bool expected;
-  };
-  const Case cases[] = {{std::nullopt, false}, {Value(true), true},  {Value(false), false},
-                        {Value(1), true},      {Value(0), false},    {Value("YES"), true},
-                        {Value("true"), true}, {Value("no"), false}, {Value(""), false}};
-  for (const Case& c : cases) {
-    FakePlatform t;
-    if (c.answer) t.device_info->SetAnswer("InternalBuild", *c.answer);
-    EXPECT_EQ(QNReportingIsInternalBuild(*t.platform), c.expected)
-        << (c.answer ? c.answer->Description() : "(none)");
-  }
-  auto bare = std::make_shared<Platform>();  // no device information at all
-  EXPECT_FALSE(QNReportingIsInternalBuild(*bare));
-}
-
-TEST(QNReportingUtilityTest, InternalBuildAskedOncePerPlatformEvenWhenRacing) {
+TEST(QNReportingUtilityTest, InternalBuildAskedOnceEvenWhenRacing) {
   FakePlatform t;
   t.device_info->SetAnswer("InternalBuild", true);
   std::vector<std::thread> threads;
@@ -83,14 +55,6 @@ class WaitTest : public ::testing::Test {
   std::vector<bool> results_;
 };
 
-TEST_F(WaitTest, FlagAlreadySetCompletesAtOnceWithoutLogging) {
-  *done_ = true;
-  StartWait();
-  EXPECT_THAT(results_, ElementsAre(true));
-  EXPECT_TRUE(t_.log->Lines().empty());
-  EXPECT_EQ(t_.dispatcher->PendingTimers(), 0);
-}
-
 TEST_F(WaitTest, TimesOutWithErrorLine) {
   StartWait();
   EXPECT_TRUE(results_.empty());
@@ -109,24 +73,6 @@ TEST_F(WaitTest, TimesOutWithErrorLine) {
   EXPECT_EQ(lines[1].level, LogLevel::kError);
 }
 
-TEST_F(WaitTest, SignalWithFlagSetCompletesTrue) {
-  StartWait();
-  std::thread signaller([this] {
-    condition_->lock();
-    *done_ = true;
-    condition_->Signal();
-    condition_->unlock();
-  });
-  signaller.join();
-  t_.dispatcher->RunUntilIdle();
-  EXPECT_THAT(results_, ElementsAre(true));
-  EXPECT_THAT(Texts(), ElementsAre(::testing::HasSubstr(": waiting for the thing"),
-                                   MatchesRegex(".*:QNReportingUtilityWait: continuing")));
-  // The deadline of the finished wait no longer fires anything.
-  t_.dispatcher->AdvanceBy(20s);
-  EXPECT_EQ(results_.size(), 1u);
-}
-
 TEST_F(WaitTest, WakeWithoutFlagWaitsAFullNewPeriod) {
   StartWait();
   t_.dispatcher->AdvanceBy(5s);
@@ -141,15 +87,6 @@ TEST_F(WaitTest, WakeWithoutFlagWaitsAFullNewPeriod) {
   t_.dispatcher->AdvanceBy(1ms);
   EXPECT_THAT(results_, ElementsAre(false));
   EXPECT_EQ(t_.log->Count("the thing never came"), 1);
-}
-
-TEST_F(WaitTest, NullLogGoesToDefaultLog) {
-  QNReportingUtilityWait(*t_.platform, condition_, done_, "w", "t", nullptr, 0.5,
-                         [this](bool ok) { results_.push_back(ok); });
-  t_.dispatcher->AdvanceBy(500ms);
-  EXPECT_THAT(results_, ElementsAre(false));
-  for (const auto& l : t_.log->Lines()) EXPECT_EQ(l.scope, "");
-  EXPECT_EQ(t_.log->Lines().size(), 2u);
 }
 
 }  // namespace

@@ -54,142 +54,45 @@ class WriterGate {
 
 using ReportingStoreTest = testing::StoreTest;
 
-TEST_F(ReportingStoreTest, EveryKindOfRecordLandsInHandOverOrder) {
+TEST_F(ReportingStoreTest, DiskFullDropsOneBatchAndLaterOnesSucceed) {
   auto store = OpenStore();
-  const std::int64_t session = store->NewSessionId();
-  EXPECT_TRUE(store->AddSession(session, Value(Dictionary{{"ClientType", 19}}),
-                                Value(Dictionary{{"ClientName", "com.norvel.quenta"}})));
-  EXPECT_TRUE(store->AddSessionMessage(session, 5, 2, Value(Dictionary{{"a", 1}})));
-  EXPECT_TRUE(store->AddSessionMessage(session, 0xFFFF, 0xFFFF, Value(Dictionary{{"b", 2}})));
-  std::promise<std::optional<Error>> flushed;
-  store->MarkSessionFlushed(session, [&](std::optional<Error> e) { flushed.set_value(e); });
-  EXPECT_TRUE(store->AddSingleMessage(Value(Dictionary{{"SessionID", -1}}),
-                                      Value(Dictionary{{"ServiceName", "standalone"}}), 7, 1,
-                                      Value(Dictionary{{"c", 3}})));
-  EXPECT_TRUE(store->AddAnalyticsEvent("com.norvel.quenta.Volume.Stop", [] {
-    return Value(Dictionary{{"d", 4}});
-  }));
-  EXPECT_TRUE(store->AddPowerLogEvent(28, "Vistrel_Haptics", Value(Dictionary{{"e", 5}})));
+  store->AddPowerLogEvent(1, "before", Value());
   store->Drain();
-  EXPECT_FALSE(flushed.get_future().get());
 
-  auto rows = ReadRows(db_path_);
-  ASSERT_EQ(rows.size(), 6u);
-  EXPECT_EQ(rows[0].table, Table::kLivoSession);
-  EXPECT_EQ(rows[0].id, session);
-  EXPECT_EQ(ParseJson(rows[0].session_info), (nlohmann::json{{"ClientType", 19}}));
-  EXPECT_EQ(ParseJson(rows[0].user_info), (nlohmann::json{{"ClientName", "com.norvel.quenta"}}));
-  ASSERT_TRUE(rows[0].flushed);
-  EXPECT_GE(*rows[0].flushed, rows[0].time);
-
-  EXPECT_EQ(rows[1].table, Table::kLivoMessage);
-  EXPECT_EQ(rows[1].session, session);
-  EXPECT_EQ(rows[1].category, 5);
-  EXPECT_EQ(rows[1].type, 2);
-  EXPECT_EQ(rows[1].payload, R"({"a":1})");
-  EXPECT_EQ(rows[1].session_info, "");
-  EXPECT_EQ(rows[2].category, 0xFFFF);
-  EXPECT_EQ(rows[2].type, 0xFFFF);
-  EXPECT_LT(rows[1].id, rows[2].id);
-
-  EXPECT_EQ(rows[3].table, Table::kLivoMessage);
-  EXPECT_FALSE(rows[3].session);
-  EXPECT_EQ(rows[3].payload, R"({"c":3})");
-  EXPECT_EQ(rows[3].session_info, R"({"SessionID":-1})");
-  EXPECT_EQ(rows[3].user_info, R"({"ServiceName":"standalone"})");
-
-  EXPECT_EQ(rows[4].table, Table::kAnalyticsEvent);
-  EXPECT_EQ(rows[4].name, "com.norvel.quenta.Volume.Stop");
-  EXPECT_EQ(rows[4].payload, R"({"d":4})");
-
-  EXPECT_EQ(rows[5].table, Table::kPowerLogEvent);
-  EXPECT_EQ(rows[5].subsystem, 28);
-  EXPECT_EQ(rows[5].name, "Vistrel_Haptics");
-  EXPECT_EQ(rows[5].payload, R"({"e":5})");
-
-  for (std::size_t i = 1; i < rows.size(); ++i) EXPECT_LE(rows[i - 1].time, rows[i].time);
-  EXPECT_EQ(store->stats().committed, 7u);  // six rows and the flush
-  EXPECT_EQ(log_->Lines().size(), 0u);
-}
-
-TEST_F(ReportingStoreTest, SessionIdsContinueAboveThoseAlreadyStored) {
-  std::int64_t last = 0;
-  {
-    auto store = OpenStore();
-    EXPECT_EQ(store->NewSessionId(), 1);
-    for (int i = 0; i < 3; ++i) {
-      last = store->NewSessionId();
-      store->AddSession(last, Value(Dictionary{}), Value(Dictionary{}));
-    }
-    // An id that was allocated but whose row was never written is not reserved.
-    (void)store->NewSessionId();
-  }
-  auto store = OpenStore();
-  EXPECT_EQ(store->NewSessionId(), last + 1);
-}
-
-TEST_F(ReportingStoreTest, AnalyticsProviderRunsOnceOnTheWriterWhenTheRowIsWritten) {
-  auto store = OpenStore();
+  // The database may not grow: every batch that needs a new page fails. The gate makes the
+  // limit, the rows and the flush one batch.
   WriterGate gate;
   gate.Close(*store);
-
-  std::atomic<int> calls{0};
-  std::thread::id provider_thread;
-  store->AddAnalyticsEvent("event", [&] {
-    ++calls;
-    provider_thread = std::this_thread::get_id();
-    return Value(Dictionary{{"n", 1}});
-  });
-  store->AddAnalyticsEvent("no provider", nullptr);
-  EXPECT_EQ(calls.load(), 0);  // handed over, not yet written
-
+  store->ExecuteForTesting("PRAGMA max_page_count = 1");
+  const std::string big(4000, 'x');
+  for (int i = 0; i < 100; ++i) store->AddPowerLogEvent(1, "lost", Value(big));
+  std::promise<std::optional<Error>> flush_result;
+  store->MarkSessionFlushed(1, [&](std::optional<Error> e) { flush_result.set_value(e); });
   gate.Release();
   store->Drain();
-  EXPECT_EQ(calls.load(), 1);
-  EXPECT_EQ(provider_thread, gate.writer_thread());
-  EXPECT_NE(provider_thread, std::this_thread::get_id());
 
-  auto rows = ReadRows(db_path_, ReportingSink::kAnalytics);
-  ASSERT_EQ(rows.size(), 2u);
-  EXPECT_EQ(rows[0].payload, R"({"n":1})");
-  EXPECT_EQ(rows[1].payload, "null");
-}
+  auto flush_error = flush_result.get_future().get();
+  ASSERT_TRUE(flush_error);
+  EXPECT_EQ(flush_error->code, SQLITE_FULL);
+  auto errors = log_->Matching("dropped a batch of");
+  ASSERT_EQ(errors.size(), 1u);
+  EXPECT_NE(errors[0].find("database or disk is full"), std::string::npos) << errors[0];
+  EXPECT_NE(errors[0].find("dropped a batch of 102 records"), std::string::npos) << errors[0];
+  EXPECT_EQ(log_->Lines()[0].level, LogLevel::kError);
+  EXPECT_GE(store->stats().failed, 101u);
 
-TEST_F(ReportingStoreTest, FlushHandlerRunsAfterTheFlushIsCommitted) {
-  auto store = OpenStore();
-  const std::int64_t id = store->NewSessionId();
-  store->AddSession(id, Value(Dictionary{}), Value(Dictionary{}));
-  std::promise<std::optional<double>> seen;
-  std::thread::id handler_thread;
-  store->MarkSessionFlushed(id, [&](std::optional<Error> error) {
-    EXPECT_FALSE(error);
-    handler_thread = std::this_thread::get_id();
-    // Another connection already sees the flushed time.
-    auto rows = ReadRows(db_path_, ReportingSink::kReporting);
-    seen.set_value(rows.empty() ? std::nullopt : rows[0].flushed);
-  });
-  EXPECT_TRUE(seen.get_future().get());
+  // Still running: once there is room again, writes go through.
+  store->ExecuteForTesting("PRAGMA max_page_count = 1073741823");
+  for (int i = 0; i < 100; ++i) store->AddPowerLogEvent(1, "after", Value(big));
   store->Drain();
-  EXPECT_NE(handler_thread, std::this_thread::get_id());
+  auto rows = ReadRows(db_path_, ReportingSink::kPowerLog);
+  ASSERT_EQ(rows.size(), 101u);
+  EXPECT_EQ(rows.front().name, "before");
+  for (std::size_t i = 1; i < rows.size(); ++i) EXPECT_EQ(rows[i].name, "after");
+  EXPECT_EQ(log_->Count("dropped a batch of"), 1);
 }
 
-TEST_F(ReportingStoreTest, DrainOnTheWriterThreadReturnsAndDrainHookOutlivesTheStore) {
-  auto store = OpenStore();
-  std::promise<void> done;
-  store->AfterWrite([&] {
-    store->AddPowerLogEvent(1, "queued from the writer", Value());
-    store->Drain();  // would wait for itself forever
-    done.set_value();
-  });
-  done.get_future().get();
-  auto hook = store->DrainHook();
-  hook();
-  EXPECT_EQ(ReadRows(db_path_).size(), 1u);
-  store.reset();
-  hook();  // the store is gone: nothing to do, nothing to crash
-}
-
-TEST_F(ReportingStoreTest, DatabaseLockedByAnotherProcessDropsTheBatchUntilReleased) {
+TEST_F(ReportingStoreTest, LockedDatabaseDropsTheBatchUntilReleased) {
   ReportingStore::Options options;
   options.busy_timeout_ms = 50;
   auto store = OpenStore(options);
@@ -238,7 +141,7 @@ TEST_F(ReportingStoreTest, FullQueueDropsCountsAndLogsWithoutBlocking) {
   EXPECT_EQ(rows.back().payload, "9");
 }
 
-TEST_F(ReportingStoreTest, AfterCloseRecordsAreRefusedAndCallbacksStillRunElsewhere) {
+TEST_F(ReportingStoreTest, AfterCloseRecordsAreRefusedCallbacksStillRun) {
   auto store = OpenStore();
   store->AddPowerLogEvent(1, "kept", Value());
   store->Close();
@@ -261,18 +164,6 @@ TEST_F(ReportingStoreTest, AfterCloseRecordsAreRefusedAndCallbacksStillRunElsewh
   auto rows = ReadRows(db_path_);
   ASSERT_EQ(rows.size(), 1u);
   EXPECT_EQ(rows[0].name, "kept");
-}
-
-TEST_F(ReportingStoreTest, LastReferenceDroppedOnTheWriterThreadClosesWithoutDeadlock) {
-  auto store = OpenStore();
-  auto hook = store->DrainHook();
-  std::promise<void> ran;
-  store->AfterWrite([keep = store, &ran] { ran.set_value(); });
-  for (int i = 0; i < 100; ++i) store->AddPowerLogEvent(1, "queued", Value(i));
-  store.reset();  // the task's capture is now the last reference
-  ran.get_future().get();
-  hook();  // waits for the writer to finish what was queued, if it still runs
-  EXPECT_EQ(ReadRows(db_path_).size(), 100u);
 }
 
 TEST_F(ReportingStoreTest, OpenRefusesNewerSchemasAndNonDatabases) {
