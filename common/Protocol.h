@@ -15,7 +15,7 @@ namespace qn::protocol {
 // MessagePack value. Requests are [op, request_id, args...]; replies [request_id, result].
 inline constexpr std::uint32_t kVersion = 1;
 inline constexpr std::size_t kMaxBodyBytes = 1 << 20;  // 1 MiB
-inline constexpr int kMaxDepth = 64;                  // nesting of arrays and maps
+inline constexpr int kMaxDepth = 64;                   // nesting of arrays and maps
 inline constexpr std::uint32_t kConnectionErrorRequestId = 0;
 inline constexpr const char* kIpcErrorDomain = "com.norvel.quenta.ipc";
 
@@ -54,14 +54,17 @@ const char* OpName(Op op);
 
 // Codes of connection-level errors ([0, {"domain", "code", "message"}]).
 enum class ConnectionError : std::int64_t {
-  kBadLength = 1,      // a frame length of 0 or over kMaxBodyBytes
-  kBadMessagePack = 2, // the body is not exactly one valid MessagePack value
-  kTooDeep = 3,        // nesting over kMaxDepth
-  kBadRequest = 4,     // not an array [op, request_id, ...] with integer op and request_id
-  kUnknownOp = 5,      // op outside 1..11
-  kBadArguments = 6,   // wrong count or kind of arguments
-  kTooMuchQueued = 7,  // the peer does not read its replies
+  kBadLength = 1,           // a frame length of 0 or over kMaxBodyBytes
+  kBadMessagePack = 2,      // the body is not exactly one valid MessagePack value
+  kTooDeep = 3,             // nesting over kMaxDepth
+  kBadRequest = 4,          // not an array [op, request_id, ...] with integer op and request_id
+  kUnknownOp = 5,           // op outside 1..11
+  kBadArguments = 6,        // wrong count or kind of arguments
+  kTooMuchQueued = 7,       // the peer does not read its replies
+  kTooManyConnections = 8,  // the daemon already serves as many connections as it may
+  kReplyTooLarge = 9,       // a reply does not fit in a frame
 };
+inline constexpr std::int64_t kLastConnectionError = 9;
 
 // Checks a decoded request against the operation table. On success returns the op and
 // request id and leaves the arguments (args[2..]) as they are; on failure returns the

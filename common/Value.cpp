@@ -465,4 +465,18 @@ bool Dictionary::operator==(const Dictionary& other) const {
   return true;
 }
 
+std::size_t Value::ApproximateBytes() const {
+  constexpr std::size_t kOverhead = sizeof(Value);
+  if (const auto* text = as_string()) return kOverhead + text->size();
+  if (const auto* data = as_data()) return kOverhead + data->bytes.size();
+  std::size_t total = kOverhead;
+  if (const auto* items = as_array()) {
+    for (const Value& item : *items) total += item.ApproximateBytes();
+  } else if (const auto* entries = as_dictionary()) {
+    for (const auto& [key, value] : *entries)
+      total += key.ApproximateBytes() + value.ApproximateBytes();
+  }
+  return total;
+}
+
 }  // namespace qn

@@ -44,7 +44,18 @@ struct Date {
 // Not thread-safe to mutate (it has no mutators); safe to read from any thread.
 class Value {
  public:
-  enum class Kind { kNull, kBool, kInt, kUInt, kDouble, kString, kData, kDate, kArray, kDictionary };
+  enum class Kind {
+    kNull,
+    kBool,
+    kInt,
+    kUInt,
+    kDouble,
+    kString,
+    kData,
+    kDate,
+    kArray,
+    kDictionary
+  };
 
   Value() = default;
   Value(std::nullptr_t) {}
@@ -103,6 +114,10 @@ class Value {
 
   bool operator==(const Value& other) const;
   std::size_t Hash() const;
+
+  // Roughly the bytes the value takes in memory (strings and data by their length, every
+  // element and entry by a fixed overhead). For limits, not for accounting to the byte.
+  std::size_t ApproximateBytes() const;
 
  private:
   friend class Dictionary;

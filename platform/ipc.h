@@ -1,10 +1,10 @@
 #pragma once
 
+#include <sys/types.h>
 #include <cstdint>
 #include <functional>
 #include <memory>
 #include <string>
-#include <sys/types.h>
 
 #include "common/Protocol.h"
 #include "common/Value.h"
@@ -24,6 +24,13 @@ class IpcExportedObject {
   // operation table (protocol::ValidateRequest): `args` are the request's arguments only.
   // Called on the IPC layer's thread, one request at a time per connection, in order.
   virtual void HandleRequest(protocol::Op op, const Array& args, IpcReply reply) = 0;
+
+  // Calls `done` once every request handed to HandleRequest before this call has been
+  // taken in: its work ran and the replies it makes at once were made (a reply the object
+  // keeps back to send later does not count). `done` may run on any thread. Connections use
+  // it to bound the requests they have handed over but not yet seen taken in, and to send
+  // the replies of requests read before a bad frame ahead of the error frame.
+  virtual void AfterRequests(std::function<void()> done) = 0;
 };
 
 // One client connection. Handlers and the exported object are set before Resume; the

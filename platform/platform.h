@@ -5,6 +5,7 @@
 #include <mutex>
 #include <string>
 
+#include "common/Counters.h"
 #include "platform/analytics.h"
 #include "platform/defaults.h"
 #include "platform/device_info.h"
@@ -43,6 +44,13 @@ struct Platform {
   // thread that stops them. A stop reply is sent only after the queue has run the write
   // that stop queued. Null: a session writes its file on the thread that stops it.
   std::shared_ptr<SerialQueue> summary_queue;
+  // Where the service counts what it took in and refused (`qnreport stats`). Never null.
+  std::shared_ptr<Counters> counters = std::make_shared<Counters>();
+  // The payload bytes (Value::ApproximateBytes) one session aggregates for its summary
+  // while started. A payload beyond it is still delivered, only left out of the summary, so
+  // one client cannot grow the daemon's memory without end.
+  std::size_t max_aggregated_bytes = kDefaultMaxAggregatedBytes;
+  static constexpr std::size_t kDefaultMaxAggregatedBytes = 4u << 20;
 
   // Process-wide state that is computed once (the internal-build flag). It lives here so
   // that each test's Platform starts afresh.

@@ -43,6 +43,12 @@ struct QNReportingServerContext {
   // daemon's memory. Replacing an existing ID is always allowed.
   static constexpr std::size_t kDefaultMaxSessionsPerClient = 16384;
   std::size_t maxSessionsPerClient = kDefaultMaxSessionsPerClient;
+  // The most sessions all clients together may hold, counted in platform->counters
+  // (sessionsOpen); beyond it a create makes no session either. It keeps the
+  // getAllReporters: reply within a frame: each reporter ID takes at most 9 bytes.
+  static constexpr std::size_t kDefaultMaxSessions = 65536;
+  static constexpr std::size_t kMostMaxSessions = 100000;
+  std::size_t maxSessions = kDefaultMaxSessions;
 
   // The sessions made by every server instance. Never null.
   std::shared_ptr<QNReportingSessionRegistry> sessions =

@@ -103,6 +103,8 @@ QNReportingServerInstance::QNReportingServerInstance(
     : context_(std::move(context)), delegate_(std::move(delegate)), processIdentifier_(pid) {}
 
 QNReportingServerInstance::~QNReportingServerInstance() {
+  Counters::Add(context_.platform->counters->sessionsOpen,
+                -static_cast<std::int64_t>(sessions_.size()));
   QN_LOG(context_.log(), context_.scope(), LogLevel::kDefault,
          "%s:%d:%s: dealloc %i from the server client list", processIdentifier_);
 }
@@ -152,16 +154,27 @@ void QNReportingServerInstance::createReportingSession(std::int64_t reporterID, 
     const auto& ctx = self.context_;
     ctx.platform->trace->TracePoint(kTraceCreateRequest);
     std::shared_ptr<QNReportingSession> session;
-    if (self.sessions_.size() >= ctx.maxSessionsPerClient && !self.sessions_.Contains(reporterID)) {
+    Counters& counters = *ctx.platform->counters;
+    const bool isNew = !self.sessions_.Contains(reporterID);
+    const auto open = static_cast<std::size_t>(Counters::Get(counters.sessionsOpen));
+    if (isNew && self.sessions_.size() >= ctx.maxSessionsPerClient) {
+      Counters::Add(counters.sessionsRefused);
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kError,
              "%s:%d:%s: client %i already holds %lu sessions, no session for reporter %lli",
              self.processIdentifier_, self.sessions_.size(), reporterID);
+    } else if (isNew && open >= ctx.maxSessions) {
+      Counters::Add(counters.sessionsRefused);
+      QN_LOG(ctx.log(), ctx.scope(), LogLevel::kError,
+             "%s:%d:%s: the clients hold %lu sessions, the most allowed; no session for reporter "
+             "%lli of client %i",
+             open, reporterID, self.processIdentifier_);
     } else {
       session = QNReportingSession::initWithID(ctx.platform, reporterID,
                                                Array{Value(self.processIdentifier_)});
     }
     if (session) {
       ctx.sessions->Add(session);
+      if (isNew) Counters::Add(counters.sessionsOpen, 1);
       self.sessions_.Set(reporterID, std::move(session));
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault,
              "%s:%d:%s: session created for reporter %lli", reporterID);
@@ -381,6 +394,7 @@ void QNReportingServerInstance::destroyReportingSession(std::int64_t reporterID,
     if (auto session = self.sessions_.Find(reporterID)) {
       if (session->started()) session->stop();
       self.sessions_.Erase(reporterID);
+      Counters::Add(ctx.platform->counters->sessionsOpen, -1);
     }
     QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault, "%s:%d:%s: destroying %lli", reporterID);
     reply(true);

@@ -59,6 +59,7 @@ QNReportingServiceDelegate::QNReportingServiceDelegate(Token,
                                                        Options options) {
   context_.platform = std::move(platform);
   context_.maxSessionsPerClient = options.maxSessionsPerClient;
+  context_.maxSessions = options.maxSessions;
   const Platform& p = *context_.platform;
   context_.logScope =
       p.log->RegisterScope(true, kLogScopeCode, "qnrs", "com.norvel.quenta", kLogScopeName, 31);
@@ -86,7 +87,7 @@ bool QNReportingServiceDelegate::ShouldAcceptNewConnection(
   std::shared_ptr<IpcExportedObject> exported;
   {
     std::lock_guard monitor(lock_);
-    exported = MakeExportedObject(instance);
+    exported = MakeExportedObject(instance, context_.serverQueue, context_.platform->summary_queue);
   }
   connection->SetExportedObject(std::move(exported));
 

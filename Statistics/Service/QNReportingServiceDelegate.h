@@ -67,6 +67,8 @@ class QNReportingServiceDelegate final
   struct Options {
     // The most sessions one client may hold (see QNReportingServerContext).
     std::size_t maxSessionsPerClient = QNReportingServerContext::kDefaultMaxSessionsPerClient;
+    // The most sessions all clients together may hold.
+    std::size_t maxSessions = QNReportingServerContext::kDefaultMaxSessions;
   };
   static std::shared_ptr<QNReportingServiceDelegate> Create(
       std::shared_ptr<const Platform> platform, Options options);

@@ -62,12 +62,31 @@ ErrorReply WireError(IpcReply reply) {
 // its wire value. Called on the IPC layer's thread; replies may come from any thread.
 class ServiceExportedObject final : public IpcExportedObject {
  public:
-  explicit ServiceExportedObject(std::shared_ptr<QNReportingServiceProtocol> service)
-      : service_(std::move(service)) {}
+  ServiceExportedObject(std::shared_ptr<QNReportingServiceProtocol> service,
+                        std::shared_ptr<SerialQueue> serverQueue,
+                        std::shared_ptr<SerialQueue> summaryQueue)
+      : service_(std::move(service)),
+        serverQueue_(std::move(serverQueue)),
+        summaryQueue_(std::move(summaryQueue)) {}
+
+  // Called on the IPC layer's thread, like HandleRequest, so stopSince_ needs no lock.
+  void AfterRequests(std::function<void()> done) override {
+    if (!std::exchange(stopSince_, false) || !summaryQueue_) {
+      serverQueue_->Async(std::move(done));
+      return;
+    }
+    // server queue (the stop runs) -> summary queue (its file) -> server queue (its reply).
+    serverQueue_->Async(
+        [server = serverQueue_, summaries = summaryQueue_, done = std::move(done)]() mutable {
+          summaries->Async(
+              [server, done = std::move(done)]() mutable { server->Async(std::move(done)); });
+        });
+  }
 
   void HandleRequest(protocol::Op op, const Array& args, IpcReply reply) override {
     using protocol::Op;
     QNReportingServiceProtocol& service = *service_;
+    if (op == Op::kStopReportingSession) stopSince_ = true;
     switch (op) {
       case Op::kCreateReportingSession:
         service.createReportingSession(ReporterIDArg(args[0]), WireBool(std::move(reply)));
@@ -112,13 +131,18 @@ class ServiceExportedObject final : public IpcExportedObject {
 
  private:
   const std::shared_ptr<QNReportingServiceProtocol> service_;
+  const std::shared_ptr<SerialQueue> serverQueue_;
+  const std::shared_ptr<SerialQueue> summaryQueue_;
+  bool stopSince_ = false;  // a stop was handed over since the last AfterRequests
 };
 
 }  // namespace
 
 std::shared_ptr<IpcExportedObject> MakeExportedObject(
-    std::shared_ptr<QNReportingServiceProtocol> service) {
-  return std::make_shared<ServiceExportedObject>(std::move(service));
+    std::shared_ptr<QNReportingServiceProtocol> service, std::shared_ptr<SerialQueue> serverQueue,
+    std::shared_ptr<SerialQueue> summaryQueue) {
+  return std::make_shared<ServiceExportedObject>(std::move(service), std::move(serverQueue),
+                                                 std::move(summaryQueue));
 }
 
 Value ErrorToWire(const std::optional<Error>& error) {

@@ -8,6 +8,7 @@
 
 #include "common/Error.h"
 #include "common/Value.h"
+#include "platform/dispatch.h"
 #include "platform/ipc.h"
 
 namespace qn {
@@ -48,8 +49,13 @@ class QNReportingServiceProtocol {
 // The exported object for a connection: decodes each checked request into a call of
 // `service` and encodes its replies ([request_id, result] is added by the IPC layer).
 // Holds `service` strongly, as a connection holds its exported object.
+//
+// `service` queues every request on `serverQueue`, so a request is taken in once the
+// server queue has run past it; a stop's reply comes back to the server queue through
+// `summaryQueue` (may be null), so after a stop AfterRequests follows that path too.
 std::shared_ptr<IpcExportedObject> MakeExportedObject(
-    std::shared_ptr<QNReportingServiceProtocol> service);
+    std::shared_ptr<QNReportingServiceProtocol> service, std::shared_ptr<SerialQueue> serverQueue,
+    std::shared_ptr<SerialQueue> summaryQueue);
 
 // The wire form of an error reply of sendMessage: {"domain", "code", "userInfo": nil}.
 Value ErrorToWire(const std::optional<Error>& error);

@@ -182,6 +182,7 @@ void QNReportingSession::start() {
   // Whatever was aggregated before (unstarted, or an earlier started period) is dropped.
   aggregatedPayloadData_.store(std::make_shared<QNReportingPayloadArray>());
   nestedAggregatedPayloadData_.store(std::make_shared<QNReportingPayloadArray>());
+  aggregationCapped_.store(false);
   TracePoint(*platform_, kTraceSessionStart);
 
   if (shouldReportOrientation()) {
@@ -338,10 +339,14 @@ std::string QNReportingSession::messageIdForCategory(std::uint32_t category, std
 // ---------------------------------------------------------------------------------------
 // Message delivery
 
-void QNReportingSession::Append(const std::shared_ptr<QNReportingPayloadArray>& array, Value item) {
-  if (!array) return;  // stopped: nothing is aggregated
+bool QNReportingSession::Append(const std::shared_ptr<QNReportingPayloadArray>& array, Value item,
+                                std::size_t bytes, std::size_t cap) {
+  if (!array) return false;  // stopped: nothing is aggregated
   std::lock_guard guard(array->lock);
+  if (bytes > cap || array->bytes > cap - bytes) return false;
   array->items.push_back(std::move(item));
+  array->bytes += bytes;
+  return true;
 }
 
 void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
@@ -357,13 +362,27 @@ void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
   std::shared_ptr<const Dictionary> converted = ConvertPayload(payload);
   std::string messageID = messageIdForCategory(category, type);
 
-  Append(aggregatedPayloadData(), Value(converted));
-  Append(nestedAggregatedPayloadData(), Value(Dictionary{{Value(messageID), Value(converted)}}));
+  Counters& counters = *platform_->counters;
+  auto aggregated = aggregatedPayloadData();
+  if (Append(aggregated, Value(converted), Value(converted).ApproximateBytes(),
+             platform_->max_aggregated_bytes)) {
+    Append(nestedAggregatedPayloadData(), Value(Dictionary{{Value(messageID), Value(converted)}}));
+  } else if (aggregated) {
+    Counters::Add(counters.aggregationCapped);
+    if (!aggregationCapped_.exchange(true)) {
+      SESSION_LOG(LogLevel::kError,
+                  "%s:%d:%s: session %lli holds %zu bytes of payloads, the most it aggregates; "
+                  "later messages are delivered but left out of its summary",
+                  reporterID(), platform_->max_aggregated_bytes);
+    }
+  }
   TracePoint(*platform_, kTraceMessage);
 
   const bool wasStarted = started();
+  Counters::Add(counters.deliveriesQueued, 1);
   livoReportingQueue_->Async([self = shared_from_this(), converted, payload = std::move(payload),
                               category, type, wasStarted]() mutable {
+    Counters::Add(self->platform_->counters->deliveriesQueued, -1);
     self->Deliver(std::move(converted), std::move(payload), category, type, wasStarted);
   });
   // The reply never carries a delivery result.

@@ -21,7 +21,8 @@ namespace qn {
 // is held.
 struct QNReportingPayloadArray {
   mutable std::mutex lock;
-  Array items;  // guarded by lock
+  Array items;            // guarded by lock
+  std::size_t bytes = 0;  // guarded by lock: the items' approximate size
 
   // A copy of the items, taken under the lock.
   Array Snapshot() const {
@@ -234,7 +235,10 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
                std::uint16_t type, bool wasStarted);
   void RegisterOrientationCallbacks(const std::string& callbackID);
   void HandleOrientation(bool device, std::int32_t orientation);
-  static void Append(const std::shared_ptr<QNReportingPayloadArray>& array, Value item);
+  // Appends `item` of `bytes` unless that would take the array past `cap` bytes; returns
+  // false when it did not append (also when the array is gone).
+  static bool Append(const std::shared_ptr<QNReportingPayloadArray>& array, Value item,
+                     std::size_t bytes = 0, std::size_t cap = SIZE_MAX);
 
   const std::shared_ptr<const Platform> platform_;
   const std::shared_ptr<const LogScope> scope_;  // "qnrr"; null = the default log
@@ -246,6 +250,7 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   session_detail::AtomicShared<const std::string> serviceName_;
   std::atomic<bool> started_{false};
   std::atomic<bool> livoReportingSessionStarted_{false};
+  std::atomic<bool> aggregationCapped_{false};  // the cap was reached since the last start
   session_detail::AtomicShared<const Dictionary> userInfo_;
   session_detail::AtomicShared<const Dictionary> driverSnapShot_;
   session_detail::AtomicShared<const TransactionCompleteBlock> transactionCompleteBlock_;

@@ -7,9 +7,12 @@
 
 #include <pthread.h>
 #include <signal.h>
+#include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
+#include <cerrno>
 #include <chrono>
 #include <cstdio>
 #include <cstring>
@@ -37,6 +40,7 @@
 #include "platform/linux/linux_orientation.h"
 #include "platform/linux/linux_ostrel.h"
 #include "platform/linux/linux_process.h"
+#include "platform/linux/linux_stats.h"
 #include "platform/linux/linux_trace.h"
 #include "platform/linux/reporting_store.h"
 #include "platform/linux/store_sinks.h"
@@ -91,12 +95,25 @@ client's sessions, write out the store and exit with status 0. A client's killSe
 request ends the daemon with status 2. See qnreportingd(8).
 )";
 
+// What one client may hold and how far the daemon reads ahead (docs/daemon.md, "Limits").
+struct Limits {
+  std::size_t max_connections = LinuxIpcOptions{}.max_connections;
+  std::size_t max_sessions_per_client = QNReportingServerContext::kDefaultMaxSessionsPerClient;
+  std::size_t max_sessions = QNReportingServerContext::kDefaultMaxSessions;
+  std::size_t max_aggregated_bytes = Platform::kDefaultMaxAggregatedBytes;
+  std::size_t max_pending_requests = LinuxIpcOptions{}.max_pending_requests;
+  std::size_t max_pending_bytes = LinuxIpcOptions{}.max_pending_request_bytes;
+  std::size_t max_unread_reply_bytes = LinuxIpcOptions{}.max_outgoing_bytes;
+  std::size_t store_high_water = 16384;
+};
+
 struct Options {
   PathOptions paths;
   bool internal_build = false;
   std::string device_info = kDefaultDeviceInfo;
   std::optional<std::string> driver_stats;
   std::string debug_scopes;
+  Limits limits;
 };
 
 // A CLI11 check that a value is not empty.
@@ -153,6 +170,36 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
       ->type_name("SCOPES")
       ->check(kNotEmpty)
       ->check(kDebugScopes);
+  Limits& limits = options.limits;
+  const auto limit = [&app](const char* name, std::size_t& value, const char* what,
+                            std::size_t most = SIZE_MAX) {
+    app.add_option(name, value, what)
+        ->type_name("N")
+        ->default_val(value)
+        ->check(CLI::Range(std::size_t{1}, most))
+        ->group("Limits");
+  };
+  limit("--max-connections", limits.max_connections,
+        "Connections open at once; one more gets an error frame and is closed");
+  limit("--max-sessions-per-client", limits.max_sessions_per_client,
+        "Sessions one client may hold; a create beyond it makes none");
+  limit("--max-sessions", limits.max_sessions,
+        "Sessions all clients together may hold (at most 100000, so that the list of "
+        "reporters fits a frame)",
+        QNReportingServerContext::kMostMaxSessions);
+  limit("--max-aggregated-bytes", limits.max_aggregated_bytes,
+        "Payload bytes a session keeps for its summary; later payloads are delivered, not "
+        "summarised");
+  limit("--max-pending-requests", limits.max_pending_requests,
+        "Requests of one connection in the service at once; beyond it the connection is not "
+        "read until they are taken in");
+  limit("--max-pending-bytes", limits.max_pending_bytes,
+        "Bytes of such requests of one connection (the same rule)");
+  limit("--max-unread-reply-bytes", limits.max_unread_reply_bytes,
+        "Reply bytes a client may leave unread before it is closed (it is no longer read "
+        "from an eighth of this on)");
+  limit("--store-high-water", limits.store_high_water,
+        "Messages waiting for the store above which clients that send messages are not read");
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -172,6 +219,27 @@ sigset_t HandledSignals() {
   sigaddset(&set, SIGINT);
   sigaddset(&set, SIGHUP);
   return set;
+}
+
+// The counters and the store's figures, as the stats file shows them.
+Dictionary StatsOf(const Counters& counters, const ReportingStore& store) {
+  Dictionary stats = counters.Snapshot();
+  const ReportingStore::Stats figures = store.stats();
+  stats.Set("store", Value(Dictionary{{"committed", Value(figures.committed)},
+                                      {"failed", Value(figures.failed)},
+                                      {"dropped_queue_full", Value(figures.dropped_queue_full)},
+                                      {"lag", Value(store.Backlog())},
+                                      {"batches", Value(figures.batches)}}));
+  return stats;
+}
+
+// Lets the daemon hold as many descriptors as it is allowed (one per connection).
+void RaiseDescriptorLimit() {
+  rlimit limit{};
+  if (getrlimit(RLIMIT_NOFILE, &limit) == 0 && limit.rlim_cur < limit.rlim_max) {
+    limit.rlim_cur = limit.rlim_max;
+    setrlimit(RLIMIT_NOFILE, &limit);
+  }
 }
 
 // Runs `task` on `queue` and waits until it ran, or until `deadline`. Returns whether it ran.
@@ -202,8 +270,10 @@ int Run(const Options& options) {
     }
   }
 
+  auto counters = std::make_shared<Counters>();
   LinuxLogOptions log_options;
   log_options.debug_scopes = options.debug_scopes;
+  log_options.counters = counters;
   std::shared_ptr<Log> log = NewLinuxLog(log_options);
 
   std::optional<Error> store_error;
@@ -216,6 +286,8 @@ int Run(const Options& options) {
   }
 
   auto platform = std::make_shared<Platform>();
+  platform->counters = counters;
+  platform->max_aggregated_bytes = options.limits.max_aggregated_bytes;
   platform->log = log;
   platform->trace = NewLinuxTrace();
   platform->dispatcher = NewLinuxDispatcher();
@@ -247,11 +319,30 @@ int Run(const Options& options) {
   platform->enerdex = NewStoreEnerdex(store);
   platform->analytics = NewStoreAnalytics(store);
 
-  std::shared_ptr<QNReportingServiceDelegate> delegate =
-      QNReportingServiceDelegate::Create(platform);
+  std::shared_ptr<QNReportingServiceDelegate> delegate = QNReportingServiceDelegate::Create(
+      platform, {.maxSessionsPerClient = options.limits.max_sessions_per_client,
+                 .maxSessions = options.limits.max_sessions});
 
   LinuxIpcOptions ipc_options;
   ipc_options.socket_path = paths.socket_path;
+  ipc_options.counters = counters;
+  ipc_options.max_connections = options.limits.max_connections;
+  ipc_options.max_pending_requests = options.limits.max_pending_requests;
+  ipc_options.max_pending_request_bytes = options.limits.max_pending_bytes;
+  ipc_options.max_outgoing_bytes = options.limits.max_unread_reply_bytes;
+  ipc_options.pause_reply_bytes =
+      std::max<std::size_t>(1, options.limits.max_unread_reply_bytes / 8);
+  // Messages waiting in the sessions' queues and in the store's queue: above the mark the
+  // clients that send messages wait (they are not read), so a slow disk slows them down
+  // instead of filling the daemon's memory.
+  ipc_options.message_intake_blocked = [store = std::weak_ptr<ReportingStore>(store), counters,
+                                        high_water = options.limits.store_high_water] {
+    auto open = store.lock();
+    const std::int64_t queued = Counters::Get(counters->deliveriesQueued);
+    return (open ? open->Backlog() : 0) +
+               static_cast<std::uint64_t>(std::max<std::int64_t>(queued, 0)) >
+           high_water;
+  };
   LinuxIpcListenerResult listening =
       NewLinuxIpcListener(ipc_options, log, delegate->context().logScope);
   if (!listening.listener) {
@@ -265,11 +356,17 @@ int Run(const Options& options) {
 
   // The one thread that takes the handled signals (blocked everywhere else).
   std::shared_ptr<Notify> notify = platform->notify;
-  std::thread signals([listener, notify, log] {
+  auto stats = std::make_shared<LinuxStatsPublisher>(paths.runtime_dir + "/" + kStatsFileName);
+  std::thread signals([listener, notify, log, stats, counters, store] {
     const sigset_t set = HandledSignals();
     for (;;) {
-      int signal = 0;
-      if (sigwait(&set, &signal) != 0) continue;
+      // Between signals, once a second, the counters are published.
+      const timespec second{1, 0};
+      const int signal = sigtimedwait(&set, nullptr, &second);
+      if (signal < 0) {
+        if (errno == EAGAIN) stats->Publish(StatsOf(*counters, *store));
+        continue;
+      }
       if (signal == SIGHUP) {
         notify->Post(kQNReportingDefaultsNotification);
         continue;
@@ -325,8 +422,12 @@ int main(int argc, char** argv) {
   // thread ever takes these signals.
   const sigset_t handled = qn::HandledSignals();
   pthread_sigmask(SIG_BLOCK, &handled, nullptr);
+  // A reader that went away (a client socket, a stderr pipe) is an error to handle where
+  // it happens, never a reason to die.
+  signal(SIGPIPE, SIG_IGN);
 
   qn::Options options;
   if (auto status = qn::ParseCommandLine(argc, argv, options)) return *status;
+  qn::RaiseDescriptorLimit();
   return qn::Run(options);
 }

@@ -13,6 +13,7 @@ qn_library(qn_linux_base
     linux_notify.cpp
     linux_defaults.cpp
     small_file.cpp
+    linux_stats.cpp
 )
 if(QN_SANITIZE STREQUAL "thread" AND TARGET qn_linux_base)
   # asio uses std::atomic_thread_fence, which GCC flags under TSan (-Wtsan); the fence is

@@ -34,6 +34,8 @@ constexpr std::size_t kReadChunkBytes = 16 * 1024;
 constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
 // How long accepting pauses after a failed accept (typically fd exhaustion) before retrying.
 constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
+// How often a connection held back because the store is behind looks again.
+constexpr auto kStoreRecheck = std::chrono::milliseconds(5);
 
 std::string ErrnoText(const std::string& what, int error) {
   return what + ": " + std::strerror(error);
@@ -202,6 +204,12 @@ class LinuxIpcListener;
 // One accepted connection. Lives as long as its pending asio operations, the listener's
 // registry, or a reply in progress hold it. Everything except QueueReply and the getters runs
 // on the listener's io_context thread.
+//
+// Flow control: requests are handed to the exported object while fewer than
+// `max_pending_requests` (and `max_pending_request_bytes`) of them wait to be taken in;
+// beyond that, and while the peer leaves too many reply bytes unread, or while the store is
+// behind and this connection sends messages, the connection is not read. Frames already
+// read stay in the decoder until the connection may go on.
 class LinuxConnection final : public IpcConnection,
                               public std::enable_shared_from_this<LinuxConnection> {
  public:
@@ -222,9 +230,13 @@ class LinuxConnection final : public IpcConnection,
   }
   void Resume() override;
 
-  // Frames [request_id, result] and queues it. Any thread; dropped once the connection is
-  // closing or ended.
+  // Frames [request_id, result] and queues it. Any thread; dropped once the error frame
+  // is queued or the connection ended.
   void QueueReply(std::uint32_t request_id, Value result);
+
+  // Sends the error frame at once and closes the connection once it is written (or after
+  // the flush time-out): a connection refused at accept. io_context thread.
+  void Refuse(protocol::ConnectionError code, const std::string& message);
 
   // Ends the connection: closes the socket, calls the invalidation handler (once) and lets
   // go of the exported object and handlers. io_context thread.
@@ -235,17 +247,35 @@ class LinuxConnection final : public IpcConnection,
   void Abandon();
 
  private:
-  enum class State { kOpen, kClosing, kEnded };
+  enum class State {
+    kOpen,      // reading and handing requests over
+    kDraining,  // a bad frame came: no more reading; replies of earlier requests still go out
+    kClosing,   // the error frame is queued: later replies are dropped
+    kEnded,
+  };
+  // Why the connection is not read for now.
+  enum class Hold { kNone, kRequests, kReplies, kStore };
 
+  // Hands over the frames already read and reads more, as far as flow control allows.
+  void Pump();
   void StartRead();
   void OnRead(const asio::error_code& error, std::size_t bytes);
-  // Handles every complete frame in the decoder; returns false once the connection failed.
+  // Hands complete frames to the exported object until one is bad or the connection must
+  // wait; returns false once the connection failed.
   bool HandleFrames();
-  // Bad input: queue the error frame, log, stop reading, close once it is written.
+  // Asks the exported object to say when the requests handed since the last call are taken.
+  void CloseBatch();
+  void OnBatchTaken(std::size_t requests, std::size_t bytes);
+  Hold WhyHeld();
+  // Bad input: log and count it, stop reading, and queue the error frame once every request
+  // read before it has been taken in (so that their replies go out first).
   void Fail(protocol::ConnectionError code, const std::string& message);
+  // Queues the error frame behind the replies and closes once it is written.
+  void SendErrorFrame();
   void StartWriteLocked();  // REQUIRES: mu_ held
   void OnWrite(const asio::error_code& error);
   void OnOverflow();
+  void OnReplyTooLarge(std::uint32_t request_id, std::size_t bytes);
 
   // The listener is only reached while the connection is not ended (Finish, Forget); replies
   // may still arrive after it is gone, so they use the shared pieces below instead.
@@ -253,6 +283,8 @@ class LinuxConnection final : public IpcConnection,
   const std::shared_ptr<asio::io_context> io_;
   const std::shared_ptr<Log> log_;
   const std::shared_ptr<const LogScope> scope_;
+  const std::shared_ptr<Counters> counters_;
+  const LinuxIpcOptions& options_;  // the listener's; read on the io thread only
   const std::size_t max_outgoing_bytes_;
   const int error_flush_timeout_ms_;
   Socket socket_;
@@ -260,6 +292,7 @@ class LinuxConnection final : public IpcConnection,
   const uid_t uid_;
   const std::string description_;
   asio::steady_timer close_timer_;
+  asio::steady_timer store_timer_;  // re-checks the store while it holds this connection
 
   // io_context thread only.
   std::shared_ptr<IpcExportedObject> object_;
@@ -267,7 +300,15 @@ class LinuxConnection final : public IpcConnection,
   std::function<void()> invalidation_;
   FrameDecoder decoder_;
   std::unique_ptr<char[]> read_buffer_;
-  bool reading_ = false;
+  bool resumed_ = false;
+  bool read_in_flight_ = false;
+  Hold hold_ = Hold::kNone;
+  bool sends_messages_ = false;
+  std::size_t untaken_requests_ = 0;  // handed over, not yet known to be taken in
+  std::size_t untaken_bytes_ = 0;
+  std::size_t batch_requests_ = 0;  // of those, handed since the last CloseBatch
+  std::size_t batch_bytes_ = 0;
+  std::string error_frame_;  // waiting for the requests before it to be taken in
 
   std::mutex mu_;
   State state_ = State::kOpen;     // guarded by mu_ (written on the io thread)
@@ -275,7 +316,6 @@ class LinuxConnection final : public IpcConnection,
   std::string writing_;            // the bytes of the write in flight (io thread while writing)
   std::size_t writing_bytes_ = 0;  // guarded by mu_: writing_.size() while a write is in flight
   bool write_active_ = false;      // guarded by mu_: a write is in flight or posted
-  bool overflowed_ = false;        // guarded by mu_
 };
 
 class LinuxIpcListener final : public IpcListener {
@@ -284,6 +324,7 @@ class LinuxIpcListener final : public IpcListener {
                    std::shared_ptr<const LogScope> scope, ListeningSocket socket)
       : options_(options),
         log_(std::move(log)),
+        counters_(options.counters ? options.counters : std::make_shared<Counters>()),
         scope_(std::move(scope)),
         acceptor_(*io_),
         backoff_(*io_),
@@ -329,9 +370,12 @@ class LinuxIpcListener final : public IpcListener {
   const std::shared_ptr<Log>& log() const { return log_; }
   const std::shared_ptr<const LogScope>& scope() const { return scope_; }
   const LinuxIpcOptions& options() const { return options_; }
+  const std::shared_ptr<Counters>& counters() const { return counters_; }
 
   // io_context thread.
-  void Forget(LinuxConnection* connection) { connections_.erase(connection); }
+  void Forget(LinuxConnection* connection) {
+    if (connections_.erase(connection)) Counters::Add(counters_->connectionsOpen, -1);
+  }
 
  private:
   void StartAccept() {
@@ -367,7 +411,21 @@ class LinuxIpcListener final : public IpcListener {
     }
     auto connection = std::make_shared<LinuxConnection>(*this, std::move(socket), credentials.pid,
                                                         credentials.uid);
+    const bool over_limit = connections_.size() >= options_.max_connections;
     connections_.emplace(connection.get(), connection);
+    Counters::Add(counters_->connectionsOpen, 1);
+    if (over_limit) {
+      Counters::Add(counters_->connectionsRefused);
+      QN_LOG(*log_, scope_.get(), LogLevel::kError,
+             "%s:%d:%s: %s refused: %zu connections are open, the most allowed",
+             connection->Description(), options_.max_connections);
+      connection->Refuse(protocol::ConnectionError::kTooManyConnections,
+                         StringWithFormat("the daemon serves %zu connections, the most it allows; "
+                                          "try again later",
+                                          options_.max_connections));
+      StartAccept();
+      return;
+    }
     const bool accepted = delegate_ && delegate_->ShouldAcceptNewConnection(*this, connection);
     if (!accepted) connection->Finish();
     StartAccept();
@@ -401,6 +459,7 @@ class LinuxIpcListener final : public IpcListener {
 
   const LinuxIpcOptions options_;
   const std::shared_ptr<Log> log_;
+  const std::shared_ptr<Counters> counters_;
   const std::shared_ptr<const LogScope> scope_;
   // Shared with the connections: a connection that outlives the listener (a reply in
   // progress on another thread holds it) still destroys its socket against a live context.
@@ -423,6 +482,8 @@ LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_
       io_(listener.io()),
       log_(listener.log()),
       scope_(listener.scope()),
+      counters_(listener.counters()),
+      options_(listener.options()),
       max_outgoing_bytes_(listener.options().max_outgoing_bytes),
       error_flush_timeout_ms_(listener.options().error_flush_timeout_ms),
       socket_(std::move(socket)),
@@ -430,22 +491,69 @@ LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_
       uid_(uid),
       description_(
           StringWithFormat("<connection pid=%d uid=%u fd=%d>", pid, uid, socket_.native_handle())),
-      close_timer_(*listener.io()) {}
+      close_timer_(*listener.io()),
+      store_timer_(*listener.io()) {}
 
 void LinuxConnection::Resume() {
   asio::dispatch(*io_, [self = shared_from_this()] {
-    if (self->reading_) return;
+    if (self->resumed_) return;
     {
       std::lock_guard lock(self->mu_);
       if (self->state_ != State::kOpen) return;
     }
-    self->reading_ = true;
+    self->resumed_ = true;
     self->read_buffer_ = std::make_unique<char[]>(kReadChunkBytes);
-    self->StartRead();
+    self->Pump();
   });
 }
 
+LinuxConnection::Hold LinuxConnection::WhyHeld() {
+  if (untaken_requests_ >= options_.max_pending_requests ||
+      untaken_bytes_ >= options_.max_pending_request_bytes) {
+    return Hold::kRequests;
+  }
+  {
+    std::lock_guard lock(mu_);
+    if (pending_.size() + writing_bytes_ >= options_.pause_reply_bytes) return Hold::kReplies;
+  }
+  if (sends_messages_ && options_.message_intake_blocked && options_.message_intake_blocked()) {
+    return Hold::kStore;
+  }
+  return Hold::kNone;
+}
+
+void LinuxConnection::Pump() {
+  {
+    std::lock_guard lock(mu_);
+    if (state_ != State::kOpen) return;
+  }
+  if (!resumed_) return;
+  const bool ok = HandleFrames();
+  CloseBatch();
+  if (!ok) return;
+  const Hold hold = WhyHeld();
+  if (hold != Hold::kNone) {
+    if (hold_ != hold) {
+      Counters::Add(hold == Hold::kRequests  ? counters_->pausedForRequests
+                    : hold == Hold::kReplies ? counters_->pausedForReplies
+                                             : counters_->pausedForStore);
+    }
+    hold_ = hold;
+    if (hold == Hold::kStore) {
+      // The store says nothing when it catches up; look again shortly.
+      store_timer_.expires_after(kStoreRecheck);
+      store_timer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
+        if (!error) self->Pump();
+      });
+    }
+    return;
+  }
+  hold_ = Hold::kNone;
+  if (!read_in_flight_) StartRead();
+}
+
 void LinuxConnection::StartRead() {
+  read_in_flight_ = true;
   socket_.async_read_some(
       asio::buffer(read_buffer_.get(), kReadChunkBytes),
       [self = shared_from_this()](const asio::error_code& error, std::size_t bytes) {
@@ -454,6 +562,7 @@ void LinuxConnection::StartRead() {
 }
 
 void LinuxConnection::OnRead(const asio::error_code& error, std::size_t bytes) {
+  read_in_flight_ = false;
   {
     std::lock_guard lock(mu_);
     if (state_ != State::kOpen) return;
@@ -469,11 +578,14 @@ void LinuxConnection::OnRead(const asio::error_code& error, std::size_t bytes) {
     return;
   }
   decoder_.Feed(std::string_view(read_buffer_.get(), bytes));
-  if (HandleFrames()) StartRead();
+  Pump();
 }
 
 bool LinuxConnection::HandleFrames() {
-  while (auto body = decoder_.Next()) {
+  while (WhyHeld() == Hold::kNone) {
+    auto body = decoder_.Next();
+    if (!body) break;
+    const std::size_t bytes = body->size() + kFrameHeaderBytes;
     auto decoded = DecodeMsgPack(*body);
     if (auto* problem = std::get_if<protocol::RequestProblem>(&decoded)) {
       Fail(problem->code, problem->message);
@@ -494,6 +606,12 @@ bool LinuxConnection::HandleFrames() {
              header.request_id, protocol::OpName(header.op));
       continue;
     }
+    Counters::Add(counters_->requests[static_cast<std::size_t>(header.op)]);
+    if (header.op == protocol::Op::kSendMessage) sends_messages_ = true;
+    ++batch_requests_;
+    batch_bytes_ += bytes;
+    ++untaken_requests_;
+    untaken_bytes_ += bytes;
     std::weak_ptr<LinuxConnection> weak = shared_from_this();
     const std::uint32_t request_id = header.request_id;
     object_->HandleRequest(header.op, args, [weak, request_id](Value result) {
@@ -509,20 +627,64 @@ bool LinuxConnection::HandleFrames() {
   return true;
 }
 
+void LinuxConnection::CloseBatch() {
+  if (batch_requests_ == 0 || !object_) return;
+  const std::size_t requests = std::exchange(batch_requests_, 0);
+  const std::size_t bytes = std::exchange(batch_bytes_, 0);
+  std::weak_ptr<LinuxConnection> weak = shared_from_this();
+  object_->AfterRequests([weak, io = io_, requests, bytes] {
+    asio::post(*io, [weak, requests, bytes] {
+      if (auto connection = weak.lock()) connection->OnBatchTaken(requests, bytes);
+    });
+  });
+}
+
+void LinuxConnection::OnBatchTaken(std::size_t requests, std::size_t bytes) {
+  untaken_requests_ -= requests;
+  untaken_bytes_ -= bytes;
+  if (!error_frame_.empty()) {
+    if (untaken_requests_ == 0) SendErrorFrame();
+    return;
+  }
+  if (hold_ == Hold::kRequests) Pump();
+}
+
 void LinuxConnection::Fail(protocol::ConnectionError code, const std::string& message) {
-  QN_LOG(*log_, scope_.get(), LogLevel::kError,
-         "%s:%d:%s: %s: bad input (code %lld): %s; closing the connection", description_,
-         static_cast<long long>(code), message);
-  std::string frame;
-  AppendFrame(frame, protocol::MakeConnectionError(code, message));
   {
     std::lock_guard lock(mu_);
     if (state_ != State::kOpen) return;
+    state_ = State::kDraining;
+  }
+  QN_LOG(*log_, scope_.get(), LogLevel::kError,
+         "%s:%d:%s: %s: bad input (code %lld): %s; closing the connection", description_,
+         static_cast<long long>(code), message);
+  const auto index = static_cast<std::size_t>(code);
+  if (index < counters_->badFrames.size()) Counters::Add(counters_->badFrames[index]);
+  AppendFrame(error_frame_, protocol::MakeConnectionError(code, message));
+  store_timer_.cancel();
+  CloseBatch();
+  if (untaken_requests_ == 0) SendErrorFrame();
+}
+
+void LinuxConnection::Refuse(protocol::ConnectionError code, const std::string& message) {
+  {
+    std::lock_guard lock(mu_);
+    if (state_ != State::kOpen) return;
+    state_ = State::kDraining;
+  }
+  AppendFrame(error_frame_, protocol::MakeConnectionError(code, message));
+  SendErrorFrame();
+}
+
+void LinuxConnection::SendErrorFrame() {
+  {
+    std::lock_guard lock(mu_);
+    if (state_ != State::kDraining) return;
     state_ = State::kClosing;
-    // Replies queued before the bad frame still go out first; the error frame is last.
-    pending_ += frame;
+    pending_ += error_frame_;
     if (!write_active_) StartWriteLocked();
   }
+  error_frame_.clear();
   close_timer_.expires_after(std::chrono::milliseconds(error_flush_timeout_ms_));
   close_timer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
     if (!error) self->Finish();
@@ -532,18 +694,17 @@ void LinuxConnection::Fail(protocol::ConnectionError code, const std::string& me
 void LinuxConnection::QueueReply(std::uint32_t request_id, Value result) {
   std::string frame;
   if (!AppendFrame(frame, Value(Array{Value(request_id), std::move(result)}))) {
-    QN_LOG(*log_, scope_.get(), LogLevel::kError,
-           "%s:%d:%s: %s: reply to request %u is larger than a frame may be; dropped", description_,
-           request_id);
+    asio::post(*io_, [self = shared_from_this(), request_id] {
+      self->OnReplyTooLarge(request_id, protocol::kMaxBodyBytes);
+    });
     return;
   }
   std::lock_guard lock(mu_);
-  if (state_ != State::kOpen) return;
+  if (state_ != State::kOpen && state_ != State::kDraining) return;
   pending_ += frame;
   if (pending_.size() + writing_bytes_ > max_outgoing_bytes_) {
     pending_.clear();
     state_ = State::kClosing;
-    overflowed_ = true;
     asio::post(*io_, [self = shared_from_this()] { self->OnOverflow(); });
     return;
   }
@@ -558,7 +719,15 @@ void LinuxConnection::QueueReply(std::uint32_t request_id, Value result) {
   }
 }
 
+void LinuxConnection::OnReplyTooLarge(std::uint32_t request_id, std::size_t limit) {
+  Counters::Add(counters_->repliesTooLarge);
+  Fail(protocol::ConnectionError::kReplyTooLarge,
+       StringWithFormat("the reply to request %u does not fit in a frame (%zu bytes at most)",
+                        request_id, limit));
+}
+
 void LinuxConnection::OnOverflow() {
+  Counters::Add(counters_->repliesUnread);
   QN_LOG(*log_, scope_.get(), LogLevel::kError,
          "%s:%d:%s: %s: peer does not read its replies (more than %zu bytes queued); closing "
          "the connection",
@@ -594,9 +763,12 @@ void LinuxConnection::OnWrite(const asio::error_code& error) {
     StartWriteLocked();
     return;
   }
-  if (state_ == State::kClosing && !overflowed_) {
-    lock.unlock();
+  const State state = state_;
+  lock.unlock();
+  if (state == State::kClosing) {
     Finish();  // the error frame is out
+  } else if (hold_ == Hold::kReplies) {
+    Pump();
   }
 }
 
@@ -611,6 +783,7 @@ void LinuxConnection::Finish() {
   socket_.shutdown(Socket::shutdown_both, ignored);
   socket_.close(ignored);
   close_timer_.cancel();
+  store_timer_.cancel();
   auto keep = shared_from_this();
   listener_.Forget(this);
   auto invalidation = std::move(invalidation_);
@@ -630,6 +803,7 @@ void LinuxConnection::Abandon() {
   asio::error_code ignored;
   socket_.close(ignored);
   close_timer_.cancel();
+  store_timer_.cancel();
   invalidation_ = nullptr;
   interruption_ = nullptr;
   object_ = nullptr;

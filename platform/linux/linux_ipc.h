@@ -1,9 +1,11 @@
 #pragma once
 
 #include <cstddef>
+#include <functional>
 #include <memory>
 #include <string>
 
+#include "common/Counters.h"
 #include "platform/ipc.h"
 #include "platform/log.h"
 
@@ -17,8 +19,22 @@ struct LinuxIpcOptions {
   // Whether Resume tells systemd the service is ready (sd_notify READY=1; a no-op when
   // not started by systemd).
   bool notify_ready = true;
-  // A connection whose peer leaves more than this many reply bytes unread is closed.
+  // Connections open at once; one more gets the error frame (code 8) and is closed.
+  std::size_t max_connections = 4096;
+  // A connection is not read while this many of its requests (or this many bytes of them)
+  // have been handed to its exported object and not yet taken in (IpcExportedObject::
+  // AfterRequests), so the server queue holds a bounded number of any one client's requests.
+  std::size_t max_pending_requests = 256;
+  std::size_t max_pending_request_bytes = 1u << 20;
+  // A connection is not read while its peer leaves this many reply bytes unread...
+  std::size_t pause_reply_bytes = 1u << 20;
+  // ... and it is closed when the replies it has not read pass this many bytes.
   std::size_t max_outgoing_bytes = 8u << 20;
+  // While this returns true, connections that have sent a message are not read (the store
+  // is behind). Called on the IPC thread before each frame; may be empty.
+  std::function<bool()> message_intake_blocked;
+  // Where the IPC layer counts requests, bad frames, pauses and refusals; may be null.
+  std::shared_ptr<Counters> counters;
   // How long a connection closed for bad input waits for its error frame to be written.
   int error_flush_timeout_ms = 1000;
 };
@@ -42,7 +58,14 @@ struct LinuxIpcListenerResult {
 //
 // Bad input on a connection (bad frame length, bad MessagePack, nesting too deep, not a
 // request, unknown operation, wrong arguments) gets the connection error frame, an error
-// line in `log` (scope `scope`, may be null), and closes that connection only.
+// line in `log` (scope `scope`, may be null), and closes that connection only. The replies
+// of the requests read before the bad frame go out first. A reply too large for a frame
+// closes its connection the same way (code 9).
+//
+// Flow control (see LinuxIpcOptions): a connection is read only while it has few enough
+// requests waiting in the service, its peer reads its replies, and, once it has sent a
+// message, the store keeps up. A connection held back is simply not read; nothing it sent
+// is dropped.
 //
 // REQUIRES: `log` is not null.
 LinuxIpcListenerResult NewLinuxIpcListener(const LinuxIpcOptions& options, std::shared_ptr<Log> log,

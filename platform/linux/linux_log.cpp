@@ -1,18 +1,27 @@
 #include "platform/linux/linux_log.h"
 
+#include <poll.h>
+#include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/uio.h>
 #include <syslog.h>
 #include <systemd/sd-journal.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <cerrno>
+#include <chrono>
+#include <climits>
+#include <condition_variable>
 #include <cstdio>
 #include <cstdlib>
+#include <deque>
 #include <map>
 #include <mutex>
 #include <set>
+#include <string>
 #include <string_view>
+#include <thread>
 
 namespace qn {
 namespace {
@@ -47,10 +56,147 @@ std::set<std::string, std::less<>> ParseDebugScopes(std::string_view text) {
   return scopes;
 }
 
+// Gets lines to a stream without ever blocking the caller: a pipe nobody reads must not stop
+// every thread that logs. A line the stream takes at once is written at once; what it does
+// not take waits, in order, in a queue of at most kMaxQueuedBytes that a thread of its own
+// writes out as the stream drains. Beyond that size, and when the stream is gone (its
+// reader left), lines are dropped and counted, and the next line written says how many.
+// The descriptor's flags are left as they are (it is shared with whoever started us): a
+// socket is written with MSG_DONTWAIT, anything else only when poll says it takes data, at
+// most PIPE_BUF bytes at a time (a pipe with room for that much takes it without waiting).
+class StreamWriter {
+ public:
+  StreamWriter(int fd, std::shared_ptr<Counters> counters)
+      : fd_(fd), counters_(std::move(counters)) {
+    struct stat st;
+    socket_ = ::fstat(fd_, &st) == 0 && S_ISSOCK(st.st_mode);
+  }
+
+  // Gives what is queued up to kFinalDrain to get out; the rest is dropped.
+  ~StreamWriter() {
+    {
+      std::lock_guard lock(mu_);
+      stopping_ = true;
+      give_up_at_ = std::chrono::steady_clock::now() + kFinalDrain;
+    }
+    wake_.notify_one();
+    if (thread_.joinable()) thread_.join();
+  }
+
+  // `line` ends with its newline.
+  void Write(std::string line) {
+    std::lock_guard lock(mu_);
+    if (dropped_ > 0) {
+      line.insert(0, "qnreportingd: " + std::to_string(dropped_) +
+                         " log lines dropped (the log stream was full or gone)\n");
+      dropped_ = 0;
+    }
+    if (!queue_.empty() || busy_) {
+      Enqueue(std::move(line));
+      return;
+    }
+    std::string_view rest = line;
+    if (!WriteSome(rest, 0)) {
+      Drop();
+      return;
+    }
+    if (!rest.empty()) Enqueue(std::string(rest), /*whole=*/false);
+  }
+
+ private:
+  static constexpr std::size_t kMaxQueuedBytes = 4 << 20;
+  static constexpr auto kFinalDrain = std::chrono::seconds(1);
+
+  // REQUIRES: mu_ held. A line already begun (not `whole`) is always taken, so that no
+  // line is cut in the middle.
+  void Enqueue(std::string line, bool whole = true) {
+    if (whole && queued_bytes_ + line.size() > kMaxQueuedBytes) {
+      Drop();
+      return;
+    }
+    queued_bytes_ += line.size();
+    queue_.push_back(std::move(line));
+    if (!thread_.joinable()) thread_ = std::thread([this] { Run(); });
+    wake_.notify_one();
+  }
+
+  void Drop() {
+    ++dropped_;
+    if (counters_) Counters::Add(counters_->logLinesDropped);
+  }
+
+  // Writes from the front of `rest` what the stream takes, waiting at most `wait_ms` for
+  // room each time. Returns false when the stream failed (gone); `rest` keeps what is left.
+  bool WriteSome(std::string_view& rest, int wait_ms) {
+    while (!rest.empty()) {
+      ssize_t n;
+      if (socket_) {
+        n = ::send(fd_, rest.data(), rest.size(),
+                   wait_ms > 0 ? MSG_NOSIGNAL : MSG_DONTWAIT | MSG_NOSIGNAL);
+      } else {
+        pollfd ready{fd_, POLLOUT, 0};
+        const int polled = ::poll(&ready, 1, wait_ms);
+        if (polled == 0) return true;
+        if (polled < 0) {
+          if (errno == EINTR) continue;
+          return false;
+        }
+        n = ::write(fd_, rest.data(), std::min<std::size_t>(rest.size(), PIPE_BUF));
+      }
+      if (n < 0) {
+        if (errno == EINTR) continue;
+        return errno == EAGAIN || errno == EWOULDBLOCK;
+      }
+      rest.remove_prefix(static_cast<std::size_t>(n));
+      if (wait_ms > 0) return true;  // the writer thread looks at its stop flag between writes
+    }
+    return true;
+  }
+
+  // The writer thread: writes the queue out as the stream takes it.
+  void Run() {
+    std::unique_lock lock(mu_);
+    for (;;) {
+      wake_.wait(lock, [&] { return !queue_.empty() || stopping_; });
+      if (queue_.empty()) return;
+      std::string line = std::move(queue_.front());
+      queue_.pop_front();
+      queued_bytes_ -= line.size();
+      busy_ = true;
+      lock.unlock();
+      std::string_view rest = line;
+      bool alive = true;
+      while (alive && !rest.empty()) {
+        alive = WriteSome(rest, 100);
+        std::lock_guard check(mu_);
+        if (stopping_ && std::chrono::steady_clock::now() > give_up_at_) alive = false;
+      }
+      lock.lock();
+      busy_ = false;
+      if (!alive) Drop();
+    }
+  }
+
+  const int fd_;
+  const std::shared_ptr<Counters> counters_;
+  bool socket_ = false;
+
+  std::mutex mu_;
+  std::condition_variable wake_;
+  std::deque<std::string> queue_;  // guarded by mu_
+  std::size_t queued_bytes_ = 0;   // guarded by mu_
+  bool busy_ = false;              // guarded by mu_: the writer thread holds a line
+  bool stopping_ = false;          // guarded by mu_
+  std::chrono::steady_clock::time_point give_up_at_;  // guarded by mu_
+  std::uint64_t dropped_ = 0;  // guarded by mu_: lines lost since the last one written
+  std::thread thread_;
+};
+
 class LinuxLog final : public Log {
  public:
   explicit LinuxLog(LinuxLogOptions options)
       : fd_(options.fd),
+        stream_(options.fd, std::move(options.counters)),
         identifier_field_("SYSLOG_IDENTIFIER=" + options.identifier),
         debug_scopes_(ParseDebugScopes(options.debug_scopes)),
         debug_all_(debug_scopes_.count("all") > 0) {
@@ -121,23 +267,15 @@ class LinuxLog final : public Log {
   }
 
   void WriteStream(std::string_view message) {
-    std::string out;
-    out.reserve(message.size() + 1);
-    out.append(message);
-    out.push_back('\n');
-    std::lock_guard lock(write_mu_);
-    std::size_t done = 0;
-    while (done < out.size()) {
-      const ssize_t n = ::write(fd_, out.data() + done, out.size() - done);
-      if (n < 0) {
-        if (errno == EINTR) continue;
-        return;  // nowhere to report it
-      }
-      done += static_cast<std::size_t>(n);
-    }
+    std::string line;
+    line.reserve(message.size() + 1);
+    line.append(message);
+    line.push_back('\n');
+    stream_.Write(std::move(line));
   }
 
   const int fd_;
+  StreamWriter stream_;
   const std::string identifier_field_;
   const std::set<std::string, std::less<>> debug_scopes_;
   const bool debug_all_;
@@ -145,7 +283,6 @@ class LinuxLog final : public Log {
 
   std::mutex scopes_mu_;
   std::map<std::uint64_t, std::shared_ptr<const LogScope>> scopes_;  // guarded by scopes_mu_
-  std::mutex write_mu_;                                              // one stream line at a time
 };
 
 }  // namespace

@@ -5,6 +5,7 @@
 #include <memory>
 #include <string>
 
+#include "common/Counters.h"
 #include "platform/log.h"
 
 namespace qn {
@@ -22,6 +23,8 @@ struct LinuxLogOptions {
   // character codes separated by commas or blanks ("qnrr,qnrs"), or "all" for every scope
   // and the default log. Empty: no debug lines.
   std::string debug_scopes;
+  // Counts the stream's dropped lines (logLinesDropped); may be null.
+  std::shared_ptr<Counters> counters;
   // SYSLOG_IDENTIFIER of journal entries.
   std::string identifier = "qnreportingd";
 };
@@ -30,10 +33,11 @@ struct LinuxLogOptions {
 // notice, info: info, debug: debug, error: err), CODE_FILE, CODE_LINE, CODE_FUNC,
 // QN_SCOPE (the scope's code, absent for the default log) and SYSLOG_IDENTIFIER. On the
 // stream each line is written as the line plus "\n" in one write() under a lock, so lines
-// of different threads never interleave. Write failures are ignored (a log has nowhere to
-// report them). The `enabled` and `flags` arguments of RegisterScope are kept in nothing:
-// every scope writes, and only the configured scopes write debug lines.
-// Safe to call from any thread.
+// of different threads never interleave. Writing never blocks: when the stream is full (a
+// pipe nobody reads) or gone (its reader left; SIGPIPE must be ignored), the line is
+// dropped and counted, and the next line that gets through says how many were lost. The `enabled`
+// and `flags` arguments of RegisterScope are kept in nothing: every scope writes, and only the
+// configured scopes write debug lines. Safe to call from any thread.
 std::shared_ptr<Log> NewLinuxLog(LinuxLogOptions options = {});
 
 // Whether `fd` is the stream that systemd connected to the journal: JOURNAL_STREAM

@@ -239,6 +239,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
     }
     queue_.push_back(std::move(record));
     ++stats_.handed_over;
+    backlog_.fetch_add(1, std::memory_order_relaxed);
     const bool wake = writer_idle_;
     writer_idle_ = false;
     lock.unlock();
@@ -273,6 +274,13 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   ReportingStore::Stats stats() const {
     std::lock_guard lock(mu_);
     return stats_;
+  }
+
+  std::uint64_t backlog() const { return backlog_.load(std::memory_order_relaxed); }
+
+  bool open() const {
+    std::lock_guard lock(mu_);
+    return !closing_;
   }
 
  private:
@@ -310,6 +318,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
         stats_.committed += count - failed;
         written_ = batch_end;
       }
+      backlog_.fetch_sub(count, std::memory_order_relaxed);
       written_cv_.notify_all();
     }
     std::uint64_t dropped = 0;
@@ -546,15 +555,16 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   std::atomic<std::int64_t> next_session_id_;
 
   mutable std::mutex mu_;
-  std::condition_variable wake_;          // the writer waits for records
-  std::condition_variable written_cv_;    // drains wait for batches
-  std::vector<Record> queue_;             // GUARDED_BY(mu_)
-  bool writer_idle_ = false;              // GUARDED_BY(mu_): the writer waits on wake_
-  bool closing_ = false;                  // GUARDED_BY(mu_)
-  bool exited_ = false;                   // GUARDED_BY(mu_)
-  std::uint64_t written_ = 0;             // GUARDED_BY(mu_): records handed over and written
-  std::uint64_t dropped_queue_full_ = 0;  // GUARDED_BY(mu_): not yet logged
-  ReportingStore::Stats stats_;           // GUARDED_BY(mu_)
+  std::condition_variable wake_;           // the writer waits for records
+  std::condition_variable written_cv_;     // drains wait for batches
+  std::vector<Record> queue_;              // GUARDED_BY(mu_)
+  bool writer_idle_ = false;               // GUARDED_BY(mu_): the writer waits on wake_
+  bool closing_ = false;                   // GUARDED_BY(mu_)
+  bool exited_ = false;                    // GUARDED_BY(mu_)
+  std::uint64_t written_ = 0;              // GUARDED_BY(mu_): records handed over and written
+  std::uint64_t dropped_queue_full_ = 0;   // GUARDED_BY(mu_): not yet logged
+  ReportingStore::Stats stats_;            // GUARDED_BY(mu_)
+  std::atomic<std::uint64_t> backlog_{0};  // records handed over and not yet written
 
   std::mutex thread_mu_;  // serialises join/detach of thread_
   std::thread thread_;
@@ -784,6 +794,10 @@ std::function<void()> ReportingStore::DrainHook() const {
 }
 
 ReportingStore::Stats ReportingStore::stats() const { return writer_->stats(); }
+
+std::uint64_t ReportingStore::Backlog() const { return writer_->backlog(); }
+
+bool ReportingStore::IsOpen() const { return writer_->open(); }
 
 void DrainAllReportingStores() {
   std::vector<std::shared_ptr<ReportingStoreWriter>> writers;

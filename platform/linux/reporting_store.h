@@ -138,6 +138,11 @@ class ReportingStore {
   void Close();
 
   Stats stats() const;
+  // Records handed over and not yet written (the store's lag). Lock-free: cheap enough to
+  // ask before every request.
+  std::uint64_t Backlog() const;
+  // Whether the store still takes records (not closed).
+  bool IsOpen() const;
   const std::string& path() const { return path_; }
 
   // Runs `sql` on the writer's connection, in queue order, inside the transaction of the

@@ -23,8 +23,14 @@ class StoreLivoReportingSession final : public LivoReportingSession {
                             std::optional<Array> backends)
       : store_(std::move(store)), id_(id), backends_(std::move(backends)) {}
 
+  // An open store is its own backend: the answer comes at once, however far behind its
+  // writer is. A closed one answers from another thread, as the framework may.
   void StartConfiguration(BackendsHandler handler) override {
     if (!handler) return;
+    if (store_->IsOpen()) {
+      handler(backends_);
+      return;
+    }
     store_->AfterWrite([handler = std::move(handler), backends = backends_] { handler(backends); });
   }
 

@@ -3,8 +3,13 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <fcntl.h>
+#include <unistd.h>
+
 #include <atomic>
+#include <set>
 #include <string>
+#include <thread>
 #include <utility>
 #include <vector>
 
@@ -80,7 +85,8 @@ TEST_F(BadInputTest, EachKindGetsItsErrorFrameAndOnlyThatConnectionCloses) {
       {"this is not a frame at all\n", ConnectionError::kBadLength},
       {std::string("\x00\x10\x00\x01", 4).append(4096, 'x'), ConnectionError::kBadLength},
       {RawConnection::RawFrame(std::string("\x92\x01", 2)), ConnectionError::kBadMessagePack},
-      {RawConnection::RawFrame(std::string(1000, '\x91').append("\xc0")), ConnectionError::kTooDeep},
+      {RawConnection::RawFrame(std::string(1000, '\x91').append("\xc0")),
+       ConnectionError::kTooDeep},
       {RawConnection::Frame(Value("hello")), ConnectionError::kBadRequest},
       {RawConnection::Frame(Value(Array{12, 1})), ConnectionError::kUnknownOp},
       {RawConnection::Frame(Value(Array{2, 1, 70000, 5})), ConnectionError::kBadArguments},
@@ -94,20 +100,113 @@ TEST_F(BadInputTest, EachKindGetsItsErrorFrameAndOnlyThatConnectionCloses) {
   }
 }
 
-TEST_F(BadInputTest, AClientThatNeverReadsIsClosed) {
-  RawConnection raw(daemon_.socket_path(), /*receive_buffer=*/4096);
-  ASSERT_TRUE(raw.connected());
-  // 2,000 sessions make each getAllReporters reply about 10 KB; 1,200 of them queue far more
-  // than the daemon keeps for a peer that does not read.
+// The reply to `request_id` of a reporterID:valid: request for an unknown reporter.
+Value UnknownReporterReply(std::uint32_t request_id) {
+  return Value(Array{request_id, Value(Dictionary{{"reporterID", 0}, {"serviceType", 65535}})});
+}
+
+// A client that floods without reading is no longer read once its replies pile up (the
+// daemon would close it at 8 MiB of unread replies); the witness is served meanwhile; when
+// the flooder reads, every request it sent has its reply, in order.
+TEST_F(BadInputTest, AFloodingClientIsHeldBackAndLosesNothing) {
+  RawConnection flood(daemon_.socket_path(), /*receive_buffer=*/4096);
+  ASSERT_TRUE(flood.connected());
+  constexpr std::uint32_t kRequests = 100'000;  // about 4 MB of replies
   std::string requests;
-  std::uint32_t request_id = 1;
-  for (std::int64_t i = 0; i < 2000; ++i) {
-    requests += RawConnection::Frame(Value(Array{1, request_id++, 1'000'000'000 + i}));
+  for (std::uint32_t id = 1; id <= kRequests; ++id) {
+    requests += RawConnection::Frame(Value(Array{9, id, 123456789}));
   }
-  for (int i = 0; i < 1200; ++i) requests += RawConnection::Frame(Value(Array{10, request_id++}));
-  raw.Write(requests);  // may fail part-way once the daemon closes the connection
-  EXPECT_TRUE(raw.WaitForPeerClose());
-  EXPECT_THAT(daemon_.process().Stderr(), ::testing::HasSubstr("peer does not read its replies"));
+  std::thread writer([&] { EXPECT_TRUE(flood.Write(requests)); });
+  EXPECT_TRUE(daemon_.WaitForStat({"paused", "replies"}, 1));
+  ExpectWitnessUnaffected();
+  for (std::uint32_t id = 1; id <= kRequests; ++id) {
+    const auto reply = flood.ReadFrame();
+    ASSERT_EQ(reply, UnknownReporterReply(id));
+  }
+  writer.join();
+}
+
+// Requests read before a bad frame are all answered before its error frame, even when
+// their replies take the slowest path (a stop's reply waits for its summary file).
+TEST(FlowControlTest, RepliesOfRequestsReadBeforeABadFrameComeFirst) {
+  Daemon daemon({"--internal-build"});
+  ASSERT_TRUE(daemon.started());
+  for (int round = 0; round < 5; ++round) {
+    RawConnection raw(daemon.socket_path());
+    std::string bytes;
+    std::set<std::int64_t> expected;
+    std::uint32_t id = 0;
+    for (std::int64_t reporter = 1; reporter <= 40; ++reporter) {
+      for (const Array& request : {Array{1, ++id, reporter}, Array{5, ++id, reporter},
+                                   Array{9, ++id, reporter}, Array{7, ++id, reporter}}) {
+        bytes += RawConnection::Frame(Value(request));
+        expected.insert(request[1].as_int64().value_or(0));
+      }
+    }
+    bytes += RawConnection::Frame(Value("not a request"));
+    ASSERT_TRUE(raw.Write(bytes));
+    bool closed = false;
+    std::vector<Value> frames = raw.ReadUntilClosed(&closed);
+    EXPECT_TRUE(closed);
+    ASSERT_EQ(frames.size(), expected.size() + 1) << "round " << round;
+    std::set<std::int64_t> answered;
+    for (std::size_t i = 0; i + 1 < frames.size(); ++i) {
+      answered.insert(frames[i].as_array()->front().as_int64().value_or(0));
+    }
+    EXPECT_EQ(answered, expected);
+    EXPECT_EQ(frames.back().as_array()->front(), Value(0));  // the error frame comes last
+  }
+}
+
+// Beyond --max-connections a connection gets the error frame (code 8) and is closed; the
+// ones already open go on, and a place that frees up can be taken again.
+TEST(FlowControlTest, ConnectionsBeyondTheLimitGetTheErrorFrame) {
+  Daemon daemon({"--max-connections", "2"});
+  ASSERT_TRUE(daemon.started());
+  auto first = daemon.Connect();
+  auto second = daemon.Connect();
+  ASSERT_TRUE(first && second && first->getAllReportersSync() && second->getAllReportersSync());
+  RawConnection third(daemon.socket_path());
+  bool closed = false;
+  std::vector<Value> frames = third.ReadUntilClosed(&closed);
+  EXPECT_TRUE(closed);
+  ASSERT_EQ(frames.size(), 1u);
+  EXPECT_EQ(*frames[0].as_array()->at(1).as_dictionary()->Find("code"),
+            Value(static_cast<std::int64_t>(ConnectionError::kTooManyConnections)));
+  EXPECT_TRUE(first->getAllReportersSync());
+  first.reset();
+  EXPECT_TRUE(daemon.WaitForStat({"refused", "connections"}, 1));
+  auto again = daemon.Connect();
+  EXPECT_TRUE(again && again->getAllReportersSync());
+}
+
+// A stderr whose reader left, or that nobody reads, neither kills nor blocks the daemon:
+// the lines are dropped and counted.
+TEST(FlowControlTest, AStderrThatIsGoneOrFullNeverStopsTheDaemon) {
+  for (const bool reader_left : {true, false}) {
+    SCOPED_TRACE(reader_left ? "reader left" : "nobody reads");
+    int fds[2];
+    ASSERT_EQ(::pipe2(fds, O_CLOEXEC), 0);
+    if (reader_left) ::close(fds[0]);
+    Daemon daemon({"--debug", "all"}, std::nullopt, fds[1]);
+    ::close(fds[1]);
+    ASSERT_TRUE(daemon.started());
+    RawConnection raw(daemon.socket_path());
+    // Each message's debug lines print its 50 KB payload: far more than a pipe holds.
+    constexpr std::uint32_t kRequests = 200;
+    const Value payload(Dictionary{{"blob", std::string(50'000, 'x')}});
+    std::string bytes;
+    for (std::uint32_t id = 1; id <= kRequests; ++id) {
+      bytes += RawConnection::Frame(Value(Array{6, id, payload, 1, 1, Value()}));
+    }
+    ASSERT_TRUE(raw.Write(bytes));
+    for (std::uint32_t id = 1; id <= kRequests; ++id) {
+      ASSERT_EQ(raw.ReadFrame(), Value(Array{id, Value()}));
+    }
+    EXPECT_TRUE(daemon.WaitForStat({"log_lines_dropped"}, 1));
+    EXPECT_TRUE(daemon.process().running());
+    if (!reader_left) ::close(fds[0]);
+  }
 }
 
 }  // namespace

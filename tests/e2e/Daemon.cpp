@@ -63,7 +63,7 @@ ExitStatus FromWaitStatus(int status) {
 // --- ChildProcess ------------------------------------------------------------------------
 
 ChildProcess::ChildProcess(const std::string& binary, const std::vector<std::string>& args,
-                           const std::string& dir)
+                           const std::string& dir, int stderr_fd)
     : stdout_path_(dir + "/stdout.txt"), stderr_path_(dir + "/stderr.txt") {
   std::vector<std::string> argv_strings{binary};
   argv_strings.insert(argv_strings.end(), args.begin(), args.end());
@@ -76,8 +76,12 @@ ChildProcess::ChildProcess(const std::string& binary, const std::vector<std::str
   posix_spawn_file_actions_addopen(&actions, 0, "/dev/null", O_RDONLY, 0);
   posix_spawn_file_actions_addopen(&actions, 1, stdout_path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC,
                                    0644);
-  posix_spawn_file_actions_addopen(&actions, 2, stderr_path_.c_str(), O_WRONLY | O_CREAT | O_TRUNC,
-                                   0644);
+  if (stderr_fd >= 0) {
+    posix_spawn_file_actions_adddup2(&actions, stderr_fd, 2);
+  } else {
+    posix_spawn_file_actions_addopen(&actions, 2, stderr_path_.c_str(),
+                                     O_WRONLY | O_CREAT | O_TRUNC, 0644);
+  }
   posix_spawnattr_t attributes;
   posix_spawnattr_init(&attributes);
   sigset_t none, all;
@@ -149,12 +153,13 @@ std::string ChildProcess::Stderr() const { return testing::ReadFileText(stderr_p
 
 // --- Daemon ------------------------------------------------------------------------------
 
-Daemon::Daemon(std::vector<std::string> extra_args, std::optional<std::string> socket)
+Daemon::Daemon(std::vector<std::string> extra_args, std::optional<std::string> socket,
+               int stderr_fd)
     : socket_path_(socket.value_or(home_.path() + "/run/reporting.sock")) {
   std::vector<std::string> args{"--home", home()};
   if (socket) args.insert(args.end(), {"--socket", *socket});
   args.insert(args.end(), extra_args.begin(), extra_args.end());
-  process_ = std::make_unique<ChildProcess>(QN_DAEMON_PATH, args, home());
+  process_ = std::make_unique<ChildProcess>(QN_DAEMON_PATH, args, home(), stderr_fd);
   // The socket exists once the daemon listens; until then connecting fails.
   const auto deadline = std::chrono::steady_clock::now() + kPatience;
   while (std::chrono::steady_clock::now() < deadline) {
@@ -196,6 +201,21 @@ bool Daemon::WaitForRows(
     if (std::chrono::steady_clock::now() > deadline) return false;
     std::this_thread::sleep_for(10ms);
   }
+}
+
+bool Daemon::WaitForStat(std::initializer_list<const char*> path, std::int64_t least) {
+  const auto deadline = std::chrono::steady_clock::now() + kPatience;
+  while (std::chrono::steady_clock::now() < deadline) {
+    Value stats = Json(testing::ReadFileText(home() + "/run/stats.json"));
+    const Value* at = &stats;
+    for (const char* key : path) {
+      const Dictionary* level = at ? at->as_dictionary() : nullptr;
+      at = level ? level->Find(key) : nullptr;
+    }
+    if (at && at->as_int64().value_or(0) >= least) return true;
+    std::this_thread::sleep_for(50ms);
+  }
+  return false;
 }
 
 std::vector<ReportingStoreRow> RowsOf(const std::vector<ReportingStoreRow>& rows,

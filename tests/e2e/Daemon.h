@@ -33,12 +33,13 @@ struct ExitStatus {
 };
 inline ExitStatus Exited(int code) { return {true, code}; }
 
-// Runs `binary` with `args`, its stdout and stderr written to files under `dir`, with the
-// signal mask and dispositions reset and without systemd's variables, and waits for it.
+// Runs `binary` with `args`, its stdout and stderr written to files under `dir` (stderr to
+// `stderr_fd` instead when it is given), with the signal mask and dispositions reset and
+// without systemd's variables, and waits for it.
 class ChildProcess {
  public:
   ChildProcess(const std::string& binary, const std::vector<std::string>& args,
-               const std::string& dir);
+               const std::string& dir, int stderr_fd = -1);
   // Kills the process (SIGKILL) if it still runs.
   ~ChildProcess();
 
@@ -66,7 +67,7 @@ class Daemon {
   // never does or exits). The probe that finds the daemon ready is a client too: it makes
   // one request, so the daemon always lists it, and sends its uptime event when it leaves.
   explicit Daemon(std::vector<std::string> extra_args = {},
-                  std::optional<std::string> socket = std::nullopt);
+                  std::optional<std::string> socket = std::nullopt, int stderr_fd = -1);
 
   const std::string& home() const { return home_.path(); }
   const std::string& socket_path() const { return socket_path_; }
@@ -85,6 +86,9 @@ class Daemon {
   // Reads the rows again until `condition` holds for them, at most kPatience. For rows
   // handed to the store by work that runs after a reply (there is no event to wait on).
   bool WaitForRows(const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition);
+  // Waits, at most kPatience, until the stats file the daemon refreshes each second holds
+  // at least `least` at `path` (e.g. {"paused", "replies"}).
+  bool WaitForStat(std::initializer_list<const char*> path, std::int64_t least);
 
  private:
   testing::TempDir home_;

@@ -30,6 +30,27 @@ void FakeExportedObject::HandleRequest(protocol::Op op, const Array& args, IpcRe
   }
 }
 
+void FakeExportedObject::AfterRequests(std::function<void()> done) {
+  {
+    std::lock_guard lock(mu_);
+    if (hold_) {
+      held_.push_back(std::move(done));
+      return;
+    }
+  }
+  done();
+}
+
+void FakeExportedObject::HoldTakenIn(bool hold) {
+  std::vector<std::function<void()>> release;
+  {
+    std::lock_guard lock(mu_);
+    hold_ = hold;
+    if (!hold) release.swap(held_);
+  }
+  for (auto& done : release) done();
+}
+
 void FakeExportedObject::DefaultReply(protocol::Op op, const Array& args, const IpcReply& reply) {
   using protocol::Op;
   switch (op) {

@@ -41,6 +41,11 @@ class FakeExportedObject final : public IpcExportedObject {
 
   explicit FakeExportedObject(Handler handler = nullptr) : handler_(std::move(handler)) {}
   void HandleRequest(protocol::Op op, const Array& args, IpcReply reply) override;
+  // Requests count as taken in at once, unless the test holds them back (HoldTakenIn).
+  void AfterRequests(std::function<void()> done) override;
+
+  // While held, AfterRequests keeps its callbacks; releasing runs the ones kept.
+  void HoldTakenIn(bool hold);
 
   static void DefaultReply(protocol::Op op, const Array& args, const IpcReply& reply);
 
@@ -49,7 +54,9 @@ class FakeExportedObject final : public IpcExportedObject {
  private:
   Handler handler_;
   mutable std::mutex mu_;
-  std::vector<Call> calls_;
+  std::vector<Call> calls_;                  // GUARDED_BY(mu_)
+  bool hold_ = false;                        // GUARDED_BY(mu_)
+  std::vector<std::function<void()>> held_;  // GUARDED_BY(mu_)
 };
 
 // Accepts every connection, gives each a new FakeExportedObject with the handler set

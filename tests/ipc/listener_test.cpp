@@ -164,6 +164,79 @@ TEST(LinuxIpcTest, AcceptRecoversWhenDescriptorsRunOut) {
   EXPECT_EQ(harness.log().Count("accept failed"), 1) << "one line per run of failures";
 }
 
+// The requests [9, first..last, reporter] as one write.
+std::string ValidRequests(std::uint32_t first, std::uint32_t last) {
+  std::string bytes;
+  for (std::uint32_t id = first; id <= last; ++id) {
+    bytes += RawConnection::Frame(Value(Array{9, id, 5}));
+  }
+  return bytes;
+}
+
+// At most max_pending_requests requests of a connection wait to be taken in; the rest wait
+// in the socket and follow, in order and all of them, once those are taken in.
+TEST(LinuxIpcTest, AConnectionIsReadOnlyWhileFewRequestsWaitToBeTakenIn) {
+  LinuxIpcOptions options;
+  options.max_pending_requests = 10;
+  options.counters = std::make_shared<Counters>();
+  ListenerHarness harness(nullptr, options);
+  RawConnection raw(harness.socket_path());
+  ASSERT_TRUE(raw.Write(ValidRequests(1, 1)));
+  ASSERT_TRUE(raw.ReadFrame());
+  auto object = harness.delegate().accepted().at(0).object.lock();
+  object->HoldTakenIn(true);
+  ASSERT_TRUE(raw.Write(ValidRequests(2, 101)));
+  ASSERT_TRUE(Eventually([&] { return object->calls().size() == 11; }));
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));  // time to (wrongly) read on
+  EXPECT_EQ(object->calls().size(), 11u);
+  EXPECT_EQ(Counters::Get(options.counters->pausedForRequests), 1u);
+  object->HoldTakenIn(false);
+  for (std::uint32_t id = 2; id <= 101; ++id) {
+    const auto reply = raw.ReadFrame();
+    ASSERT_TRUE(reply && reply->as_array()->front() == Value(id));
+  }
+  EXPECT_EQ(object->calls().size(), 101u);
+}
+
+// While the store is behind, connections that have sent messages are not read; others are.
+TEST(LinuxIpcTest, MessageSendersWaitWhileTheStoreIsBehind) {
+  std::atomic<bool> behind{false};
+  LinuxIpcOptions options;
+  options.message_intake_blocked = [&] { return behind.load(); };
+  ListenerHarness harness(nullptr, options);
+  RawConnection sender(harness.socket_path());
+  const std::string message = RawConnection::Frame(Value(Array{6, 1, Dictionary{}, 1, 1, Value()}));
+  ASSERT_TRUE(sender.Write(message));
+  ASSERT_EQ(sender.ReadFrame(), Value(Array{1, Value()}));
+  behind = true;
+  ASSERT_TRUE(sender.Write(ValidRequests(2, 3)));
+  RawConnection other(harness.socket_path());
+  ASSERT_TRUE(other.Write(ValidRequests(7, 7)));
+  EXPECT_TRUE(other.ReadFrame());
+  EXPECT_FALSE(sender.ReadFrame(std::chrono::milliseconds(100)));
+  behind = false;
+  EXPECT_TRUE(sender.ReadFrame());
+  EXPECT_TRUE(sender.ReadFrame());
+}
+
+// A reply too large for a frame is never dropped in silence: the connection gets the error
+// frame (code 9) after the replies before it, and is closed.
+TEST(LinuxIpcTest, AReplyTooLargeForAFrameClosesWithTheErrorFrame) {
+  ListenerHarness harness([](Op op, const Array& args, IpcReply reply) {
+    if (op == Op::kGetAllReporters) return reply(Value(std::string(2 << 20, 'x')));
+    FakeExportedObject::DefaultReply(op, args, reply);
+  });
+  RawConnection raw(harness.socket_path());
+  ASSERT_TRUE(raw.Write(ValidRequests(1, 1) + RawConnection::Frame(Value(Array{10, 2}))));
+  bool closed = false;
+  const std::vector<Value> frames = raw.ReadUntilClosed(&closed);
+  EXPECT_TRUE(closed);
+  ASSERT_EQ(frames.size(), 2u);
+  EXPECT_EQ(frames[0].as_array()->front(), Value(1));
+  EXPECT_EQ(*frames[1].as_array()->at(1).as_dictionary()->Find("code"),
+            Value(static_cast<std::int64_t>(ConnectionError::kReplyTooLarge)));
+}
+
 TEST(LinuxIpcListenerSetupTest, StaleSocketFileIsReplaced) {
   TempDir dir;
   const std::string path = dir.path() + "/reporting.sock";

@@ -4,6 +4,7 @@
 #include <sys/inotify.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <chrono>
 #include <cmath>
 #include <ctime>
@@ -12,12 +13,15 @@
 #include <optional>
 #include <ostream>
 #include <utility>
+#include <vector>
 
 #include "Statistics/QNReportingUtility.h"
 #include "common/Json.h"
 #include "platform/linux/linux_defaults.h"
 #include "platform/linux/linux_notify.h"
+#include "platform/linux/linux_stats.h"
 #include "platform/linux/reporting_store_reader.h"
+#include "platform/linux/small_file.h"
 
 namespace qn::qnreport {
 namespace {
@@ -320,6 +324,51 @@ int RunSession(const Paths& paths, std::int64_t session, std::ostream& out, std:
       start->flushed ? SummaryFiles(paths, host, *start->flushed) : std::vector<std::string>();
   if (files.empty()) out << "  file      none (summary files are written on internal builds)\n";
   for (const auto& file : files) out << "  file      " << file << "\n";
+  return 0;
+}
+
+namespace {
+
+// Appends "name value" rows for every number in `stats`, nested names joined by dots.
+void FlattenStats(const Dictionary& stats, const std::string& prefix,
+                  std::vector<std::pair<std::string, std::string>>& rows) {
+  for (const auto& [key, value] : stats) {
+    const std::string name = prefix + key.Description();
+    if (const Dictionary* nested = value.as_dictionary()) {
+      FlattenStats(*nested, name + ".", rows);
+    } else {
+      rows.emplace_back(name, value.Description());
+    }
+  }
+}
+
+}  // namespace
+
+int RunStats(const Paths& paths, bool json, std::ostream& out, std::ostream& err) {
+  const std::string path = paths.runtime_dir + "/" + kStatsFileName;
+  std::string text;
+  if (auto error = ReadSmallFile(path, 1 << 20, text)) {
+    err << "qnreport: cannot read " << path << ": " << error->Description()
+        << " (qnreportingd writes it once a second while it runs)\n";
+    return 1;
+  }
+  Value stats;
+  if (ParseJson(text, stats) || !stats.as_dictionary()) {
+    err << "qnreport: " << path << " is not a stats file\n";
+    return 1;
+  }
+  if (json) {
+    out << text;
+    return 0;
+  }
+  std::vector<std::pair<std::string, std::string>> rows;
+  FlattenStats(*stats.as_dictionary(), "", rows);
+  std::size_t width = 0;
+  for (const auto& row : rows) width = std::max(width, row.first.size());
+  for (const auto& [name, value] : rows) {
+    out << name << std::string(width + 2 - name.size(), ' ') << value << "\n";
+  }
+  out << "status: " << LinuxStatsPublisher::StatusLine(*stats.as_dictionary()) << "\n";
   return 0;
 }
 

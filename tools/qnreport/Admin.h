@@ -40,6 +40,10 @@ int RunEvents(const Paths& paths, const EventsOptions& options, std::ostream& ou
 // type, the summary event, the driver-statistics change and the summary file.
 int RunSession(const Paths& paths, std::int64_t session, std::ostream& out, std::ostream& err);
 
+// stats: the daemon's counters (the file it refreshes once a second in its runtime folder),
+// one "name value" line each and the status line, or the file's JSON as it is.
+int RunStats(const Paths& paths, bool json, std::ostream& out, std::ostream& err);
+
 // A time given on the command line: "2026-11-21 13:05[:SS]", "2026-11-21", "13:05[:SS]"
 // (today), "-90s" / "-15m" / "-2h" / "-1d" (before `now`), or seconds since the epoch.
 // Local time. Returns nullopt when the text is none of these.

@@ -173,8 +173,8 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
     }
     operations.emplace_back(sub, &op);
   }
-  CLI::App* shell = app.add_subcommand(
-      "shell", "Run operations from stdin, one per line, on one connection");
+  CLI::App* shell =
+      app.add_subcommand("shell", "Run operations from stdin, one per line, on one connection");
   shell->footer(kShellDetails);
 
   // Administration: the daemon's folders, no connection.
@@ -237,6 +237,15 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
       "\nWhen it started and stopped, its messages counted by category and type, its summary\n"
       "event, the change of the driver-statistics counters, and its summary file.\n");
 
+  bool stats_json = false;
+  CLI::App* stats = app.add_subcommand("stats", "Show the daemon's counters");
+  stats->add_flag("--json", stats_json, "The counters as the daemon wrote them (JSON)");
+  stats->footer(
+      "\nRequests by operation, messages, bad frames by code, flow-control pauses, what the\n"
+      "limits refused, drops, the store's rows and lag, connections and sessions open. The\n"
+      "daemon refreshes them once a second in <runtime>/stats.json; systemctl status shows the\n"
+      "status line.\n");
+
   std::reverse(args.begin(), args.end());
   try {
     app.parse(args);
@@ -256,6 +265,7 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
   if (read->parsed()) return RunDefaultsRead(resolved, out, err);
   if (notify->parsed()) return RunNotifyPost(resolved, notification, err);
   if (session->parsed()) return RunSession(resolved, session_number, out, err);
+  if (stats->parsed()) return RunStats(resolved, stats_json, out, err);
   if (events->parsed()) {
     if (!sink.empty()) events_options.filter.sink = ParseReportingSink(sink);
     if (!since.empty()) events_options.filter.since = ParseTimeArgument(since, Now());

@@ -1,0 +1,51 @@
+#include "platform/linux/linux_stats.h"
+
+#include <systemd/sd-daemon.h>
+
+#include "common/Files.h"
+#include "common/Json.h"
+
+namespace qn {
+namespace {
+
+// The integer at `path` ("a.b") in `stats`, or 0.
+std::int64_t Number(const Dictionary& stats, std::initializer_list<const char*> path) {
+  const Dictionary* level = &stats;
+  const Value* found = nullptr;
+  for (const char* key : path) {
+    if (!level) return 0;
+    found = level->Find(key);
+    if (!found) return 0;
+    level = found->as_dictionary();
+  }
+  return found ? found->as_int64().value_or(0) : 0;
+}
+
+}  // namespace
+
+std::string LinuxStatsPublisher::StatusLine(const Dictionary& stats) {
+  const std::int64_t paused = Number(stats, {"paused", "requests"}) +
+                              Number(stats, {"paused", "replies"}) +
+                              Number(stats, {"paused", "store"});
+  const std::int64_t dropped = Number(stats, {"store", "failed"}) +
+                               Number(stats, {"store", "dropped_queue_full"}) +
+                               Number(stats, {"log_lines_dropped"});
+  return std::to_string(Number(stats, {"connections_open"})) + " connections, " +
+         std::to_string(Number(stats, {"sessions_open"})) + " sessions, " +
+         std::to_string(Number(stats, {"messages"})) + " messages, store lag " +
+         std::to_string(Number(stats, {"store", "lag"})) + ", " + std::to_string(paused) +
+         " paused, " + std::to_string(dropped) + " dropped";
+}
+
+bool LinuxStatsPublisher::Publish(const Dictionary& stats) {
+  std::string text = ToJsonLenient(Value(stats), JsonStyle::kPretty);
+  if (text == last_) return true;
+  text.push_back('\n');
+  const bool written = !WriteFileAtomically(path_, text);
+  text.pop_back();
+  if (written) last_ = std::move(text);
+  sd_notify(0, ("STATUS=" + StatusLine(stats)).c_str());
+  return written;
+}
+
+}  // namespace qn

@@ -1,0 +1,36 @@
+#pragma once
+
+#include <string>
+
+#include "common/Value.h"
+
+namespace qn {
+
+// Publishes the daemon's counters: as JSON in a file that `qnreport stats` reads, and as
+// a one-line STATUS for `systemctl status` (sd_notify; nothing when not under systemd).
+// Not thread-safe: one thread publishes (the daemon's signal thread, once a second).
+class LinuxStatsPublisher {
+ public:
+  // REQUIRES: the folder of `path` exists.
+  explicit LinuxStatsPublisher(std::string path) : path_(std::move(path)) {}
+
+  // Writes `stats` (atomically: a reader never sees half a file) and its status line,
+  // unless they are what was published last. Returns false when the file could not be
+  // written (the status line is still sent).
+  bool Publish(const Dictionary& stats);
+
+  // The status line of `stats`, e.g. "3 connections, 12 sessions, 1204 messages, store
+  // lag 0, 2 paused, 0 dropped".
+  static std::string StatusLine(const Dictionary& stats);
+
+  const std::string& path() const { return path_; }
+
+ private:
+  const std::string path_;
+  std::string last_;
+};
+
+// The stats file's name in the daemon's runtime folder.
+inline constexpr const char* kStatsFileName = "stats.json";
+
+}  // namespace qn
