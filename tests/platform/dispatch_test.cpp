@@ -1,5 +1,6 @@
-// What only the Linux dispatcher promises: suspended queues hold no thread, and conditions
-// with deadlines call their waiter back exactly once, off the caller's thread.
+// What only the Linux dispatcher promises: suspended queues hold no thread, a busy queue
+// yields, and conditions with deadlines call their waiter back exactly once, off the
+// caller's thread.
 
 #include <gtest/gtest.h>
 
@@ -40,6 +41,37 @@ TEST(LinuxDispatchTest, SuspendedQueuesHoldNoThread) {
   EXPECT_EQ(held_ran.value(), 0) << "a suspended queue ran a later task";
   for (auto& q : waiting) q->Resume();
   EXPECT_TRUE(held_ran.WaitFor(kQueues));
+}
+
+// A queue with a long backlog runs a bounded batch per turn, so that another queue gets the
+// only thread before the backlog is done.
+TEST(LinuxDispatchTest, BusyQueueYieldsToOthersOnASingleThread) {
+  auto dispatcher = NewLinuxDispatcher({.threads = 1, .batch = 8});
+  auto flood = dispatcher->CreateSerialQueue("flood", QualityOfService::kUtility);
+  auto other = dispatcher->CreateSerialQueue("other", QualityOfService::kUtility);
+  constexpr int kFlood = 10000;
+  std::atomic<int> flood_ran{0}, flood_when_other_ran{-1};
+  std::atomic<bool> other_submitted{false};
+  Counter finished;
+  // The flood's first task holds the thread until `other` has work.
+  flood->Async([&] {
+    const auto give_up = std::chrono::steady_clock::now() + testing::kPatience;
+    while (!other_submitted && std::chrono::steady_clock::now() < give_up) {
+      std::this_thread::yield();
+    }
+  });
+  for (int i = 0; i < kFlood; ++i) {
+    flood->Async([&] {
+      if (flood_ran.fetch_add(1) + 1 == kFlood) finished.Add();
+    });
+  }
+  other->Async([&] {
+    flood_when_other_ran = flood_ran.load();
+    finished.Add();
+  });
+  other_submitted = true;
+  ASSERT_TRUE(finished.WaitFor(2));
+  EXPECT_LT(flood_when_other_ran.load(), kFlood) << "a busy queue kept the only thread";
 }
 
 // Rounds whose deadline is far, already past, or racing the signal: each waiter is called
