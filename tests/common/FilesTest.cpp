@@ -6,8 +6,6 @@
 
 #include <algorithm>
 #include <cerrno>
-#include <cmath>
-#include <cstdlib>
 #include <filesystem>
 #include <fstream>
 
@@ -76,27 +74,6 @@ TEST_F(FilesTest, AtomicWriteFailuresLeaveNothingBehind) {
   EXPECT_EQ(Listing(root_), (std::vector<std::string>{"dir.json", "plain"}));
   EXPECT_TRUE(WriteFileAtomically(root_ + "/", "text"));
 }
-
-// Sets TZ for one test and puts the old value back.
-class ScopedTimeZone {
- public:
-  explicit ScopedTimeZone(const char* tz) {
-    if (const char* old = getenv("TZ")) old_ = old;
-    setenv("TZ", tz, 1);
-    tzset();
-  }
-  ~ScopedTimeZone() {
-    if (old_) {
-      setenv("TZ", old_->c_str(), 1);
-    } else {
-      unsetenv("TZ");
-    }
-    tzset();
-  }
-
- private:
-  std::optional<std::string> old_;
-};
 
 }  // namespace
 }  // namespace qn

@@ -130,33 +130,37 @@ TEST(JsonTest, VeryDeepValuesAreCutOffOrRejectedNotOverflowed) {
   EXPECT_EQ(error->code, static_cast<std::int64_t>(JsonErrorCode::kInvalidValue));
 }
 
-TEST(JsonTest, ParseErrorsLeaveTheOutputAlone) {
-  for (const char* text : {"", "{", "[1,]", "tru", "1 2", "{\"a\" 1}", "\"\xff\"", "[1] x"}) {
-    Value v("untouched");
-    auto error = ParseJson(text, v);
-    ASSERT_TRUE(error) << text;
-    EXPECT_EQ(error->domain, kJsonErrorDomain);
-    EXPECT_EQ(error->code, static_cast<std::int64_t>(JsonErrorCode::kParse)) << text;
-    EXPECT_NE(error->description.find("parse error"), std::string::npos) << error->description;
-    EXPECT_EQ(v, Value("untouched"));
-  }
-}
-
-TEST(JsonTest, ParseDepthIsLimited) {
+TEST(JsonTest, ParseErrorsAndDepthLeaveTheOutputAlone) {
   auto nested = [](int depth) { return std::string(depth, '[') + std::string(depth, ']'); };
-  Value v;
-  EXPECT_FALSE(ParseJson(nested(kMaxJsonDepth), v));
-  for (int depth : {kMaxJsonDepth + 1, 100000}) {
-    auto error = ParseJson(nested(depth), v);
-    ASSERT_TRUE(error);
-    EXPECT_EQ(error->code, static_cast<std::int64_t>(JsonErrorCode::kTooDeep));
-  }
   std::string objects;
   for (int i = 0; i <= kMaxJsonDepth; ++i) objects += "{\"k\":";
   objects += "1" + std::string(kMaxJsonDepth + 1, '}');
-  auto error = ParseJson(objects, v);
-  ASSERT_TRUE(error);
-  EXPECT_EQ(error->code, static_cast<std::int64_t>(JsonErrorCode::kTooDeep));
+  const std::pair<std::string, JsonErrorCode> cases[] = {
+      {"", JsonErrorCode::kParse},
+      {"{", JsonErrorCode::kParse},
+      {"[1,]", JsonErrorCode::kParse},
+      {"tru", JsonErrorCode::kParse},
+      {"1 2", JsonErrorCode::kParse},
+      {"{\"a\" 1}", JsonErrorCode::kParse},
+      {"\"\xff\"", JsonErrorCode::kParse},
+      {"[1] x", JsonErrorCode::kParse},
+      {nested(kMaxJsonDepth + 1), JsonErrorCode::kTooDeep},
+      {nested(100000), JsonErrorCode::kTooDeep},
+      {objects, JsonErrorCode::kTooDeep},
+  };
+  for (const auto& [text, code] : cases) {
+    Value v("untouched");
+    auto error = ParseJson(text, v);
+    ASSERT_TRUE(error) << text.substr(0, 20);
+    EXPECT_EQ(error->domain, kJsonErrorDomain);
+    EXPECT_EQ(error->code, static_cast<std::int64_t>(code)) << text.substr(0, 20);
+    if (code == JsonErrorCode::kParse) {
+      EXPECT_NE(error->description.find("parse error"), std::string::npos);
+    }
+    EXPECT_EQ(v, Value("untouched"));
+  }
+  Value v;
+  EXPECT_FALSE(ParseJson(nested(kMaxJsonDepth), v));
 }
 
 }  // namespace

@@ -6,7 +6,6 @@ namespace qn::testing {
 
 std::unique_ptr<DefaultsSuite> FakeDefaults::OpenSuite(const std::string& suite_name) {
   std::lock_guard lock(mu_);
-  opens_[suite_name]++;
   auto it = suites_.find(suite_name);
   return std::make_unique<SnapshotDefaultsSuite>(it == suites_.end() ? Dictionary() : it->second);
 }
@@ -19,17 +18,6 @@ void FakeDefaults::Set(const std::string& suite, const std::string& key, Value v
 void FakeDefaults::Remove(const std::string& suite, const std::string& key) {
   std::lock_guard lock(mu_);
   suites_[suite].Erase(key);
-}
-
-void FakeDefaults::ClearSuite(const std::string& suite) {
-  std::lock_guard lock(mu_);
-  suites_.erase(suite);
-}
-
-int FakeDefaults::Opens(const std::string& suite) const {
-  std::lock_guard lock(mu_);
-  auto it = opens_.find(suite);
-  return it == opens_.end() ? 0 : it->second;
 }
 
 }  // namespace qn::testing

@@ -18,14 +18,10 @@ class FakeDefaults final : public Defaults {
 
   void Set(const std::string& suite, const std::string& key, Value value);
   void Remove(const std::string& suite, const std::string& key);
-  void ClearSuite(const std::string& suite);
-  // How many times the suite was opened.
-  int Opens(const std::string& suite) const;
 
  private:
   mutable std::mutex mu_;
   std::map<std::string, Dictionary> suites_;
-  std::map<std::string, int> opens_;
 };
 
 }  // namespace qn::testing

@@ -23,11 +23,6 @@ void FakeDeviceInfo::SetAnswer(const std::string& question, Value answer) {
   answers_[question] = std::move(answer);
 }
 
-void FakeDeviceInfo::ClearAnswer(const std::string& question) {
-  std::lock_guard lock(mu_);
-  answers_.erase(question);
-}
-
 int FakeDeviceInfo::Asked(const std::string& question) const {
   std::lock_guard lock(mu_);
   auto it = asked_.find(question);

@@ -17,7 +17,6 @@ class FakeDeviceInfo final : public DeviceInfo {
   std::int32_t GetSInt32Answer(const std::string& question) const override;
 
   void SetAnswer(const std::string& question, Value answer);
-  void ClearAnswer(const std::string& question);
   // How many times `question` was asked, by either query.
   int Asked(const std::string& question) const;
 

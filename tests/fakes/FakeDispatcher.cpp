@@ -223,11 +223,6 @@ void FakeDispatcher::AdvanceBy(Duration d) {
   RunUntilIdle();
 }
 
-int FakeDispatcher::PendingTimers() const {
-  std::lock_guard g(mu_);
-  return static_cast<int>(timers_.size());
-}
-
 void FakeDispatcher::WakeAllConditions() {
   std::vector<std::shared_ptr<ConditionState>> live;
   {

@@ -34,8 +34,6 @@ class FakeDispatcher final : public Dispatcher {
   int RunUntilIdle();
   // Advances the clock by `d`, firing due timers in order (running ready tasks after each).
   void AdvanceBy(Duration d);
-  // Timers not yet fired.
-  int PendingTimers() const;
   // Wakes every waiting condition as a signal would (without anyone setting a flag): a
   // spurious wake-up, as a framework that wakes its waiter without result would cause.
   void WakeAllConditions();

@@ -10,15 +10,13 @@ struct FakeLivoReporting::State {
   Discovery discovery = Discovery::kAtOnce;
   Duration late_delay = Duration::zero();
   Array backends{Value("fake-backend")};
-  bool fail_session_sends = false;
-  std::optional<Error> session_send_error;
   bool fail_single_sends = false;
   std::optional<Error> single_send_error;
   std::optional<Error> flush_error;
   std::uint64_t next_token = 1;
   std::vector<SessionRecord> sessions;
   std::vector<SingleMessage> singles;
-  std::vector<std::pair<std::size_t, Message>> session_messages;  // (session index, message)
+  std::vector<Message> session_messages;  // of every session, in arrival order
   std::vector<LivoReportingSession::BackendsHandler> pending;
 };
 
@@ -36,7 +34,6 @@ class FakeSession final : public LivoReportingSession {
     std::shared_ptr<Dispatcher> dispatcher;
     {
       std::lock_guard lock(state_->mu);
-      state_->sessions[index_].configuration_started = true;
       mode = state_->discovery;
       backends = state_->backends;
       delay = state_->late_delay;
@@ -64,15 +61,11 @@ class FakeSession final : public LivoReportingSession {
   }
 
   bool SendMessage(std::uint16_t category, std::uint16_t type, const Value& payload,
-                   std::optional<Error>* error) override {
+                   std::optional<Error>*) override {
     std::lock_guard lock(state_->mu);
-    if (state_->fail_session_sends) {
-      if (error) *error = state_->session_send_error;
-      return false;
-    }
     FakeLivoReporting::Message m{category, type, payload};
     state_->sessions[index_].messages.push_back(m);
-    state_->session_messages.emplace_back(index_, std::move(m));
+    state_->session_messages.push_back(std::move(m));
     return true;
   }
 
@@ -114,12 +107,11 @@ FakeLivoReporting::NewSecureHierarchyTokenFromParentToken(const LivoSecureHierar
 
 std::shared_ptr<LivoReportingSession> FakeLivoReporting::CreateSession(Dictionary session_info,
                                                                        Dictionary user_info,
-                                                                       Array frameworks_to_check) {
+                                                                       Array) {
   std::lock_guard lock(state_->mu);
   SessionRecord record;
   record.session_info = std::move(session_info);
   record.user_info = std::move(user_info);
-  record.frameworks_to_check = std::move(frameworks_to_check);
   state_->sessions.push_back(std::move(record));
   return std::make_shared<FakeSession>(state_, state_->sessions.size() - 1);
 }
@@ -180,9 +172,7 @@ int FakeLivoReporting::TokensMade() const {
 
 std::vector<FakeLivoReporting::Message> FakeLivoReporting::AllSessionMessages() const {
   std::lock_guard lock(state_->mu);
-  std::vector<Message> out;
-  for (const auto& [index, m] : state_->session_messages) out.push_back(m);
-  return out;
+  return state_->session_messages;
 }
 
 }  // namespace qn::testing

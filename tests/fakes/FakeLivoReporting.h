@@ -40,8 +40,6 @@ class FakeLivoReporting final : public LivoReporting {
   struct SessionRecord {
     Dictionary session_info;
     Dictionary user_info;
-    Array frameworks_to_check;
-    bool configuration_started = false;
     std::vector<Message> messages;
     int flushes = 0;
   };

@@ -22,11 +22,6 @@ std::uint32_t FakeNotify::Register(const std::string& name, std::shared_ptr<Seri
 
 std::uint32_t FakeNotify::Post(const std::string& name) {
   if (name.empty()) return 1;
-  PostWithToken(name, std::nullopt);
-  return 0;
-}
-
-void FakeNotify::PostWithToken(const std::string& name, std::optional<int> token) {
   std::vector<std::shared_ptr<Registration>> targets;
   {
     std::lock_guard lock(mu_);
@@ -35,10 +30,11 @@ void FakeNotify::PostWithToken(const std::string& name, std::optional<int> token
     }
   }
   for (auto& registration : targets) {
-    registration->queue->Async([registration, token] {
-      if (registration->active) registration->handler(token.value_or(registration->token));
+    registration->queue->Async([registration] {
+      if (registration->active) registration->handler(registration->token);
     });
   }
+  return 0;
 }
 
 void FakeNotify::Cancel(int token) {
@@ -52,13 +48,6 @@ void FakeNotify::Cancel(int token) {
 void FakeNotify::FailRegistrations(std::uint32_t status) {
   std::lock_guard lock(mu_);
   fail_status_ = status;
-}
-
-int FakeNotify::Registrations(const std::string& name) const {
-  std::lock_guard lock(mu_);
-  int n = 0;
-  for (const auto& [token, registration] : registrations_) n += registration->name == name;
-  return n;
 }
 
 }  // namespace qn::testing

@@ -26,11 +26,6 @@ class FakeNotify final : public Notify {
 
   // Makes later registrations fail with `status` (0 = succeed again).
   void FailRegistrations(std::uint32_t status);
-  // Like Post, but hands every handler `token` instead of its own (when given): a stray
-  // delivery, as a notification system may make.
-  void PostWithToken(const std::string& name, std::optional<int> token);
-  // Live registrations of `name`.
-  int Registrations(const std::string& name) const;
 
  private:
   struct Registration {

@@ -10,7 +10,6 @@ std::shared_ptr<const LogScope> LogCapture::RegisterScope(bool, std::uint64_t co
                                                           std::string subsystem,
                                                           std::string category, std::uint32_t) {
   std::lock_guard lock(mu_);
-  registrations_[code_string]++;
   auto& scope = scopes_[code];
   if (!scope) {
     scope = std::make_shared<const LogScope>(
@@ -35,7 +34,6 @@ void LogCapture::Write(const LogScope* scope, LogLevel level, const char*, int, 
   }
   if (echo_) std::fprintf(stderr, "%.*s\n", static_cast<int>(message.size()), message.data());
   lines_.push_back(Line{scope ? scope->code_string : "", level, std::string(message)});
-  written_.notify_all();
 }
 
 void LogCapture::EnableDebug(const std::string& code_string) {
@@ -50,10 +48,6 @@ std::vector<LogCapture::Line> LogCapture::Lines() const {
 
 int LogCapture::Count(std::string_view needle) const {
   std::lock_guard lock(mu_);
-  return CountLocked(needle);
-}
-
-int LogCapture::CountLocked(std::string_view needle) const {
   int n = 0;
   for (const auto& l : lines_) n += l.text.find(needle) != std::string::npos;
   return n;

@@ -43,13 +43,9 @@ class LogCapture final : public Log {
   void Clear();
 
  private:
-  int CountLocked(std::string_view needle) const;
-
   mutable std::mutex mu_;
-  mutable std::condition_variable written_;  // notified for every line
   std::vector<Line> lines_;
   std::map<std::uint64_t, std::shared_ptr<const LogScope>> scopes_;
-  std::map<std::string, int> registrations_;
   std::set<std::string> debug_;
   bool echo_ = false;
   bool echo_checked_ = false;

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
 #include <cstdint>
@@ -16,7 +17,13 @@
 #include "tests/fakes/FakeIpc.h"
 #include "tests/fakes/FakePlatform.h"
 
-namespace qn::testing::service {
+// The harness of the session and service tests: sessions, the service delegate and its
+// clients on a platform of fakes. Everything queued runs when the test runs the dispatcher.
+namespace qn::testing {
+
+inline std::shared_ptr<const Dictionary> Payload(Dictionary d) {
+  return std::make_shared<const Dictionary>(std::move(d));
+}
 
 // Records every value a reply callback is called with.
 template <typename T>
@@ -33,9 +40,32 @@ class Replies {
  private:
   std::shared_ptr<std::vector<T>> values_ = std::make_shared<std::vector<T>>();
 };
-
 using BoolReplies = Replies<bool>;
-using ErrorReplies = Replies<std::optional<Error>>;
+
+// The session tests' fixture: sessions made on a platform of fakes of their own.
+class SessionFixture : public ::testing::Test {
+ protected:
+  // A session of reporter `id` owned by process 1234, of `serviceType` when given.
+  std::shared_ptr<QNReportingSession> NewSession(
+      std::int64_t id = 42, std::optional<std::uint16_t> serviceType = std::nullopt) {
+    auto session = QNReportingSession::initWithID(t_.platform, id, Array{Value(1234)});
+    if (serviceType) session->setServiceType(*serviceType);
+    return session;
+  }
+  // A session of reporter 42 whose start sequence has run.
+  std::shared_ptr<QNReportingSession> StartedSession(std::uint16_t serviceType = 2) {
+    auto session = NewSession(42, serviceType);
+    session->start();
+    t_.dispatcher->RunUntilIdle();
+    return session;
+  }
+  void SetInternal(bool internal) {
+    t_.device_info->SetAnswer("InternalBuild", internal);
+    t_.device_info->SetAnswer("DeviceClassNumber", 1);
+  }
+
+  FakePlatform t_;
+};
 
 // One connected client: its fake connection and the server instance exported on it.
 struct Client {
@@ -49,7 +79,6 @@ struct Client {
 };
 
 // The service delegate on fakes, with a fake listener to connect clients through.
-// Everything queued runs when the test calls Run().
 class ServiceHarness {
  public:
   // `setup` runs before the delegate is made (driver counters, defaults, notify failures).
@@ -75,9 +104,30 @@ class ServiceHarness {
     return Client{connection, instance};
   }
 
+  // Creates `id` for `c` (of `serviceType` when given), and starts it when asked; returns
+  // the start reply's record (it is held until the stop).
+  BoolReplies Create(const Client& c, std::int64_t id,
+                     std::optional<std::uint16_t> serviceType = std::nullopt, bool start = false) {
+    BoolReplies r, started;
+    c->createReportingSession(id, r.Callback());
+    if (serviceType) c->setServiceType(*serviceType, id, r.Callback());
+    if (start) c->startReportingSessionForID(id, started.Callback());
+    Run();
+    return started;
+  }
+  // Sends `message` from `c` and returns its one reply.
+  std::optional<Error> Send(const Client& c, Dictionary message, std::uint32_t category,
+                            std::uint16_t type, std::optional<std::vector<std::int64_t>> ids) {
+    Replies<std::optional<Error>> r;
+    c->sendMessage(Payload(std::move(message)), category, type, std::move(ids), r.Callback());
+    Run();
+    EXPECT_EQ(r.size(), 1u);
+    return r.empty() ? std::nullopt : r[0];
+  }
+
   void Run() { env.dispatcher->RunUntilIdle(); }
 
-  // Writes a defaults value and posts the defaults notification (runs it).
+  // Posts the defaults notification and runs its handler.
   void PostDefaults() {
     env.notify->Post(kQNReportingDefaultsNotification);
     Run();
@@ -88,4 +138,4 @@ class ServiceHarness {
   std::shared_ptr<QNReportingServiceDelegate> delegate;
 };
 
-}  // namespace qn::testing::service
+}  // namespace qn::testing

@@ -4,7 +4,7 @@
 #include <chrono>
 #include <regex>
 
-#include "tests/session/SessionTest.h"
+#include "tests/service/ServiceHarness.h"
 
 namespace qn {
 namespace {

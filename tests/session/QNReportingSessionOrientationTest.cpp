@@ -3,7 +3,7 @@
 #include <chrono>
 #include <thread>
 
-#include "tests/session/SessionTest.h"
+#include "tests/service/ServiceHarness.h"
 
 namespace qn {
 namespace {

@@ -6,7 +6,7 @@
 
 #include "common/Json.h"
 #include "tests/fakes/TempDir.h"
-#include "tests/session/SessionTest.h"
+#include "tests/service/ServiceHarness.h"
 
 namespace qn {
 namespace {
@@ -55,8 +55,7 @@ TEST_F(SummaryTest, SummaryJoinsValuesPerKeyInPayloadOrder) {
   session->sendMessage(Payload({{"a", 1}}), 1, 0, nullptr);  // neither summed nor deduplicated
   auto summary = session->createSummaryEventForSession();
   ASSERT_TRUE(summary);
-  EXPECT_EQ(*summary,
-            (Dictionary{{"QN_Session_Summary_Event", "3"}, {"a", "1,2,1"}, {"b", "x"}}));
+  EXPECT_EQ(*summary, (Dictionary{{"QN_Session_Summary_Event", "3"}, {"a", "1,2,1"}, {"b", "x"}}));
   std::vector<std::string> keys;
   for (const auto& [k, v] : *summary) keys.push_back(k.Description());
   EXPECT_THAT(keys, ElementsAre("QN_Session_Summary_Event", "a", "b"));

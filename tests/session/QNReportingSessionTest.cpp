@@ -1,7 +1,7 @@
 // Record, creation, configuration, service types, message identifiers, start and stop.
 #include <chrono>
 
-#include "tests/session/SessionTest.h"
+#include "tests/service/ServiceHarness.h"
 
 namespace qn {
 namespace {
