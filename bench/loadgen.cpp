@@ -13,6 +13,10 @@
 //           reply: against a socket-activated daemon, its start-up to first reply.
 // pingpong: the reference: a raw Unix-socket echo of the same frame sizes between this
 //           process and a forked child, one at a time (no daemon involved).
+// neighbours: one client floods reporterID:valid: requests and never reads its replies,
+//           another sends M messages to one session with a window of 1024, and a third
+//           makes reporterID:valid: round trips one at a time meanwhile; the latencies
+//           reported are the third client's, the rates the sender's.
 //
 // Reports accepted requests/s (replies received), durable messages/s (rows committed in the
 // store, read from its database), round-trip p50/p99/p99.9, daemon CPU seconds per 1M
@@ -308,6 +312,45 @@ void RunClient(const Options& options, int index, ClientResult& result) {
   ::close(fd);
 }
 
+// --- a flooder, a busy sender and a prober at once ---------------------------------------
+
+// Writes reporterID:valid: requests until `stop`, never reading a reply.
+void Flood(const Options& options, const std::atomic<bool>& stop) {
+  const int fd = ConnectUnix(options.socket);
+  const timeval patience{0, 100000};  // a write held back by the daemon returns to check `stop`
+  ::setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &patience, sizeof patience);
+  const RequestTemplate request(9, {qn::Value(std::int64_t{1})});
+  std::string batch;
+  for (std::uint32_t id = 1; batch.size() < 64 * 1024; ++id) request.AppendTo(batch, id);
+  std::size_t at = 0;
+  while (!stop) {
+    const ssize_t n = ::write(fd, batch.data() + at, batch.size() - at);
+    if (n < 0 && errno != EAGAIN && errno != EINTR) break;
+    if (n > 0) at = (at + static_cast<std::size_t>(n)) % batch.size();
+  }
+  ::close(fd);
+}
+
+void RunNeighbours(const Options& options, ClientResult& prober, ClientResult& sender) {
+  std::atomic<bool> done{false};
+  std::thread flood([&] { Flood(options, done); });
+  std::this_thread::sleep_for(std::chrono::milliseconds(200));  // let the flooder get ahead
+  std::thread send([&] {
+    Options busy = options;
+    busy.op = "send";
+    busy.window = 1024;
+    RunClient(busy, 1, sender);
+    done = true;
+  });
+  const int fd = ConnectUnix(options.socket);
+  const RequestTemplate request(9, {qn::Value(std::int64_t{1})});
+  std::uint32_t id = 1;
+  while (!done) Pump(fd, request, 1, 1, id, prober);
+  ::close(fd);
+  send.join();
+  flood.join();
+}
+
 // --- the raw-socket reference ----------------------------------------------------------------
 
 void PingPong(const Options& options, ClientResult& result) {
@@ -369,8 +412,8 @@ int main(int argc, char** argv) {
   app.add_option("--socket", options.socket, "The daemon's socket");
   app.add_option("--home", options.home, "The daemon's --home (socket and store found there)");
   app.add_option("--daemon", options.daemon, "Start this daemon binary under a temporary home");
-  app.add_option("--op", options.op, "send, valid, pingpong, idle or first")
-      ->check(CLI::IsMember({"send", "valid", "pingpong", "idle", "first"}));
+  app.add_option("--op", options.op, "send, valid, pingpong, idle, first or neighbours")
+      ->check(CLI::IsMember({"send", "valid", "pingpong", "idle", "first", "neighbours"}));
   app.add_option("--clients", options.clients, "Clients (connections)")->check(CLI::Range(1, 64));
   app.add_option("--sessions", options.sessions, "Sessions per client")->check(CLI::Range(1, 4096));
   app.add_option("--messages", options.messages, "Requests per client")->check(CLI::PositiveNumber);
@@ -430,8 +473,11 @@ int main(int argc, char** argv) {
 
   std::vector<ClientResult> results(static_cast<std::size_t>(options.clients));
   const auto start = Clock::now();
+  ClientResult sender;
   if (options.op == "pingpong") {
     PingPong(options, results[0]);
+  } else if (options.op == "neighbours") {
+    RunNeighbours(options, results[0], sender);
   } else {
     std::vector<std::thread> threads;
     for (int c = 0; c < options.clients; ++c) {
@@ -451,6 +497,7 @@ int main(int argc, char** argv) {
   }
   const double accepted_seconds = std::chrono::duration<double>(Clock::now() - start).count();
 
+  const bool neighbours = options.op == "neighbours";
   long replies = 0;
   std::vector<double> latencies;
   for (auto& r : results) {
@@ -459,7 +506,7 @@ int main(int argc, char** argv) {
   }
   // Durable: every message (plus the summary of each session) committed in the store.
   double durable_seconds = 0;
-  const std::int64_t expected = options.op == "send"
+  const std::int64_t expected = options.op == "send" || neighbours
                                     ? stored_before + options.messages * options.clients +
                                           std::int64_t{options.sessions} * options.clients
                                     : 0;
@@ -473,12 +520,14 @@ int main(int argc, char** argv) {
   sampling = false;
   sampler.join();
   const ProcessUsage after = daemon ? Usage(daemon) : ProcessUsage{};
-  const long requests = options.messages * (options.op == "pingpong" ? 1 : options.clients);
+  const long requests =
+      neighbours ? replies : options.messages * (options.op == "pingpong" ? 1 : options.clients);
   const double cpu_per_million = (after.cpu_seconds - before.cpu_seconds) * 1e6 / requests;
 
   const double p50 = Percentile(latencies, 0.5), p99 = Percentile(latencies, 0.99),
                p999 = Percentile(latencies, 0.999);
-  const double accepted_rate = static_cast<double>(replies) / accepted_seconds;
+  const double accepted_rate =
+      static_cast<double>(neighbours ? sender.replies : replies) / accepted_seconds;
   const double durable_rate =
       durable_seconds > 0
           ? static_cast<double>(options.messages * options.clients) / durable_seconds
@@ -495,6 +544,7 @@ int main(int argc, char** argv) {
     std::printf("%s: %d client(s) x %d session(s), window %d, %ld requests\n", options.op.c_str(),
                 options.clients, options.sessions, options.window, requests);
     std::printf("  accepted  %.0f/s\n", accepted_rate);
+    if (neighbours) std::printf("  (the sender's rates; the latencies are the prober's)\n");
     if (durable_rate > 0) std::printf("  durable   %.0f msgs/s\n", durable_rate);
     std::printf("  latency   p50 %.1f us, p99 %.1f us, p99.9 %.1f us\n", p50, p99, p999);
     if (daemon) {

@@ -104,7 +104,7 @@ struct Limits {
   std::size_t max_pending_requests = LinuxIpcOptions{}.max_pending_requests;
   std::size_t max_pending_bytes = LinuxIpcOptions{}.max_pending_request_bytes;
   std::size_t max_unread_reply_bytes = LinuxIpcOptions{}.max_outgoing_bytes;
-  std::size_t store_high_water = 16384;
+  std::size_t store_high_water = 4096;
 };
 
 struct Options {
@@ -352,6 +352,7 @@ int Run(const Options& options) {
     return 1;
   }
   std::shared_ptr<IpcListener> listener = listening.listener;
+  store->SetAfterBatch(listening.wake_message_intake);
   listener->SetDelegate(delegate);
 
   // The one thread that takes the handled signals (blocked everywhere else).
@@ -405,6 +406,7 @@ int Run(const Options& options) {
   // Work still queued may hold the platform; the dispatcher is released last, here, so that
   // it is never destroyed from one of its own tasks.
   std::shared_ptr<Dispatcher> dispatcher = platform->dispatcher;
+  store->SetAfterBatch(nullptr);
   listener.reset();
   delegate.reset();
   platform.reset();

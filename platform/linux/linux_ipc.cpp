@@ -35,7 +35,7 @@ constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
 // How long accepting pauses after a failed accept (typically fd exhaustion) before retrying.
 constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
 // How often a connection held back because the store is behind looks again.
-constexpr auto kStoreRecheck = std::chrono::milliseconds(5);
+constexpr auto kStoreRecheck = std::chrono::milliseconds(20);
 
 std::string ErrnoText(const std::string& what, int error) {
   return what + ": " + std::strerror(error);
@@ -242,6 +242,11 @@ class LinuxConnection final : public IpcConnection,
   // go of the exported object and handlers. io_context thread.
   void Finish();
 
+  // Looks again at a connection held back because the store was behind. io_context thread.
+  void WakeIfHeldByStore() {
+    if (hold_ == Hold::kStore) Pump();
+  }
+
   // Marks the connection ended without running anything; for a listener that is destroyed
   // without having been stopped. Any thread, while the io_context is not running.
   void Abandon();
@@ -267,6 +272,7 @@ class LinuxConnection final : public IpcConnection,
   void CloseBatch();
   void OnBatchTaken(std::size_t requests, std::size_t bytes);
   Hold WhyHeld();
+  void SetHold(Hold hold);
   // Bad input: log and count it, stop reading, and queue the error frame once every request
   // read before it has been taken in (so that their replies go out first).
   void Fail(protocol::ConnectionError code, const std::string& message);
@@ -372,6 +378,19 @@ class LinuxIpcListener final : public IpcListener {
   const LinuxIpcOptions& options() const { return options_; }
   const std::shared_ptr<Counters>& counters() const { return counters_; }
 
+  // How many connections are held back because the store is behind.
+  void CountStoreHold(int change) { store_holds_.fetch_add(change, std::memory_order_relaxed); }
+
+  // Any thread: looks again at every connection held back because the store was behind.
+  void WakeStoreHeld() {
+    if (store_holds_.load(std::memory_order_relaxed) == 0) return;
+    asio::post(*io_, [this] {
+      std::vector<std::shared_ptr<LinuxConnection>> open;
+      for (auto& [raw, connection] : connections_) open.push_back(connection);
+      for (auto& connection : open) connection->WakeIfHeldByStore();
+    });
+  }
+
   // io_context thread.
   void Forget(LinuxConnection* connection) {
     if (connections_.erase(connection)) Counters::Add(counters_->connectionsOpen, -1);
@@ -475,6 +494,7 @@ class LinuxIpcListener final : public IpcListener {
   std::unordered_map<LinuxConnection*, std::shared_ptr<LinuxConnection>> connections_;
   bool stopped_ = false;
   bool accept_failing_ = false;
+  std::atomic<int> store_holds_{0};
 };
 
 LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_t pid, uid_t uid)
@@ -532,24 +552,28 @@ void LinuxConnection::Pump() {
   CloseBatch();
   if (!ok) return;
   const Hold hold = WhyHeld();
-  if (hold != Hold::kNone) {
-    if (hold_ != hold) {
-      Counters::Add(hold == Hold::kRequests  ? counters_->pausedForRequests
-                    : hold == Hold::kReplies ? counters_->pausedForReplies
-                                             : counters_->pausedForStore);
-    }
-    hold_ = hold;
-    if (hold == Hold::kStore) {
-      // The store says nothing when it catches up; look again shortly.
-      store_timer_.expires_after(kStoreRecheck);
-      store_timer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
-        if (!error) self->Pump();
-      });
-    }
-    return;
+  SetHold(hold);
+  if (hold == Hold::kStore) {
+    // The store's writer wakes held connections after each batch (WakeStoreHeld); this
+    // look covers the messages still on their way to it.
+    store_timer_.expires_after(kStoreRecheck);
+    store_timer_.async_wait([self = shared_from_this()](const asio::error_code& error) {
+      if (!error) self->Pump();
+    });
   }
-  hold_ = Hold::kNone;
-  if (!read_in_flight_) StartRead();
+  if (hold == Hold::kNone && !read_in_flight_) StartRead();
+}
+
+void LinuxConnection::SetHold(Hold hold) {
+  if (hold == hold_) return;
+  if (hold != Hold::kNone) {
+    Counters::Add(hold == Hold::kRequests  ? counters_->pausedForRequests
+                  : hold == Hold::kReplies ? counters_->pausedForReplies
+                                           : counters_->pausedForStore);
+  }
+  if (hold_ == Hold::kStore) listener_.CountStoreHold(-1);
+  if (hold == Hold::kStore) listener_.CountStoreHold(1);
+  hold_ = hold;
 }
 
 void LinuxConnection::StartRead() {
@@ -784,6 +808,7 @@ void LinuxConnection::Finish() {
   socket_.close(ignored);
   close_timer_.cancel();
   store_timer_.cancel();
+  SetHold(Hold::kNone);
   auto keep = shared_from_this();
   listener_.Forget(this);
   auto invalidation = std::move(invalidation_);
@@ -821,8 +846,12 @@ LinuxIpcListenerResult NewLinuxIpcListener(const LinuxIpcOptions& options, std::
     result.error = std::move(socket->error);
     return result;
   }
-  result.listener = std::make_shared<LinuxIpcListener>(options, std::move(log), std::move(scope),
-                                                       std::move(*socket));
+  auto listener = std::make_shared<LinuxIpcListener>(options, std::move(log), std::move(scope),
+                                                     std::move(*socket));
+  result.wake_message_intake = [weak = std::weak_ptr<LinuxIpcListener>(listener)] {
+    if (auto held = weak.lock()) held->WakeStoreHeld();
+  };
+  result.listener = std::move(listener);
   return result;
 }
 

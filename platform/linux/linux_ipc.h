@@ -42,6 +42,10 @@ struct LinuxIpcOptions {
 struct LinuxIpcListenerResult {
   std::shared_ptr<IpcListener> listener;  // null on failure
   std::string error;                      // what failed, when listener is null
+  // Call from any thread when message_intake_blocked may have turned false (the store wrote
+  // a batch): the connections held back for it are looked at again at once, not at their
+  // next periodic look. Cheap when none is held; harmless after the listener is gone.
+  std::function<void()> wake_message_intake;
 };
 
 // The IPC layer on a Unix domain stream socket, framed MessagePack (common/Frame.h,

@@ -278,6 +278,11 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
 
   std::uint64_t backlog() const { return backlog_.load(std::memory_order_relaxed); }
 
+  void SetAfterBatch(std::function<void()> callback) {
+    std::lock_guard lock(mu_);
+    after_batch_ = std::move(callback);
+  }
+
   bool open() const {
     std::lock_guard lock(mu_);
     return !closing_;
@@ -319,6 +324,12 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
         written_ = batch_end;
       }
       backlog_.fetch_sub(count, std::memory_order_relaxed);
+      std::function<void()> after_batch;
+      {
+        std::lock_guard lock(mu_);
+        after_batch = after_batch_;
+      }
+      if (after_batch) after_batch();
       written_cv_.notify_all();
     }
     std::uint64_t dropped = 0;
@@ -564,6 +575,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   std::uint64_t written_ = 0;              // GUARDED_BY(mu_): records handed over and written
   std::uint64_t dropped_queue_full_ = 0;   // GUARDED_BY(mu_): not yet logged
   ReportingStore::Stats stats_;            // GUARDED_BY(mu_)
+  std::function<void()> after_batch_;      // GUARDED_BY(mu_)
   std::atomic<std::uint64_t> backlog_{0};  // records handed over and not yet written
 
   std::mutex thread_mu_;  // serialises join/detach of thread_
@@ -798,6 +810,10 @@ ReportingStore::Stats ReportingStore::stats() const { return writer_->stats(); }
 std::uint64_t ReportingStore::Backlog() const { return writer_->backlog(); }
 
 bool ReportingStore::IsOpen() const { return writer_->open(); }
+
+void ReportingStore::SetAfterBatch(std::function<void()> callback) {
+  writer_->SetAfterBatch(std::move(callback));
+}
 
 void DrainAllReportingStores() {
   std::vector<std::shared_ptr<ReportingStoreWriter>> writers;

@@ -145,6 +145,10 @@ class ReportingStore {
   bool IsOpen() const;
   const std::string& path() const { return path_; }
 
+  // Calls `callback` on the writer thread after each transaction (the backlog just shrank).
+  // Replaces the one set before; empty removes it. It must not block.
+  void SetAfterBatch(std::function<void()> callback);
+
   // Runs `sql` on the writer's connection, in queue order, inside the transaction of the
   // batch it lands in; a failure is logged and does not fail the batch. For fault
   // injection in tests only (PRAGMA max_page_count to simulate a full disk).

@@ -348,7 +348,7 @@ int RunStats(const Paths& paths, bool json, std::ostream& out, std::ostream& err
   const std::string path = paths.runtime_dir + "/" + kStatsFileName;
   std::string text;
   if (auto error = ReadSmallFile(path, 1 << 20, text)) {
-    err << "qnreport: cannot read " << path << ": " << error->Description()
+    err << "qnreport: " << error->Description()
         << " (qnreportingd writes it once a second while it runs)\n";
     return 1;
   }
