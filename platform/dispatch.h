@@ -26,6 +26,13 @@ class SerialQueue {
   // reference to the queue goes away are still run.
   virtual void Async(Task task) = 0;
 
+  // Runs `task` as Async would, except that when the queue is idle (nothing queued or
+  // running, not suspended) it runs it at once on the calling thread, holding the queue
+  // meanwhile, so that order and one-at-a-time still hold and the hand-off to another
+  // thread is saved. For callers whose thread may do the queue's work (it must not hold a
+  // lock the task takes). The default queues it.
+  virtual void AsyncOrRun(Task task) { Async(std::move(task)); }
+
   // Submits `task` (as Async would) once `delay` has passed.
   virtual void AsyncAfter(Duration delay, Task task) = 0;
 

@@ -72,7 +72,7 @@ class ServiceExportedObject final : public IpcExportedObject {
   // Called on the IPC layer's thread, like HandleRequest, so stopSince_ needs no lock.
   void AfterRequests(std::function<void()> done) override {
     if (!std::exchange(stopSince_, false) || !summaryQueue_) {
-      serverQueue_->Async(std::move(done));
+      serverQueue_->AsyncOrRun(std::move(done));
       return;
     }
     // server queue (the stop runs) -> summary queue (its file) -> server queue (its reply).

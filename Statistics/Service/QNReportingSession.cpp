@@ -380,8 +380,11 @@ void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
 
   const bool wasStarted = started();
   Counters::Add(counters.deliveriesQueued, 1);
-  livoReportingQueue_->Async([self = shared_from_this(), converted, payload = std::move(payload),
-                              category, type, wasStarted]() mutable {
+  // An idle session queue delivers at once on this thread (the delivery only hands the
+  // message to the framework), in order, without a hand-off to another thread.
+  livoReportingQueue_->AsyncOrRun([self = shared_from_this(), converted,
+                                   payload = std::move(payload), category, type,
+                                   wasStarted]() mutable {
     Counters::Add(self->platform_->counters->deliveriesQueued, -1);
     self->Deliver(std::move(converted), std::move(payload), category, type, wasStarted);
   });

@@ -117,6 +117,36 @@ class LinuxSerialQueue final : public SerialQueue,
     Schedule();
   }
 
+  void AsyncOrRun(Task task) override {
+    if (!task) return;
+    {
+      std::lock_guard lock(mu_);
+      const bool idle = !scheduled_ && suspended_ == 0 && tasks_.empty();
+      if (!idle) {
+        tasks_.push_back(std::move(task));
+        if (scheduled_ || suspended_ > 0) return;
+      }
+      scheduled_ = true;  // held by this call (idle) or by the drain turn posted below
+      if (!idle) task = nullptr;
+    }
+    if (!task) {
+      Schedule();
+      return;
+    }
+    const SerialQueue* outer = tls_current_queue;
+    tls_current_queue = this;
+    task();
+    tls_current_queue = outer;
+    {
+      std::lock_guard lock(mu_);
+      if (suspended_ > 0 || tasks_.empty()) {
+        scheduled_ = false;
+        return;
+      }
+    }
+    Schedule();  // what arrived meanwhile runs on the pool
+  }
+
   void AsyncAfter(Duration delay, Task task) override {
     if (!task) return;
     if (delay <= Duration::zero()) {
