@@ -278,6 +278,8 @@ class LinuxConnection final : public IpcConnection,
   void Fail(protocol::ConnectionError code, const std::string& message);
   // Queues the error frame behind the replies and closes once it is written.
   void SendErrorFrame();
+  // Ends a connection whose peer has sent all it will, once what it sent is answered.
+  void FinishIfAnswered();
   void StartWriteLocked();  // REQUIRES: mu_ held
   void OnWrite(const asio::error_code& error);
   void OnOverflow();
@@ -310,6 +312,7 @@ class LinuxConnection final : public IpcConnection,
   bool read_in_flight_ = false;
   Hold hold_ = Hold::kNone;
   bool sends_messages_ = false;
+  bool peer_done_ = false;            // end of stream: nothing more to read
   std::size_t untaken_requests_ = 0;  // handed over, not yet known to be taken in
   std::size_t untaken_bytes_ = 0;
   std::size_t batch_requests_ = 0;  // of those, handed since the last CloseBatch
@@ -561,7 +564,7 @@ void LinuxConnection::Pump() {
       if (!error) self->Pump();
     });
   }
-  if (hold == Hold::kNone && !read_in_flight_) StartRead();
+  if (hold == Hold::kNone && !read_in_flight_ && !peer_done_) StartRead();
 }
 
 void LinuxConnection::SetHold(Hold hold) {
@@ -598,11 +601,26 @@ void LinuxConnection::OnRead(const asio::error_code& error, std::size_t bytes) {
                             decoder_.buffered()));
       return;
     }
+    if (error == asio::error::eof) {
+      // The peer has sent all it will; it may still read. What it sent is answered first.
+      peer_done_ = true;
+      FinishIfAnswered();
+      return;
+    }
     Finish();
     return;
   }
   decoder_.Feed(std::string_view(read_buffer_.get(), bytes));
   Pump();
+}
+
+void LinuxConnection::FinishIfAnswered() {
+  if (!peer_done_ || untaken_requests_ > 0) return;
+  {
+    std::lock_guard lock(mu_);
+    if (state_ != State::kOpen || write_active_ || !pending_.empty()) return;
+  }
+  Finish();
 }
 
 bool LinuxConnection::HandleFrames() {
@@ -671,6 +689,7 @@ void LinuxConnection::OnBatchTaken(std::size_t requests, std::size_t bytes) {
     return;
   }
   if (hold_ == Hold::kRequests) Pump();
+  FinishIfAnswered();
 }
 
 void LinuxConnection::Fail(protocol::ConnectionError code, const std::string& message) {
@@ -793,6 +812,8 @@ void LinuxConnection::OnWrite(const asio::error_code& error) {
     Finish();  // the error frame is out
   } else if (hold_ == Hold::kReplies) {
     Pump();
+  } else {
+    FinishIfAnswered();
   }
 }
 
