@@ -64,6 +64,9 @@ PRAGMA user_version = 1;
 
 // A vector that grew beyond this many records for a burst is given back afterwards.
 constexpr std::size_t kKeptQueueCapacity = 1 << 18;
+// How long and up to how many records the writer gathers before a transaction.
+constexpr auto kGatherTime = std::chrono::milliseconds(2);
+constexpr std::size_t kGatherRecords = 512;
 
 double WallNow() {
   timespec ts;
@@ -240,7 +243,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
     queue_.push_back(std::move(record));
     ++stats_.handed_over;
     backlog_.fetch_add(1, std::memory_order_relaxed);
-    const bool wake = writer_idle_;
+    const bool wake = writer_idle_ || (gathering_ && queue_.size() == kGatherRecords);
     writer_idle_ = false;
     lock.unlock();
     if (wake) wake_.notify_one();
@@ -251,7 +254,10 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
     if (std::this_thread::get_id() == writer_id_) return;
     std::unique_lock lock(mu_);
     const std::uint64_t target = stats_.handed_over;
+    ++drains_waiting_;  // the writer does not gather while someone waits
+    wake_.notify_one();
     written_cv_.wait(lock, [&] { return written_ >= target || exited_; });
+    --drains_waiting_;
   }
 
   // Stops taking records; the writer finishes what is queued and closes the database.
@@ -302,6 +308,14 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
         }
         writer_idle_ = false;
         if (queue_.empty()) break;  // closing and nothing left
+        // A commit costs about as much for a few records as for hundreds: while records
+        // keep arriving, gather them for a moment into one transaction.
+        const auto gather_until = std::chrono::steady_clock::now() + kGatherTime;
+        gathering_ = true;
+        while (queue_.size() < kGatherRecords && !closing_ && drains_waiting_ == 0 &&
+               wake_.wait_until(lock, gather_until) != std::cv_status::timeout) {
+        }
+        gathering_ = false;
         batch.swap(queue_);
         dropped = std::exchange(dropped_queue_full_, 0);
         batch_end = stats_.handed_over;
@@ -576,6 +590,8 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   std::uint64_t dropped_queue_full_ = 0;   // GUARDED_BY(mu_): not yet logged
   ReportingStore::Stats stats_;            // GUARDED_BY(mu_)
   std::function<void()> after_batch_;      // GUARDED_BY(mu_)
+  bool gathering_ = false;                 // GUARDED_BY(mu_): the writer gathers a batch
+  int drains_waiting_ = 0;                 // GUARDED_BY(mu_): Drain calls waiting
   std::atomic<std::uint64_t> backlog_{0};  // records handed over and not yet written
 
   std::mutex thread_mu_;  // serialises join/detach of thread_
