@@ -23,7 +23,9 @@ class ReportingStoreWriter;
 // Threads: one writer thread of the store owns the database connection. Every Add* call
 // only hands a record over through an in-memory queue and returns at once; it never
 // waits for a disk. The writer takes everything queued, writes it in one transaction with
-// prepared statements and commits. What a row holds is fixed at hand-over (values are
+// prepared statements and commits. While records keep coming it first gathers them for up
+// to 2 ms (or 512 records), as a commit costs about as much for a few records as for
+// hundreds; nobody waiting in Drain is ever kept waiting for that. What a row holds is fixed at hand-over (values are
 // immutable); only an analytics payload is produced later, by its provider, when the row
 // is written. All methods are safe to call from any thread.
 //
