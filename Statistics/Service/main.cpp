@@ -173,33 +173,39 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
   Limits& limits = options.limits;
   const auto limit = [&app](const char* name, std::size_t& value, const char* what,
                             std::size_t most = SIZE_MAX) {
+    // A whole number from 1 to `most` (the validator's own text would clutter --help).
+    const CLI::Validator in_range(
+        [most](std::string& text) {
+          std::size_t parsed = 0;
+          const bool whole = !text.empty() &&
+                             text.find_first_not_of("0123456789") == std::string::npos &&
+                             CLI::detail::lexical_cast(text, parsed);
+          if (whole && parsed >= 1 && parsed <= most) return std::string();
+          return most == SIZE_MAX ? std::string("needs a positive whole number")
+                                  : "needs a whole number from 1 to " + std::to_string(most);
+        },
+        "");
     app.add_option(name, value, what)
         ->type_name("N")
         ->default_val(value)
-        ->check(CLI::Range(std::size_t{1}, most))
+        ->check(in_range)
         ->group("Limits");
   };
   limit("--max-connections", limits.max_connections,
-        "Connections open at once; one more gets an error frame and is closed");
+        "Connections open at once (one more is refused)");
   limit("--max-sessions-per-client", limits.max_sessions_per_client,
-        "Sessions one client may hold; a create beyond it makes none");
-  limit("--max-sessions", limits.max_sessions,
-        "Sessions all clients together may hold (at most 100000, so that the list of "
-        "reporters fits a frame)",
+        "Sessions one client may hold");
+  limit("--max-sessions", limits.max_sessions, "Sessions all clients may hold (at most 100000)",
         QNReportingServerContext::kMostMaxSessions);
   limit("--max-aggregated-bytes", limits.max_aggregated_bytes,
-        "Payload bytes a session keeps for its summary; later payloads are delivered, not "
-        "summarised");
+        "Payload bytes a session keeps for its summary");
   limit("--max-pending-requests", limits.max_pending_requests,
-        "Requests of one connection in the service at once; beyond it the connection is not "
-        "read until they are taken in");
-  limit("--max-pending-bytes", limits.max_pending_bytes,
-        "Bytes of such requests of one connection (the same rule)");
+        "Requests of one connection in the service at once");
+  limit("--max-pending-bytes", limits.max_pending_bytes, "Bytes of those requests");
   limit("--max-unread-reply-bytes", limits.max_unread_reply_bytes,
-        "Reply bytes a client may leave unread before it is closed (it is no longer read "
-        "from an eighth of this on)");
+        "Reply bytes a client may leave unread (not read from 1/8 on)");
   limit("--store-high-water", limits.store_high_water,
-        "Messages waiting for the store above which clients that send messages are not read");
+        "Messages waiting for the store before senders are held back");
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
