@@ -29,6 +29,7 @@ Dictionary Counters::Snapshot() const {
       {"connections_open", Value(Get(connectionsOpen))},
       {"sessions_open", Value(Get(sessionsOpen))},
       {"deliveries_queued", Value(Get(deliveriesQueued))},
+      {"aggregated_bytes", Value(Get(aggregatedBytes))},
   };
 }
 

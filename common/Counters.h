@@ -44,6 +44,7 @@ struct Counters {
   Gauge connectionsOpen{0};
   Gauge sessionsOpen{0};
   Gauge deliveriesQueued{0};  // messages handed to sessions, not yet handed to the store
+  Gauge aggregatedBytes{0};   // payload bytes the sessions hold for their summaries
 
   // Increments a counter; `n` may be any amount.
   static void Add(Counter& counter, std::uint64_t n = 1) {

@@ -50,7 +50,10 @@ struct Platform {
   // while started. A payload beyond it is still delivered, only left out of the summary, so
   // one client cannot grow the daemon's memory without end.
   std::size_t max_aggregated_bytes = kDefaultMaxAggregatedBytes;
-  static constexpr std::size_t kDefaultMaxAggregatedBytes = 4u << 20;
+  static constexpr std::size_t kDefaultMaxAggregatedBytes = 2u << 20;
+  // The same for all sessions together (counted in counters->aggregatedBytes).
+  std::size_t max_aggregated_bytes_total = kDefaultMaxAggregatedBytesTotal;
+  static constexpr std::size_t kDefaultMaxAggregatedBytesTotal = 64u << 20;
 
   // Process-wide state that is computed once (the internal-build flag). It lives here so
   // that each test's Platform starts afresh.

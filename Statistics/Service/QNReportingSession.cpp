@@ -128,7 +128,7 @@ QNReportingSession::QNReportingSession(Token, std::shared_ptr<const Platform> pl
       reporterID_(reporterID),
       serviceName_(std::make_shared<const std::string>("unknown")),
       userInfo_(std::make_shared<const Dictionary>()),
-      aggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>()),
+      aggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>(platform_->counters)),
       nestedAggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>()),
       messageTypeCounts_(std::make_shared<const Dictionary>()) {}
 
@@ -180,7 +180,7 @@ void QNReportingSession::start() {
   }
   setStarted(true);
   // Whatever was aggregated before (unstarted, or an earlier started period) is dropped.
-  aggregatedPayloadData_.store(std::make_shared<QNReportingPayloadArray>());
+  aggregatedPayloadData_.store(std::make_shared<QNReportingPayloadArray>(platform_->counters));
   nestedAggregatedPayloadData_.store(std::make_shared<QNReportingPayloadArray>());
   aggregationCapped_.store(false);
   TracePoint(*platform_, kTraceSessionStart);
@@ -339,14 +339,21 @@ std::string QNReportingSession::messageIdForCategory(std::uint32_t category, std
 // ---------------------------------------------------------------------------------------
 // Message delivery
 
-bool QNReportingSession::Append(const std::shared_ptr<QNReportingPayloadArray>& array, Value item,
-                                std::size_t bytes, std::size_t cap) {
-  if (!array) return false;  // stopped: nothing is aggregated
+QNReportingSession::AppendResult QNReportingSession::Append(
+    const std::shared_ptr<QNReportingPayloadArray>& array, Value item, std::size_t bytes,
+    std::size_t cap, std::size_t totalCap) {
+  if (!array) return AppendResult::kGone;  // stopped: nothing is aggregated
   std::lock_guard guard(array->lock);
-  if (bytes > cap || array->bytes > cap - bytes) return false;
+  if (bytes > cap || array->bytes > cap - bytes) return AppendResult::kSessionFull;
+  if (array->counted) {
+    const auto total = static_cast<std::size_t>(
+        std::max<std::int64_t>(0, Counters::Get(array->counted->aggregatedBytes)));
+    if (bytes > totalCap || total > totalCap - bytes) return AppendResult::kAllFull;
+    Counters::Add(array->counted->aggregatedBytes, static_cast<std::int64_t>(bytes));
+  }
   array->items.push_back(std::move(item));
   array->bytes += bytes;
-  return true;
+  return AppendResult::kAppended;
 }
 
 void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
@@ -363,17 +370,26 @@ void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
   std::string messageID = messageIdForCategory(category, type);
 
   Counters& counters = *platform_->counters;
-  auto aggregated = aggregatedPayloadData();
-  if (Append(aggregated, Value(converted), Value(converted).ApproximateBytes(),
-             platform_->max_aggregated_bytes)) {
+  const AppendResult aggregated =
+      Append(aggregatedPayloadData(), Value(converted), Value(converted).ApproximateBytes(),
+             platform_->max_aggregated_bytes, platform_->max_aggregated_bytes_total);
+  if (aggregated == AppendResult::kAppended) {
     Append(nestedAggregatedPayloadData(), Value(Dictionary{{Value(messageID), Value(converted)}}));
-  } else if (aggregated) {
+  } else if (aggregated != AppendResult::kGone) {
     Counters::Add(counters.aggregationCapped);
     if (!aggregationCapped_.exchange(true)) {
-      SESSION_LOG(LogLevel::kError,
-                  "%s:%d:%s: session %lli holds %zu bytes of payloads, the most it aggregates; "
-                  "later messages are delivered but left out of its summary",
-                  reporterID(), platform_->max_aggregated_bytes);
+      if (aggregated == AppendResult::kSessionFull) {
+        SESSION_LOG(LogLevel::kError,
+                    "%s:%d:%s: session %lli holds %zu bytes of payloads, the most it aggregates; "
+                    "later messages are delivered but left out of its summary",
+                    reporterID(), platform_->max_aggregated_bytes);
+      } else {
+        SESSION_LOG(LogLevel::kError,
+                    "%s:%d:%s: the sessions hold %zu bytes of payloads in all, the most they "
+                    "aggregate; later messages of session %lli are delivered but left out of its "
+                    "summary",
+                    platform_->max_aggregated_bytes_total, reporterID());
+      }
     }
   }
   TracePoint(*platform_, kTraceMessage);

@@ -20,9 +20,21 @@ namespace qn {
 // lock of the instance it fetched from the session; no other lock is ever taken while it
 // is held.
 struct QNReportingPayloadArray {
+  QNReportingPayloadArray() = default;
+  // `counted`: the counters whose aggregatedBytes gauge holds this array's bytes while it
+  // lives (null: not counted).
+  explicit QNReportingPayloadArray(std::shared_ptr<Counters> counted)
+      : counted(std::move(counted)) {}
+  ~QNReportingPayloadArray() {
+    if (counted) Counters::Add(counted->aggregatedBytes, -static_cast<std::int64_t>(bytes));
+  }
+  QNReportingPayloadArray(const QNReportingPayloadArray&) = delete;
+  QNReportingPayloadArray& operator=(const QNReportingPayloadArray&) = delete;
+
   mutable std::mutex lock;
   Array items;            // guarded by lock
   std::size_t bytes = 0;  // guarded by lock: the items' approximate size
+  const std::shared_ptr<Counters> counted;
 
   // A copy of the items, taken under the lock.
   Array Snapshot() const {
@@ -235,10 +247,12 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
                std::uint16_t type, bool wasStarted);
   void RegisterOrientationCallbacks(const std::string& callbackID);
   void HandleOrientation(bool device, std::int32_t orientation);
-  // Appends `item` of `bytes` unless that would take the array past `cap` bytes; returns
-  // false when it did not append (also when the array is gone).
-  static bool Append(const std::shared_ptr<QNReportingPayloadArray>& array, Value item,
-                     std::size_t bytes = 0, std::size_t cap = SIZE_MAX);
+  // Appends `item` of `bytes` unless that would take the array past `cap` bytes, or every
+  // counted array together past `totalCap`.
+  enum class AppendResult { kAppended, kGone, kSessionFull, kAllFull };
+  static AppendResult Append(const std::shared_ptr<QNReportingPayloadArray>& array, Value item,
+                             std::size_t bytes = 0, std::size_t cap = SIZE_MAX,
+                             std::size_t totalCap = SIZE_MAX);
 
   const std::shared_ptr<const Platform> platform_;
   const std::shared_ptr<const LogScope> scope_;  // "qnrr"; null = the default log

@@ -101,6 +101,7 @@ struct Limits {
   std::size_t max_sessions_per_client = QNReportingServerContext::kDefaultMaxSessionsPerClient;
   std::size_t max_sessions = QNReportingServerContext::kDefaultMaxSessions;
   std::size_t max_aggregated_bytes = Platform::kDefaultMaxAggregatedBytes;
+  std::size_t max_aggregated_bytes_total = Platform::kDefaultMaxAggregatedBytesTotal;
   std::size_t max_pending_requests = LinuxIpcOptions{}.max_pending_requests;
   std::size_t max_pending_bytes = LinuxIpcOptions{}.max_pending_request_bytes;
   std::size_t max_unread_reply_bytes = LinuxIpcOptions{}.max_outgoing_bytes;
@@ -199,6 +200,8 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
         QNReportingServerContext::kMostMaxSessions);
   limit("--max-aggregated-bytes", limits.max_aggregated_bytes,
         "Payload bytes a session keeps for its summary");
+  limit("--max-aggregated-bytes-total", limits.max_aggregated_bytes_total,
+        "The same for all sessions together");
   limit("--max-pending-requests", limits.max_pending_requests,
         "Requests of one connection in the service at once");
   limit("--max-pending-bytes", limits.max_pending_bytes, "Bytes of those requests");
@@ -294,6 +297,7 @@ int Run(const Options& options) {
   auto platform = std::make_shared<Platform>();
   platform->counters = counters;
   platform->max_aggregated_bytes = options.limits.max_aggregated_bytes;
+  platform->max_aggregated_bytes_total = options.limits.max_aggregated_bytes_total;
   platform->log = log;
   platform->trace = NewLinuxTrace();
   platform->dispatcher = NewLinuxDispatcher();
