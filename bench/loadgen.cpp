@@ -23,6 +23,7 @@
 // requests and the daemon's peak RSS. Without --socket/--home it starts the daemon (the one
 // built beside it, or --daemon) under a temporary --home and stops it at the end.
 
+#include <poll.h>
 #include <signal.h>
 #include <sqlite3.h>
 #include <sys/socket.h>
@@ -38,6 +39,7 @@
 #include <cstring>
 #include <filesystem>
 #include <fstream>
+#include <memory>
 #include <string>
 #include <thread>
 #include <vector>
@@ -208,10 +210,6 @@ std::int64_t StoredMessages(const std::string& db_path) {
   return count;
 }
 
-// --op idle: clients that have opened their sessions, and the signal to close them.
-std::atomic<int> idle_clients_ready{0};
-std::atomic<bool> idle_release{false};
-
 // --- one client ----------------------------------------------------------------------------
 
 qn::Value Payload(int client, long n) {
@@ -271,45 +269,97 @@ void Exchange(int fd, const std::vector<RequestTemplate>& requests, long replies
   }
 }
 
-void RunClient(const Options& options, int index, ClientResult& result) {
-  const int fd = ConnectUnix(options.socket);
+// One client: its connection, its sessions, and what it has sent and heard back.
+struct Client {
+  int fd = -1;
   std::uint32_t next_id = 1;
-  if (options.op == "valid") {
-    Pump(fd, RequestTemplate(9, {qn::Value(std::int64_t{1})}), options.messages, options.window,
-         next_id, result);
-    ::close(fd);
-    return;
-  }
   std::vector<std::int64_t> ids;
-  std::vector<RequestTemplate> setup, teardown;
+  std::vector<RequestTemplate> requests;  // what it sends: one per session (or one valid)
+  long total = 0, issued = 0, answered = 0;
+  std::vector<Clock::time_point> sent = std::vector<Clock::time_point>(1 << 16);
+  std::unique_ptr<ReplyReader> reader;
+};
+
+// Connects, and for send/idle opens the client's sessions (create, type, start).
+Client OpenClient(const Options& options, int index) {
+  Client client;
+  client.fd = ConnectUnix(options.socket);
+  client.reader = std::make_unique<ReplyReader>(client.fd);
+  client.total = options.messages;
+  if (options.op == "valid") {
+    client.requests.emplace_back(9, std::vector<qn::Value>{qn::Value(std::int64_t{1})});
+    return client;
+  }
+  std::vector<RequestTemplate> setup;
   for (int s = 0; s < options.sessions; ++s) {
     const std::int64_t id = index * 100000 + s + 1;
-    ids.push_back(id);
+    client.ids.push_back(id);
     setup.emplace_back(1, std::vector<qn::Value>{qn::Value(id)});
     setup.emplace_back(2, std::vector<qn::Value>{qn::Value(2), qn::Value(id)});
     setup.emplace_back(5, std::vector<qn::Value>{qn::Value(id)});
+    client.requests.emplace_back(
+        6, std::vector<qn::Value>{Payload(index, s), qn::Value(5), qn::Value(1),
+                                  qn::Value(qn::Array{qn::Value(id)})});
+  }
+  // create and type reply at once; each start replies when its session stops.
+  Exchange(client.fd, setup, 2L * options.sessions, client.next_id);
+  return client;
+}
+
+// Stops and destroys the client's sessions, and closes its connection.
+void CloseClient(const Options& options, Client& client) {
+  std::vector<RequestTemplate> teardown;
+  for (std::int64_t id : client.ids) {
     teardown.emplace_back(7, std::vector<qn::Value>{qn::Value(id)});
     teardown.emplace_back(8, std::vector<qn::Value>{qn::Value(id)});
   }
-  // create and type reply at once; each start replies when its session stops.
-  Exchange(fd, setup, 2L * options.sessions, next_id);
-  if (options.op == "idle") {  // every session open and started; the main thread measures
-    result.replies += options.messages;
-    idle_clients_ready.fetch_add(1);
-    while (!idle_release) std::this_thread::sleep_for(std::chrono::milliseconds(5));
-    Exchange(fd, teardown, 3L * options.sessions, next_id);
-    ::close(fd);
-    return;
+  if (!teardown.empty()) Exchange(client.fd, teardown, 3L * options.sessions, client.next_id);
+  ::close(client.fd);
+}
+
+// Every client keeps `window` requests in flight until it has had `total` replies: one
+// thread, one poll loop over every connection (as redis-benchmark drives its clients), so
+// that the load generator's own thread switches do not show up as the daemon's latency.
+// Each client goes through its sessions one after the other.
+void PumpAll(std::vector<Client>& clients, int window, std::vector<ClientResult>& results) {
+  std::vector<pollfd> fds(clients.size());
+  std::string batch;
+  for (;;) {
+    std::size_t waiting = 0;
+    for (std::size_t c = 0; c < clients.size(); ++c) {
+      Client& client = clients[c];
+      fds[c] = pollfd{client.answered < client.total ? client.fd : -1, POLLIN, 0};
+      if (client.answered >= client.total) continue;
+      ++waiting;
+      batch.clear();
+      const auto now = Clock::now();
+      const long per_request = client.total / static_cast<long>(client.requests.size());
+      while (client.issued < client.total && client.issued - client.answered < window) {
+        const std::size_t which = std::min<std::size_t>(
+            client.requests.size() - 1, static_cast<std::size_t>(client.issued / per_request));
+        client.sent[client.next_id % client.sent.size()] = now;
+        client.requests[which].AppendTo(batch, client.next_id++);
+        ++client.issued;
+      }
+      if (!batch.empty() && !WriteAll(client.fd, batch)) return;
+    }
+    if (waiting == 0) return;
+    // One client simply blocks in its read (as a lone client would); more wait in poll.
+    if (clients.size() > 1 && ::poll(fds.data(), fds.size(), -1) < 0 && errno != EINTR) return;
+    if (clients.size() == 1) fds[0].revents = POLLIN;
+    for (std::size_t c = 0; c < clients.size(); ++c) {
+      if (!(fds[c].revents & (POLLIN | POLLHUP | POLLERR))) continue;
+      Client& client = clients[c];
+      const bool open = client.reader->ReadSome([&](std::uint32_t id) {
+        results[c].latencies_us.push_back(std::chrono::duration<double, std::micro>(
+                                              Clock::now() - client.sent[id % client.sent.size()])
+                                              .count());
+        ++client.answered;
+        ++results[c].replies;
+      });
+      if (!open) return;
+    }
   }
-  const long per_session = options.messages / options.sessions;
-  for (int s = 0; s < options.sessions; ++s) {
-    qn::Array targets{qn::Value(ids[s])};
-    RequestTemplate send(6, {Payload(index, s), qn::Value(5), qn::Value(1), qn::Value(targets)});
-    Pump(fd, send, s + 1 == options.sessions ? options.messages - per_session * s : per_session,
-         options.window, next_id, result);
-  }
-  Exchange(fd, teardown, 3L * options.sessions, next_id);
-  ::close(fd);
 }
 
 // --- a flooder, a busy sender and a prober at once ---------------------------------------
@@ -338,8 +388,12 @@ void RunNeighbours(const Options& options, ClientResult& prober, ClientResult& s
   std::thread send([&] {
     Options busy = options;
     busy.op = "send";
-    busy.window = 1024;
-    RunClient(busy, 1, sender);
+    std::vector<Client> clients;
+    clients.push_back(OpenClient(busy, 1));
+    std::vector<ClientResult> results(1);
+    PumpAll(clients, 1024, results);
+    CloseClient(busy, clients[0]);
+    sender = std::move(results[0]);
     done = true;
   });
   const int fd = ConnectUnix(options.socket);
@@ -479,21 +533,19 @@ int main(int argc, char** argv) {
   } else if (options.op == "neighbours") {
     RunNeighbours(options, results[0], sender);
   } else {
-    std::vector<std::thread> threads;
-    for (int c = 0; c < options.clients; ++c) {
-      threads.emplace_back([&, c] { RunClient(options, c, results[static_cast<std::size_t>(c)]); });
-    }
-    if (options.op == "idle") {
-      while (idle_clients_ready < options.clients) {
-        std::this_thread::sleep_for(std::chrono::milliseconds(5));
-      }
+    std::vector<Client> clients;
+    for (int c = 0; c < options.clients; ++c) clients.push_back(OpenClient(options, c));
+    if (options.op == "idle") {  // every session open and started: measure, then close
       std::this_thread::sleep_for(std::chrono::milliseconds(200));
       const auto idle = Usage(daemon);
       std::printf("idle: %d client(s) x %d session(s) open: daemon RSS %.1f MiB\n", options.clients,
                   options.sessions, idle.rss_kib / 1024.0);
-      idle_release = true;
+      for (int c = 0; c < options.clients; ++c)
+        results[static_cast<std::size_t>(c)].replies = options.messages;
+    } else {
+      PumpAll(clients, options.window, results);
     }
-    for (auto& t : threads) t.join();
+    for (auto& client : clients) CloseClient(options, client);
   }
   const double accepted_seconds = std::chrono::duration<double>(Clock::now() - start).count();
 
