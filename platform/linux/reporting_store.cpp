@@ -175,6 +175,69 @@ const char* KindName(RecordKind kind) {
 // The writer: owns the connection, the queue and the writer thread. The thread holds a
 // reference to it, so it outlives the ReportingStore when the store is closed from the
 // writer thread itself.
+// Copies the WAL into the database file on a thread and a connection of its own, so that
+// the writer's commits never wait for a checkpoint (which fsyncs the database and, after a
+// burst, copies tens of megabytes: long enough to stall every client the store holds back).
+// The writer turns its own automatic checkpoints off and wakes this one from its WAL hook.
+class Checkpointer {
+ public:
+  // Null when the second connection cannot be opened (the writer then checkpoints itself).
+  static std::unique_ptr<Checkpointer> Start(const char* path, int busy_timeout_ms) {
+    sqlite3* raw = nullptr;
+    const int rc =
+        sqlite3_open_v2(path, &raw, SQLITE_OPEN_READWRITE | SQLITE_OPEN_NOMUTEX, nullptr);
+    DbHandle db(raw);
+    if (rc != SQLITE_OK) return nullptr;
+    sqlite3_busy_timeout(db.get(), busy_timeout_ms);
+    return std::unique_ptr<Checkpointer>(new Checkpointer(std::move(db)));
+  }
+
+  // Stops the thread (after the checkpoint in progress) and closes the connection.
+  ~Checkpointer() {
+    {
+      std::lock_guard lock(mu_);
+      stop_ = true;
+    }
+    cv_.notify_one();
+    thread_.join();
+  }
+
+  // Any thread: a checkpoint is due.
+  void Wake() {
+    {
+      std::lock_guard lock(mu_);
+      due_ = true;
+    }
+    cv_.notify_one();
+  }
+
+ private:
+  explicit Checkpointer(DbHandle db) : db_(std::move(db)), thread_([this] { Run(); }) {}
+
+  void Run() {
+    std::unique_lock lock(mu_);
+    for (;;) {
+      cv_.wait(lock, [&] { return due_ || stop_; });
+      if (stop_) return;
+      due_ = false;
+      lock.unlock();
+      // PASSIVE: copies what it can without waiting for the writer, which goes on.
+      sqlite3_wal_checkpoint_v2(db_.get(), nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+      lock.lock();
+    }
+  }
+
+  DbHandle db_;
+  std::mutex mu_;
+  std::condition_variable cv_;
+  bool due_ = false;   // guarded by mu_
+  bool stop_ = false;  // guarded by mu_
+  std::thread thread_;
+};
+
+// WAL pages after which a checkpoint is due (SQLite's own default).
+constexpr int kCheckpointPages = 1000;
+
 class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreWriter> {
  public:
   ReportingStoreWriter(DbHandle db, std::shared_ptr<Log> log, ReportingStore::Options options,
@@ -217,6 +280,18 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
       int rc = sqlite3_prepare_v3(db_.get(), s.sql, -1, SQLITE_PREPARE_PERSISTENT, &stmt, nullptr);
       if (rc != SQLITE_OK) return SqliteError(db_.get(), rc, std::string("prepare ") + s.sql);
       s.stmt->reset(stmt);
+    }
+    checkpointer_ =
+        Checkpointer::Start(sqlite3_db_filename(db_.get(), "main"), options_.busy_timeout_ms);
+    if (checkpointer_) {
+      sqlite3_wal_autocheckpoint(db_.get(), 0);
+      sqlite3_wal_hook(
+          db_.get(),
+          [](void* checkpointer, sqlite3*, const char*, int pages) {
+            if (pages >= kCheckpointPages) static_cast<Checkpointer*>(checkpointer)->Wake();
+            return SQLITE_OK;
+          },
+          checkpointer_.get());
     }
     return std::nullopt;
   }
@@ -361,6 +436,10 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   }
 
   void CloseDatabase() {
+    // Its connection goes first, so that closing the writer's (the last one) checkpoints
+    // everything and removes the WAL file.
+    sqlite3_wal_hook(db_.get(), nullptr, nullptr);
+    checkpointer_.reset();
     for (Statement* s :
          {&begin_, &commit_, &rollback_, &insert_session_, &flush_session_, &insert_message_,
           &insert_single_, &insert_analytics_, &insert_powerlog_}) {
@@ -568,6 +647,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
 
   // Writer-thread state: the connection, its statements, the JSON buffers.
   DbHandle db_;
+  std::unique_ptr<Checkpointer> checkpointer_;  // writer thread (set before it starts)
   Statement begin_, commit_, rollback_;
   Statement insert_session_, flush_session_, insert_message_, insert_single_;
   Statement insert_analytics_, insert_powerlog_;

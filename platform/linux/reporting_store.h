@@ -36,7 +36,8 @@ class ReportingStoreWriter;
 // consistent. In exchange, a commit costs no fsync.
 //
 // The database uses 16 KiB pages (set when the file is created) and keeps its WAL file at
-// most 64 MiB after a checkpoint.
+// most 64 MiB after a checkpoint. Checkpoints run on a thread and connection of their own
+// (passive: they never hold the writer up), whenever the WAL has grown by 1,000 pages.
 //
 // Failures: a batch whose transaction fails is tried once more, then record by record,
 // each in a transaction of its own, so that only a record that fails on its own (a
