@@ -34,6 +34,8 @@ constexpr std::size_t kReadChunkBytes = 16 * 1024;
 constexpr std::size_t kKeptBufferCapacity = 64 * 1024;
 // How long accepting pauses after a failed accept (typically fd exhaustion) before retrying.
 constexpr auto kAcceptBackoff = std::chrono::milliseconds(100);
+// Requests one connection hands over before the others get their turn on the IPC thread.
+constexpr int kFramesPerTurn = 32;
 // How often a connection held back because the store is behind looks again.
 constexpr auto kStoreRecheck = std::chrono::milliseconds(20);
 
@@ -313,6 +315,7 @@ class LinuxConnection final : public IpcConnection,
   Hold hold_ = Hold::kNone;
   bool sends_messages_ = false;
   bool peer_done_ = false;            // end of stream: nothing more to read
+  bool yielded_ = false;              // HandleFrames stopped at kFramesPerTurn with frames left
   std::size_t untaken_requests_ = 0;  // handed over, not yet known to be taken in
   std::size_t untaken_bytes_ = 0;
   std::size_t batch_requests_ = 0;  // of those, handed since the last CloseBatch
@@ -551,9 +554,14 @@ void LinuxConnection::Pump() {
     if (state_ != State::kOpen) return;
   }
   if (!resumed_) return;
+  yielded_ = false;
   const bool ok = HandleFrames();
   CloseBatch();
   if (!ok) return;
+  if (yielded_) {
+    asio::post(*io_, [self = shared_from_this()] { self->Pump(); });
+    return;
+  }
   const Hold hold = WhyHeld();
   SetHold(hold);
   if (hold == Hold::kStore) {
@@ -624,7 +632,12 @@ void LinuxConnection::FinishIfAnswered() {
 }
 
 bool LinuxConnection::HandleFrames() {
-  while (WhyHeld() == Hold::kNone) {
+  for (int handed = 0; WhyHeld() == Hold::kNone; ++handed) {
+    if (handed == kFramesPerTurn) {
+      // Let the other connections' requests in before this one goes on.
+      yielded_ = true;
+      return true;
+    }
     auto body = decoder_.Next();
     if (!body) break;
     const std::size_t bytes = body->size() + kFrameHeaderBytes;
