@@ -528,6 +528,7 @@ int main(int argc, char** argv) {
   std::vector<ClientResult> results(static_cast<std::size_t>(options.clients));
   const auto start = Clock::now();
   ClientResult sender;
+  long idle_rss_kib = 0;
   if (options.op == "pingpong") {
     PingPong(options, results[0]);
   } else if (options.op == "neighbours") {
@@ -537,9 +538,11 @@ int main(int argc, char** argv) {
     for (int c = 0; c < options.clients; ++c) clients.push_back(OpenClient(options, c));
     if (options.op == "idle") {  // every session open and started: measure, then close
       std::this_thread::sleep_for(std::chrono::milliseconds(200));
-      const auto idle = Usage(daemon);
-      std::printf("idle: %d client(s) x %d session(s) open: daemon RSS %.1f MiB\n", options.clients,
-                  options.sessions, idle.rss_kib / 1024.0);
+      idle_rss_kib = Usage(daemon).rss_kib;
+      if (!options.json) {
+        std::printf("idle: %d client(s) x %d session(s) open: daemon RSS %.1f MiB\n",
+                    options.clients, options.sessions, idle_rss_kib / 1024.0);
+      }
       for (int c = 0; c < options.clients; ++c)
         results[static_cast<std::size_t>(c)].replies = options.messages;
     } else {
@@ -589,9 +592,10 @@ int main(int argc, char** argv) {
         "{\"op\":\"%s\",\"clients\":%d,\"sessions\":%d,\"window\":%d,\"requests\":%ld,"
         "\"accepted_per_s\":%.0f,\"durable_per_s\":%.0f,\"p50_us\":%.1f,\"p99_us\":%.1f,"
         "\"p999_us\":%.1f,\"daemon_cpu_s_per_million\":%.2f,\"daemon_peak_rss_kib\":%ld,"
-        "\"daemon_rss_after_kib\":%ld}\n",
+        "\"daemon_rss_after_kib\":%ld,\"idle_rss_kib\":%ld}\n",
         options.op.c_str(), options.clients, options.sessions, options.window, requests,
-        accepted_rate, durable_rate, p50, p99, p999, cpu_per_million, peak_rss, after.rss_kib);
+        accepted_rate, durable_rate, p50, p99, p999, cpu_per_million, peak_rss, after.rss_kib,
+        idle_rss_kib);
   } else {
     std::printf("%s: %d client(s) x %d session(s), window %d, %ld requests\n", options.op.c_str(),
                 options.clients, options.sessions, options.window, requests);

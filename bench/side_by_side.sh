@@ -4,8 +4,9 @@
 #   - sendMessage, 1 client, window 64     vs Redis XADD -c 1 -P 64 (200-byte values)
 #   - sendMessage, 8 clients, window 64    vs Redis XADD -c 8 -P 64
 #   - daemon CPU per durable message       vs Redis XADD CPU with appendfsync everysec
-# and on its own: socket-activated start to first reply (through systemd-socket-activate)
-# and the daemon's RSS with 1,000 idle sessions.
+# and on its own: socket-activated start to first reply (through systemd-socket-activate),
+# the daemon's RSS with 1,000 idle sessions, and one-at-a-time round trips beside a client
+# that floods without reading and one that sends with a window of 1024 (--op neighbours).
 # Medians of ROUNDS rounds (default 3). Needs a default build (bench_loadgen, qnreportingd)
 # and Debian's redis-server + redis-tools (installed when missing).
 #   bench/side_by_side.sh [--rounds N] [--json FILE]   (FILE gets every run's raw figures)
@@ -91,6 +92,8 @@ for round in $(seq "$rounds"); do
   daemon send_c8 --op send --clients 8 --window 64 --messages 40000
   redis xadd_c8_p64 no -n 300000 -c 8 -P 64 XADD s '*' f "$value"
   redis xadd_c1_p64_aof everysec -n 300000 -c 1 -P 64 XADD s '*' f "$value"
+  daemon neighbours --op neighbours --messages 500000
+  daemon idle --op idle --clients 10 --sessions 100 --messages 1
 done
 
 python3 - "$results" "$json_out" <<'PY'
@@ -116,6 +119,10 @@ print(f"daemon CPU per durable message {cpu:.2f} us vs Redis XADD AOF everysec {
 print(f"daemon peak RSS in send c8: {med('send_c8','daemon_peak_rss_kib')/1024:.0f} MiB, "
       f"after its sessions were destroyed: {med('send_c8','daemon_rss_after_kib')/1024:.0f} MiB (goal < 64)")
 print(f"socket-activated start to first reply: {med('first','first_reply_us')/1000:.1f} ms (goal < 10)")
+print(f"daemon RSS with 1,000 idle sessions: {med('idle','idle_rss_kib')/1024:.1f} MiB (goal < 20)")
+print(f"beside a flooder and a window-1024 sender: one-at-a-time round trips p99 "
+      f"{med('neighbours','p99_us'):.0f} us (goal < 2000), daemon peak RSS "
+      f"{med('neighbours','daemon_peak_rss_kib')/1024:.0f} MiB (goal < 64)")
 if sys.argv[2]:
     json.dump(rows, open(sys.argv[2], "w"), indent=1)
 PY
