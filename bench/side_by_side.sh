@@ -69,9 +69,16 @@ r['p99_us'] = r['p99_us']; r['cpu_s_per_million'] = r.get('daemon_cpu_s_per_mill
 print(json.dumps(r))" >>"$results"
 }
 
-# first_reply: a fresh daemon under systemd-socket-activate, timed from connect to reply.
+# first_reply: a daemon started by systemd-socket-activate on the first connection (its store
+# already created), timed from connect to reply.
 first_reply() {
   local home; home=$(mktemp -d -p "$work")
+  # An installed daemon finds its store in place: create it first with one run of its own.
+  "$(dirname "$loadgen")/../Statistics/qnreportingd" --home "$home" --socket "$home/setup.sock" \
+    2>/dev/null &
+  local setup=$!
+  for _ in $(seq 100); do [ -S "$home/setup.sock" ] && break; sleep 0.02; done
+  kill "$setup"; wait "$setup" 2>/dev/null || true
   systemd-socket-activate -l "$home/s.sock" "$(dirname "$loadgen")/../Statistics/qnreportingd" \
     --home "$home" 2>/dev/null &
   local activator=$!
