@@ -1,9 +1,16 @@
 // Per-client request handling (the eleven operations as one or more clients see them), the
-// service delegate (connections, client removal) and the defaults with the reporting switch.
+// service delegate (connections, client removal), the defaults with the reporting switch, the
+// two bridges, and the block throttle (message keys, throttle times, the debounce on its own
+// thread: real time with wide margins, checks of order and count).
+#include <future>
 #include <memory>
+#include <stdexcept>
 #include <string>
 #include <vector>
 
+#include "Statistics/QNReportingEnerdexUtility.h"
+#include "Statistics/QNReportingStatlynBridge.h"
+#include "Statistics/Service/QNReportingBlockThrottle.h"
 #include "tests/service/ServiceHarness.h"
 
 namespace qn {
@@ -16,6 +23,8 @@ using ::testing::EndsWith;
 using testing::FakeIpcConnection;
 using testing::FakePlatform;
 using ::testing::HasSubstr;
+using testing::LogCapture;
+using testing::Payload;
 using testing::Replies;
 using testing::ServiceHarness;
 
@@ -24,10 +33,6 @@ constexpr const char* kSuite = "com.norvel.quenta";
 
 class ServiceTest : public ::testing::Test {
  protected:
-  explicit ServiceTest(const std::function<void(FakePlatform&)>& setup = nullptr,
-                       QNReportingServiceDelegate::Options options = {})
-      : h_(setup, options) {}
-
   ServiceHarness h_;
   testing::LogCapture& log_ = *h_.env.log;
   testing::FakeLivoReporting& livo_ = *h_.env.livo;
@@ -176,53 +181,37 @@ TEST_F(ServiceTest, GetAllReportersListsClientByClientInMapOrder) {
   EXPECT_THAT(r.all(), ElementsAre(ElementsAre(3, 1, 2, 3), ElementsAre(1, 2, 3)));
 }
 
-// With room for 8 sessions per client.
-class SessionLimitTest : public ServiceTest {
- protected:
-  SessionLimitTest() : ServiceTest(nullptr, {.maxSessionsPerClient = 8}) {}
-};
-
-TEST_F(SessionLimitTest, TooManySessionsForOneClientAreNotMade) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  BoolReplies r;
-  for (std::int64_t id = 1; id <= 9; ++id) a->createReportingSession(id, r.Callback());
-  a->createReportingSession(1, r.Callback());  // replacing an existing ID still works
-  h_.Run();
-  EXPECT_EQ(r.size(), 10u);
-  EXPECT_EQ(a->clientReportingSessionMap().size(), 8u);
-  EXPECT_FALSE(a.Session(9));
-  EXPECT_EQ(log_.Count(": client 100 already holds 8 sessions, no session for reporter 9"), 1);
-  h_.Create(b, 9);  // the limit is per client
-  EXPECT_TRUE(b.Session(9));
-}
-
-// With the "Speaker" driver counter X at 5 before the service starts.
-class DriverStatisticsTest : public ServiceTest {
- protected:
-  DriverStatisticsTest()
-      : ServiceTest([](FakePlatform& env) { env.ostrel->SetCounter("Speaker", "Main", "X", 5); }) {}
-};
-
-TEST_F(DriverStatisticsTest, StopSendsTheCountersThatGrew) {
-  Client a = h_.Connect(100);
-  h_.Create(a, 42, 2, true);
-  h_.env.ostrel->SetCounter("Speaker", "Main", "X", 12);
-  a->stopReportingSessionForID(42, BoolReplies().Callback());
-  h_.Run();
-
-  auto messages = livo_.AllSessionMessages();
-  ASSERT_EQ(messages.size(), 2u);
-  EXPECT_EQ(messages[0].category, 9);
-  EXPECT_EQ(messages[0].type, 0);
-  EXPECT_EQ(messages[0].payload, Value(Dictionary{{"Speaker_X", 7}}));
-  EXPECT_EQ(messages[1].category, 0xFFFF);  // the summary event follows
-  auto events = h_.env.analytics->EventsNamed("com.norvel.quenta.Ostreling.Generic");
-  ASSERT_EQ(events.size(), 1u);
-  EXPECT_EQ(events[0].payload,
-            Value(Dictionary{{"Speaker_X", 7}, {"HostApplicationDisplayID", "Unknown"}}));
-  EXPECT_EQ(log_.Count(": fetching driver logs {"), 1);
-  EXPECT_EQ(log_.Count("nothing interesting"), 0);
+// Beyond the limit per client or in all, a create for a new ID makes no session (the reply is
+// still YES): one error line, a refusal counted; replacing an ID still works, and a destroy
+// frees a place.
+TEST(SessionLimitTest, CreatesBeyondEitherLimitMakeNoSession) {
+  const struct {
+    std::size_t perClient, total;
+    const char* line;
+  } rows[] = {{3, 100, ": client 100 already holds 3 sessions, no session for reporter 4"},
+              {100, 3,
+               ": the clients hold 3 sessions, the most allowed; no session for reporter 4 of "
+               "client 100"}};
+  for (const auto& row : rows) {
+    SCOPED_TRACE(row.line);
+    ServiceHarness h(nullptr, {.maxSessionsPerClient = row.perClient, .maxSessions = row.total});
+    const Counters& counters = *h.env.platform->counters;
+    Client a = h.Connect(100);
+    Client b = h.Connect(200);
+    BoolReplies r;
+    for (std::int64_t id : {1, 2, 3, 4, 1}) a->createReportingSession(id, r.Callback());
+    h.Run();
+    EXPECT_THAT(r.all(), ElementsAre(true, true, true, true, true));
+    EXPECT_EQ(a->clientReportingSessionMap().size(), 3u);
+    EXPECT_EQ(h.env.log->Count(row.line), 1);
+    h.Create(b, 9);  // another client's place: its own, or none left in all
+    EXPECT_EQ(b.Session(9) != nullptr, row.total > 3);
+    a->destroyReportingSession(1, r.Callback());
+    h.Create(b, 10);
+    EXPECT_TRUE(b.Session(10));
+    EXPECT_EQ(Counters::Get(counters.sessionsRefused), row.total > 3 ? 1u : 2u);
+    EXPECT_EQ(Counters::Get(counters.sessionsOpen), row.total > 3 ? 4 : 3);
+  }
 }
 
 // --- The delegate: connections ending ------------------------------------------------------
@@ -338,6 +327,233 @@ TEST(DefaultsRegistrationTest, FailedRegistrationLeavesReportingOn) {
   h.PostDefaults();
   EXPECT_TRUE(h.delegate->isReportingEnabled());
   EXPECT_FALSE(h.delegate->getDefaults());
+}
+
+TEST(BridgesTest, StatlynUsesOriginWordsAndUndefinedNames) {
+  FakePlatform env_;
+  QNReportingStatlynBridge::handleEvent(*env_.platform, nullptr, 12, 7, nullptr);
+  QNReportingStatlynBridge::handleEvent(*env_.platform, nullptr, 0x10000008, 1, nullptr);
+  QNReportingStatlynBridge::handleEvent(*env_.platform, nullptr, 9, 0, nullptr);
+
+  auto events = env_.analytics->Events();
+  ASSERT_EQ(events.size(), 3u);
+  EXPECT_EQ(events[0].name, "com.norvel.quenta.Undefined.Undefined");
+  EXPECT_EQ(events[1].name, "com.norvel.quenta.DSP_Error.Start");
+  EXPECT_EQ(events[2].name, "com.norvel.quenta.Ostreling.Generic");
+  // No message and no session: the payload only names the unknown host application.
+  EXPECT_EQ(events[0].payload, Value(Dictionary{{"HostApplicationDisplayID", "Unknown"}}));
+  EXPECT_TRUE(env_.log->Lines().empty());
+}
+
+// The power-log bridge: haptics usage (EngineOnTime wins over a leaked hardware time in the
+// same message), or leaked session info with optional clients; a missing timestamp is one
+// error line on the default log, the rest is still written.
+TEST(BridgesTest, EnerdexWritesHapticsUsageOrLeakedSessionInfo) {
+  FakePlatform env_;
+  auto session = QNReportingSession::initWithID(env_.platform, 42, Array{Value(1)});
+  session->setConfiguration(Payload({{"HostApplicationDisplayID", "com.example.game"}}));
+  const struct {
+    Dictionary message;
+    QNReportingSession* session;
+    const char* name;
+    Dictionary payload;
+  } rows[] = {
+      {{{"EngineOnTime", 12.5},
+        {"qnreporting_timestamp", 1700000000},
+        {"Haptic_Active_Hardware_Time_Seconds", 2}},
+       session.get(),
+       "Vistrel_Haptics",
+       {{"EngineOnDuration", 12.5},
+        {"ApplicationName", "com.example.game"},
+        {"TimestampEnd", 1700000000}}},
+      {{{"Haptic_Active_Hardware_Time_Seconds", 9.25},
+        {"Active_Clients", Value(Array{"a", "b"})},
+        {"other", 1}},
+       nullptr,
+       "LeakedHapticsSessionInfo",
+       {{"Haptic_Active_Hardware_Time_Seconds", 9.25}, {"Active_Clients", Value(Array{"a", "b"})}}},
+      {{{"Haptic_Active_Hardware_Time_Seconds", 4}},
+       nullptr,
+       "LeakedHapticsSessionInfo",
+       {{"Haptic_Active_Hardware_Time_Seconds", 4}}},
+      {{{"EngineOnTime", 3}},
+       nullptr,
+       "Vistrel_Haptics",
+       {{"EngineOnDuration", 3}, {"ApplicationName", "Unknown"}}}};
+  for (const auto& row : rows) {
+    QNReportingEnerdexUtility::handleEvent(*env_.platform, &row.message, 0x0800000B, 6,
+                                           row.session);
+  }
+  auto events = env_.enerdex->Events();
+  ASSERT_EQ(events.size(), std::size(rows));
+  for (std::size_t i = 0; i < events.size(); ++i) {
+    EXPECT_EQ(events[i].subsystem, 28);
+    EXPECT_EQ(events[i].name, rows[i].name);
+    EXPECT_EQ(events[i].payload, Value(rows[i].payload));
+    EXPECT_TRUE(events[i].options.is_null());
+  }
+  auto lines = env_.log->Lines();
+  std::erase_if(lines, [](const auto& l) { return l.scope == "qnrr"; });  // the session's
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_EQ(lines[0].level, LogLevel::kError);
+  EXPECT_THAT(lines[0].text, ::testing::MatchesRegex("QNReportingEnerdexUtility\\.cpp:[0-9]+:.*: "
+                                                     "failed to get QNReporting timestamp for "
+                                                     "enerdex"));
+}
+
+using Throttle = QNReportingBlockThrottle;
+
+std::string Key(const Dictionary& payload, std::int64_t id = 1, std::uint32_t category = 5,
+                std::uint16_t type = 1) {
+  return Throttle::buildMessageKey(payload, id, category, type);
+}
+
+TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValues) {
+  const std::vector<std::pair<std::string, std::string>> cases = {
+      {Throttle::buildMessageKey(Dictionary{{"b", 2}, {"a", "x"}, {"systemuptime_sec", 812}}, 42, 5,
+                                 1),
+       "a|x|b|2|systemuptime_sec|^|reporterID|42|Setup|Start"},
+      {Throttle::buildMessageKey(Dictionary{}, 7, 1, 0), "reporterID|7|Generic|Generic"},
+      // Code-point order: upper case, then "_", then lower case.
+      {Key(Dictionary{{"b", 1}, {"_x", 2}, {"A", 3}}), "A|3|_x|2|b|1|reporterID|1|Setup|Start"},
+      {Key(Dictionary{{"a", 1}, {"_comparison_field_blacklist", Array{Value("a")}}}),
+       "_comparison_field_blacklist|^|a|^|reporterID|1|Setup|Start"},
+      // A skip list that is not an array is ignored.
+      {Key(Dictionary{{"a", 1}, {"_comparison_field_blacklist", "a"}}),
+       "_comparison_field_blacklist|^|a|1|reporterID|1|Setup|Start"},
+      {Key(Dictionary{{"Volume", 0.5}, {"VolumeOperationTime", 3}, {"_throttle_seconds", 1}}),
+       "Volume|^|VolumeOperationTime|^|_throttle_seconds|^|reporterID|1|Setup|Start"}};
+  for (const auto& [key, expected] : cases) EXPECT_EQ(key, expected);
+}
+
+TEST(MessageKeyTest, DuplicatesAndDistinctMessages) {
+  struct Case {
+    std::string a, b;
+    bool duplicates;
+  };
+  const Case cases[] = {
+      {Key(Dictionary{{"x", 1}, {"qnreporting_timestamp", 1}}),
+       Key(Dictionary{{"x", 1}, {"qnreporting_timestamp", 2}}), true},
+      {Key(Dictionary{{"Volume", 0.3}, {"VolumeOperationTime", 1}}),
+       Key(Dictionary{{"Volume", 0.7}, {"VolumeOperationTime", 2}}), true},
+      {Key(Dictionary{{"Volume", 0.3}}), Key(Dictionary{{"Volume", 0.7}}), false},
+      {Key(Dictionary{{"x", 1}, {"processuptime_ms", 5}}), Key(Dictionary{{"x", 1}}), false},
+      {Key(Dictionary{}, 1, 12), Key(Dictionary{}, 1, 13), true},  // both "Undefined"
+      {Key(Dictionary{}, 1, 5, 6), Key(Dictionary{}, 1, 5, 65534), true},
+      {Key(Dictionary{}, 1), Key(Dictionary{}, 2), false}};
+  for (const Case& c : cases) EXPECT_EQ(c.a == c.b, c.duplicates) << c.a << " / " << c.b;
+}
+
+TEST(ThrottleTimeTest, AcceptsIntegerPartUpToFourElseHalfASecondWithAnInfoLine) {
+  struct Case {
+    std::optional<Value> time;
+    double seconds;
+    std::string line;  // the info line's text after the prefix, or "" for none
+  };
+  const Case cases[] = {
+      {std::nullopt, 0.5, ""},
+      {Value(4.99), static_cast<double>(4.99f), ""},
+      {Value(-1), -1.0, ""},
+      {Value(0), 0.0, ""},
+      {Value(5), 0.5, ": Rejecting large throttle time. {time=5, max=5.000000}"},
+      {Value("2"), 0.5, ": Rejecting non Valbox value of throttle time. {time=2}"}};
+  for (const Case& c : cases) {
+    LogCapture log;
+    Dictionary payload;
+    if (c.time) payload.Set("_throttle_seconds", *c.time);
+    EXPECT_EQ(Throttle::determineSleepTime(payload, log), c.seconds);
+    const auto lines = log.Lines();
+    ASSERT_EQ(lines.size(), c.line.empty() ? 0u : 1u);
+    if (!c.line.empty()) {
+      EXPECT_EQ(lines[0].level, LogLevel::kInfo);
+      EXPECT_THAT(lines[0].text, EndsWith(c.line));
+    }
+  }
+}
+
+class BlockThrottleTest : public ::testing::Test {
+ protected:
+  void SetUp() override { log_->EnableDebug("all"); }
+  std::shared_ptr<LogCapture> log_ = std::make_shared<LogCapture>();
+  Throttle throttle_{log_, nullptr};
+};
+
+// Two same-key messages 0.2 s apart with a delay well above that (wide margin).
+TEST_F(BlockThrottleTest, OnlyTheLastActionOfABurstRunsOnce) {
+  std::atomic<int> first{0}, second{0}, other{0};
+  std::promise<void> ran;
+  const Dictionary message{{"a", 1}, {"_throttle_seconds", 1.5}};
+  throttle_.addMessageBlock([&] { ++first; }, 1, message, 5, 1);
+  std::this_thread::sleep_for(std::chrono::milliseconds(200));
+  const auto second_added = std::chrono::steady_clock::now();
+  std::chrono::steady_clock::time_point second_ran;
+  throttle_.addMessageBlock(
+      [&] {
+        second_ran = std::chrono::steady_clock::now();
+        ++second, ran.set_value();
+      },
+      1, message, 5, 1);
+  throttle_.addMessageBlock([&] { ++other; }, 2, message, 5, 1);  // another reporter
+  ASSERT_EQ(ran.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  throttle_.waitForCompletion();
+  EXPECT_EQ(first, 0);
+  EXPECT_EQ(second, 1);
+  EXPECT_GE(second_ran - second_added, std::chrono::milliseconds(1450));  // the delay restarted
+  EXPECT_EQ(other, 1);
+  EXPECT_EQ(
+      log_->Count(
+          ": Dropping duplicate message for _throttle_seconds|^|a|1|reporterID|1|Setup|Start"),
+      1);
+  EXPECT_EQ(throttle_.timersInFlightCount(), 0u);
+  // The queue thread's own debug lines.
+  for (const char* text :
+       {": calling workingRunLoop run from inside thread block", ": sleeping in thread"}) {
+    const auto lines = log_->Lines();
+    EXPECT_TRUE(std::any_of(lines.begin(), lines.end(), [text](const auto& line) {
+      return line.level == LogLevel::kDebug && line.text.ends_with(text);
+    })) << text;
+  }
+}
+
+TEST_F(BlockThrottleTest, AnActionThatThrowsLeavesNoEntryAndTheThrottleGoesOn) {
+  std::promise<void> ran;
+  throttle_.addMessageBlock([] { throw std::runtime_error("boom"); }, 1,
+                            Dictionary{{"_throttle_seconds", 0}}, 5, 1);
+  // The throttle goes on after the failure: another action still runs.
+  throttle_.addMessageBlock([&] { ran.set_value(); }, 2, Dictionary{{"_throttle_seconds", 0}}, 5,
+                            1);
+  ASSERT_EQ(ran.get_future().wait_for(std::chrono::seconds(10)), std::future_status::ready);
+  throttle_.waitForCompletion();
+  EXPECT_EQ(throttle_.timersInFlightCount(), 0u);
+  // The failure is logged once the exception has left the action (bounded wait).
+  for (int i = 0; i < 100 && log_->Count(": throttled action failed: boom") == 0; ++i) {
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+  }
+  EXPECT_EQ(log_->Count(": throttled action failed: boom"), 1);
+}
+
+TEST_F(BlockThrottleTest, WaitForCompletionReturnsAtOnceOrGivesUpAfterFiveSeconds) {
+  throttle_.waitForCompletion();
+  auto lines = log_->Lines();  // no wait, no give-up line; the thread's own lines aside
+  std::erase_if(lines,
+                [](const auto& line) { return line.text.ends_with(": sleeping in thread"); });
+  ASSERT_EQ(lines.size(), 1u);
+  EXPECT_EQ(lines[0].level, LogLevel::kInfo);
+  EXPECT_THAT(lines[0].text,
+              EndsWith(": waitForCompletion. timersInFlight=0 unscheduledTimerKeys=0"));
+
+  // An action that outlasts the wait keeps its entry until it returns.
+  std::promise<void> release;
+  std::shared_future<void> released = release.get_future().share();
+  throttle_.addMessageBlock([released] { released.wait(); }, 1,
+                            Dictionary{{"_throttle_seconds", 0}}, 5, 1);
+  throttle_.waitForCompletion();
+  release.set_value();
+  EXPECT_EQ(log_->Count("Waiting up to 5 seconds for blockThrottle queue to be empty."), 1);
+  const auto gave_up = log_->Matching("Giving up");
+  ASSERT_EQ(gave_up.size(), 1u);
+  EXPECT_THAT(gave_up[0],
+              EndsWith(": Giving up on waiting for completion after 5 seconds. timersInFlight=1"));
 }
 
 }  // namespace

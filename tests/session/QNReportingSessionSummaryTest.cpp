@@ -1,8 +1,11 @@
-// The session summary event and the summary file written at stop.
+// What a session aggregates (messages, orientation changes) and the summary event and file
+// made of it at stop.
 #include <sys/stat.h>
 
+#include <atomic>
 #include <filesystem>
 #include <fstream>
+#include <thread>
 
 #include "common/Json.h"
 #include "tests/fakes/TempDir.h"
@@ -13,10 +16,12 @@ namespace {
 
 namespace fs = std::filesystem;
 using ::testing::ElementsAre;
+using ::testing::EndsWith;
 using ::testing::HasSubstr;
 using ::testing::MatchesRegex;
 using testing::Payload;
 using testing::ReadFileText;
+using namespace std::chrono_literals;
 
 // Summary files go to a temporary folder.
 class SummaryTest : public testing::SessionFixture {
@@ -151,6 +156,118 @@ TEST_F(SummaryTest, BlockedDirectoryIsLoggedAndStopGoesOn) {
   EXPECT_EQ(errors, 2);
   EXPECT_FALSE(session->started());
   EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
+}
+
+TEST_F(SummaryTest, ChangesFiledInSecondsUnregisteredAtStop) {
+  SetInternal(true);
+  t_.log->EnableDebug("qnrr");
+  auto session = NewSession(42, 2);
+  session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.phone"}}));
+  session->start();
+  EXPECT_EQ(session->orientationCallbackID(), "QNReportingService 42");
+  ASSERT_TRUE(session->startDate());
+  const auto wallStart = t_.dispatcher->WallNow();
+  EXPECT_DOUBLE_EQ(session->startDate()->seconds_since_1970,
+                   std::chrono::duration<double>(wallStart.time_since_epoch()).count());
+  EXPECT_THAT(t_.orientation->Events(), ElementsAre("register device QNReportingService 42",
+                                                    "register ui QNReportingService 42"));
+
+  t_.dispatcher->AdvanceBy(1234500us);
+  EXPECT_EQ(t_.orientation->FireDevice(3), 1);
+  t_.dispatcher->AdvanceBy(765500us);  // 2.000 s after start
+  EXPECT_EQ(t_.orientation->FireUI(1), 1);
+  t_.dispatcher->AdvanceBy(1999us);
+  t_.orientation->FireDevice(4);
+
+  EXPECT_THAT(
+      session->aggregatedPayloadData()->Snapshot(),
+      ElementsAre(Value(Dictionary{{"device_orientation", "LandscapeLeft"},
+                                   {"device_orientation_time", 1.234}}),
+                  Value(Dictionary{{"ui_orientation", "Portrait"}, {"ui_orientation_time", 2.0}}),
+                  Value(Dictionary{{"device_orientation", "LandscapeRight"},
+                                   {"device_orientation_time", 2.001}})));
+  EXPECT_THAT(
+      t_.log->Matching("Orientation handler"),
+      ElementsAre(
+          MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*: Orientation handler callback "
+                       "mode=device orientation=\"LandscapeLeft\" app=\"org.example.phone\", "
+                       "time=1.234, id=\"QNReportingService 42\""),
+          EndsWith(": Orientation handler callback mode=ui "
+                   "orientation=\"Portrait\" app=\"org.example.phone\", "
+                   "time=2, id=\"QNReportingService 42\""),
+          HasSubstr("time=2.001,")));
+
+  // The entries reach the summary under their four keys, in the order of the changes.
+  auto summary = session->createSummaryEventForSession();
+  ASSERT_TRUE(summary);
+  EXPECT_EQ(*summary->Find("device_orientation"), Value("LandscapeLeft,LandscapeRight"));
+  EXPECT_EQ(*summary->Find("device_orientation_time"), Value("1.234,2.001"));
+  EXPECT_EQ(*summary->Find("ui_orientation"), Value("Portrait"));
+  EXPECT_EQ(*summary->Find("ui_orientation_time"), Value("2"));
+
+  session->stop();
+  EXPECT_FALSE(session->orientationCallbackID());
+  EXPECT_THAT(t_.orientation->Events(), ElementsAre("register device QNReportingService 42",
+                                                    "register ui QNReportingService 42",
+                                                    "unregister device QNReportingService 42",
+                                                    "unregister ui QNReportingService 42"));
+  EXPECT_EQ(t_.orientation->FireDevice(1) + t_.orientation->FireUI(1), 0);
+  t_.dispatcher->RunUntilIdle();
+}
+
+TEST_F(SummaryTest, CallbacksRaceWithIntakeAndStop) {
+  SetInternal(true);
+  auto session = NewSession(42, 7);
+  session->start();
+  std::atomic<bool> go{true};
+  std::thread source([&] {
+    for (int i = 0; go.load(); ++i) {
+      t_.orientation->FireDevice(i % 6 + 1);
+      t_.orientation->FireUI(i % 6 + 1);
+    }
+  });
+  for (int i = 0; i < 200; ++i) {
+    session->sendMessage(Payload({{"i", i}}), 1, 0, nullptr);
+  }
+  auto aggregated = session->aggregatedPayloadData();
+  session->stop();
+  go = false;
+  source.join();
+  // Every message and at least the changes before stop were filed; after stop the session
+  // has no array for late callbacks to add to.
+  EXPECT_GE(aggregated->Snapshot().size(), 200u);
+  EXPECT_FALSE(session->aggregatedPayloadData());
+  t_.dispatcher->RunUntilIdle();
+}
+
+// Beyond the aggregation cap a payload is still delivered but left out of the summary, with
+// one error line per started period; the counter counts each payload left out.
+TEST_F(SummaryTest, PayloadsBeyondTheAggregationCapAreDeliveredButNotSummarised) {
+  t_.platform->max_aggregated_bytes = 2 * Value(Dictionary{{"a", 1}}).ApproximateBytes();
+  const std::string line = "session 42 holds " + std::to_string(t_.platform->max_aggregated_bytes) +
+                           " bytes of payloads, the most it aggregates; later messages are "
+                           "delivered but left out of its summary";
+  auto session = NewSession(42, 3);
+  const Counters& counters = *t_.platform->counters;
+  for (int period = 1; period <= 2; ++period) {
+    session->start();
+    const auto delivered = t_.livo->AllSessionMessages().size();
+    const auto capped = Counters::Get(counters.aggregationCapped);
+    for (int i = 1; i <= 4; ++i) session->sendMessage(Payload({{"a", i}}), 1, 0, nullptr);
+    t_.dispatcher->RunUntilIdle();
+    EXPECT_EQ(t_.livo->AllSessionMessages().size(), delivered + 4);
+    EXPECT_EQ(*session->createSummaryEventForSession(),
+              (Dictionary{{"QN_Session_Summary_Event", "3"}, {"a", "1,2"}}));
+    EXPECT_EQ(Counters::Get(counters.aggregationCapped), capped + 2);
+    session->stop();  // the summary event, itself beyond the cap, is counted too
+    t_.dispatcher->RunUntilIdle();
+  }
+  EXPECT_THAT(t_.log->Matching("the most it aggregates"),
+              ElementsAre(MatchesRegex("QNReportingSession\\.cpp:[0-9]+:.*sendMessage.*: " + line),
+                          EndsWith(": " + line)));
+  for (const auto& l : t_.log->Lines()) {
+    EXPECT_TRUE(l.level == LogLevel::kError || !l.text.ends_with(line)) << l.text;
+  }
 }
 
 }  // namespace
