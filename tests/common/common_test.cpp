@@ -7,12 +7,9 @@
 #include <algorithm>
 #include <cerrno>
 #include <cmath>
-#include <cstring>
-#include <ctime>
 #include <filesystem>
 #include <fstream>
 #include <limits>
-#include <msgpack.hpp>
 #include <nlohmann/json.hpp>
 #include <random>
 #include <string>
@@ -85,54 +82,32 @@ TEST(FrameTest, AnyChunkingYieldsEveryBodyInOrder) {
   }
 }
 
-TEST(FrameTest, ZeroLengthIsAPermanentError) {
-  FrameDecoder decoder;
-  std::string stream;
-  AppendFrame(stream, Value(7));
-  stream += Header(0);
-  stream += SampleStream();
-  decoder.Feed(stream);
-  EXPECT_TRUE(decoder.Next());  // the good frame before it still comes out
-  EXPECT_FALSE(decoder.Next());
-  ASSERT_TRUE(decoder.error());
-  EXPECT_EQ(decoder.error()->code, ConnectionError::kBadLength);
-  EXPECT_EQ(decoder.buffered(), 0u);
-  decoder.Feed(SampleStream());  // discarded
-  EXPECT_FALSE(decoder.Next());
-  EXPECT_EQ(decoder.buffered(), 0u);
-}
-
-TEST(FrameTest, OversizedLengthFailsAsSoonAsTheHeaderArrives) {
-  FrameDecoder decoder;
-  std::string header = Header(kMaxBodyBytes + 1);
-  for (std::size_t i = 0; i < 3; ++i) {
-    decoder.Feed(header.substr(i, 1));
+// A length of zero or over the maximum is a permanent error once the header is in: the
+// frames before it still come out, later bytes are discarded. The maximum is accepted.
+TEST(FrameTest, LengthsOfZeroOrOverTheMaximumArePermanentErrors) {
+  for (std::uint32_t bad : {0u, static_cast<std::uint32_t>(kMaxBodyBytes + 1), 0xffffffffu}) {
+    FrameDecoder decoder;
+    std::string stream;
+    AppendFrame(stream, Value(7));
+    decoder.Feed(stream + Header(bad).substr(0, 3));
+    EXPECT_TRUE(decoder.Next());
     EXPECT_FALSE(decoder.Next());
     EXPECT_FALSE(decoder.error());
+    decoder.Feed(Header(bad).substr(3) + SampleStream());
+    EXPECT_FALSE(decoder.Next());
+    ASSERT_TRUE(decoder.error());
+    EXPECT_EQ(decoder.error()->code, ConnectionError::kBadLength);
+    EXPECT_EQ(decoder.error()->message,
+              "bad frame length " + std::to_string(bad) + " (must be 1 to 1048576 bytes)");
+    EXPECT_EQ(decoder.buffered(), 0u);
   }
-  decoder.Feed(header.substr(3));
-  EXPECT_FALSE(decoder.Next());
-  ASSERT_TRUE(decoder.error());
-  EXPECT_EQ(decoder.error()->code, ConnectionError::kBadLength);
-  EXPECT_NE(decoder.error()->message.find("1048577"), std::string::npos);
-
-  FrameDecoder huge;
-  huge.Feed(Header(0xffffffff));
-  EXPECT_FALSE(huge.Next());
-  EXPECT_TRUE(huge.error());
-}
-
-TEST(FrameTest, ExactlyTheMaximumIsAccepted) {
   FrameDecoder decoder;
-  decoder.Feed(Header(kMaxBodyBytes));
-  decoder.Feed(std::string(kMaxBodyBytes - 1, 'a'));
+  decoder.Feed(Header(kMaxBodyBytes) + std::string(kMaxBodyBytes - 1, 'a'));
   EXPECT_FALSE(decoder.Next());
-  EXPECT_FALSE(decoder.error());
   decoder.Feed("b");
   auto body = decoder.Next();
-  ASSERT_TRUE(body);
-  EXPECT_EQ(body->size(), kMaxBodyBytes);
-  EXPECT_EQ(body->back(), 'b');
+  ASSERT_TRUE(body && body->size() == kMaxBodyBytes);
+  EXPECT_FALSE(decoder.error());
 }
 
 using protocol::RequestProblem;
@@ -143,30 +118,10 @@ std::string Bytes(std::initializer_list<int> bytes) {
   return out;
 }
 
-std::string Hex(std::string_view bytes) {
-  static const char* kHex = "0123456789abcdef";
-  std::string out;
-  for (unsigned char c : bytes) {
-    out += kHex[c >> 4];
-    out += kHex[c & 15];
-  }
-  return out;
-}
-
-Value MustDecode(std::string_view body) {
-  auto result = DecodeMsgPack(body);
-  if (auto* problem = std::get_if<RequestProblem>(&result)) {
-    ADD_FAILURE() << "decode failed: " << problem->message << " for " << Hex(body);
-    return Value();
-  }
-  return std::get<Value>(std::move(result));
-}
-
 RequestProblem MustFail(std::string_view body) {
   auto result = DecodeMsgPack(body);
   if (auto* problem = std::get_if<RequestProblem>(&result)) return *problem;
-  ADD_FAILURE() << "decode of " << Hex(body.substr(0, 64))
-                << " succeeded: " << std::get<Value>(result).Description();
+  ADD_FAILURE() << "decoded: " << std::get<Value>(result).Description();
   return RequestProblem{};
 }
 
@@ -253,8 +208,8 @@ std::string NestedMaps(int depth) {
 }
 
 TEST(MsgPackTest, NestingIsLimitedTo64Levels) {
-  EXPECT_TRUE(MustDecode(NestedArrays(64)).is_array());
-  EXPECT_TRUE(MustDecode(NestedMaps(64)).is_dictionary());
+  EXPECT_TRUE(std::holds_alternative<Value>(DecodeMsgPack(NestedArrays(64))));
+  EXPECT_TRUE(std::holds_alternative<Value>(DecodeMsgPack(NestedMaps(64))));
   for (const std::string& body :
        {NestedArrays(65), NestedMaps(65), NestedArrays(1000), NestedArrays(100000)}) {
     RequestProblem problem = MustFail(body);

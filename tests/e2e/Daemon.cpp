@@ -11,7 +11,6 @@
 #include <gtest/gtest.h>
 
 #include <algorithm>
-#include <cerrno>
 #include <cstring>
 #include <filesystem>
 #include <thread>
@@ -168,29 +167,27 @@ std::vector<ReportingStoreRow> Daemon::Rows(std::optional<ReportingSink> sink) c
   return testing::ReadRows(db_path(), sink);
 }
 
-bool Daemon::WaitForRows(
-    const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition) {
-  const auto deadline = std::chrono::steady_clock::now() + kPatience;
-  for (;;) {
-    if (condition(Rows())) return true;
+bool Eventually(const std::function<bool()>& condition) {
+  for (const auto deadline = std::chrono::steady_clock::now() + kPatience; !condition();) {
     if (std::chrono::steady_clock::now() > deadline) return false;
     std::this_thread::sleep_for(10ms);
   }
+  return true;
+}
+
+bool Daemon::WaitForRows(
+    const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition) {
+  return Eventually([&] { return condition(Rows()); });
 }
 
 bool Daemon::WaitForStat(std::initializer_list<const char*> path, std::int64_t least) {
-  const auto deadline = std::chrono::steady_clock::now() + kPatience;
-  while (std::chrono::steady_clock::now() < deadline) {
+  return Eventually([&] {
     Value stats = Json(testing::ReadFileText(home() + "/run/stats.json"));
     const Value* at = &stats;
-    for (const char* key : path) {
-      const Dictionary* level = at ? at->as_dictionary() : nullptr;
-      at = level ? level->Find(key) : nullptr;
-    }
-    if (at && at->as_int64().value_or(0) >= least) return true;
-    std::this_thread::sleep_for(50ms);
-  }
-  return false;
+    for (const char* key : path)
+      at = at && at->as_dictionary() ? at->as_dictionary()->Find(key) : nullptr;
+    return at && at->as_int64().value_or(0) >= least;
+  });
 }
 
 std::vector<std::string> NamesIn(const std::string& dir) {

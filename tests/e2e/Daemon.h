@@ -25,6 +25,10 @@ using namespace std::chrono_literals;
 // Generous bounds for things that happen in milliseconds; they only end a hung test.
 inline constexpr std::chrono::milliseconds kPatience = 30s;
 
+// Polls `condition` every 10 ms until it holds (true) or kPatience passes (false), for state
+// with no event to wait on (rows written after a reply, the stats file, a socket file).
+bool Eventually(const std::function<bool()>& condition);
+
 // How a child process ended.
 struct ExitStatus {
   bool exited = false;  // by exit(); else by a signal (or not at all within the wait)

@@ -10,7 +10,6 @@
 #include <algorithm>
 #include <filesystem>
 #include <set>
-#include <thread>
 
 #include "tests/e2e/Daemon.h"
 #include "tests/store/store_test_util.h"
@@ -132,11 +131,7 @@ TEST(SocketActivationTest, TheFirstConnectionStartsTheDaemonWhichAnswersAndNotif
       {"--listen=" + socket, "--setenv=NOTIFY_SOCKET=" + home.path() + "/notify.sock",
        QN_DAEMON_PATH, "--home", home.path()},
       home.path());
-  for (auto deadline = std::chrono::steady_clock::now() + kPatience;
-       !std::filesystem::exists(socket) && std::chrono::steady_clock::now() < deadline;) {
-    std::this_thread::sleep_for(5ms);
-  }
-  ASSERT_TRUE(std::filesystem::exists(socket)) << activator.Stderr();
+  ASSERT_TRUE(Eventually([&] { return std::filesystem::exists(socket); })) << activator.Stderr();
   // Nothing has started the daemon yet: it creates its store when it starts.
   EXPECT_FALSE(std::filesystem::exists(home.path() + "/state/reports.db"));
 

@@ -7,9 +7,7 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <cerrno>
-#include <cstdio>
 #include <filesystem>
 #include <fstream>
 #include <mutex>
@@ -25,9 +23,7 @@
 #include "platform/linux/linux_log.h"
 #include "platform/linux/linux_notify.h"
 #include "platform/linux/linux_ostrel.h"
-#include "tests/fakes/FakeOstrel.h"
 #include "tests/fakes/FakePlatform.h"
-#include "tests/fakes/LogCapture.h"
 #include "tests/platform/test_util.h"
 
 namespace qn {
@@ -348,26 +344,20 @@ class LinuxDefaultsTest : public ::testing::Test {
   std::shared_ptr<Defaults> defaults_ = NewLinuxDefaults({.state_dir = dir_.path(), .log = log_});
 };
 
+// A missing suite reads empty (logged at debug level only); a suite is one JSON object in
+// <state>/defaults, written without leaving temporary files (the qnreport tests write, read
+// and delete values through the same calls).
 TEST_F(LinuxDefaultsTest, WritesOneJsonObjectPerSuiteAMissingOneReadsEmpty) {
-  Dictionary read{{"stale", 1}};
-  ASSERT_EQ(ReadSuite(dir_.path(), kSuite, read), std::nullopt);
-  EXPECT_TRUE(read.empty());
   EXPECT_FALSE(defaults_->OpenSuite(kSuite)->BoolForKey("disable_reporting"));
-  EXPECT_TRUE(log_->Lines().empty()) << "a missing suite is logged at debug level only";
-
+  EXPECT_TRUE(log_->Lines().empty());
   ASSERT_EQ(WriteDefault(dir_.path(), kSuite, "device_name", "Kitchen"), std::nullopt);
   ASSERT_EQ(WriteDefault(dir_.path(), kSuite, "disable_reporting", 1), std::nullopt);
   EXPECT_EQ(SuitePath(), dir_.path() + "/defaults/com.norvel.quenta.json");
   Value parsed;
   ASSERT_EQ(ParseJson(FileText(), parsed), std::nullopt);
   EXPECT_EQ(parsed, Value(Dictionary{{"device_name", "Kitchen"}, {"disable_reporting", 1}}));
-  ASSERT_EQ(DeleteDefault(dir_.path(), kSuite, "device_name"), std::nullopt);
-  ASSERT_EQ(DeleteDefault(dir_.path(), kSuite, "never-there"), std::nullopt);
-  ASSERT_EQ(ReadSuite(dir_.path(), kSuite, read), std::nullopt);
-  EXPECT_EQ(read, (Dictionary{{"disable_reporting", 1}}));
-  // Only the suite and its lock file are left in the folder: no temporary files.
   const std::filesystem::directory_iterator files(dir_.File("defaults"));
-  EXPECT_EQ(std::distance(begin(files), end(files)), 2);
+  EXPECT_EQ(std::distance(begin(files), end(files)), 2);  // the suite and its lock file
 }
 
 TEST_F(LinuxDefaultsTest, MalformedSuiteReadsEmptyAndIsNotOverwritten) {

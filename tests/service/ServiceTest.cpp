@@ -6,6 +6,7 @@
 #include <memory>
 #include <stdexcept>
 #include <string>
+#include <tuple>
 #include <vector>
 
 #include "Statistics/QNReportingEnerdexUtility.h"
@@ -36,60 +37,57 @@ class ServiceTest : public ::testing::Test {
   ServiceHarness h_;
   testing::LogCapture& log_ = *h_.env.log;
   testing::FakeLivoReporting& livo_ = *h_.env.livo;
+  Client a_ = h_.Connect(100);  // two clients, in this order
+  Client b_ = h_.Connect(200);
 };
 
 TEST_F(ServiceTest, SetServiceTypeTouchesOnlyTheCallersOwnSessions) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  h_.Create(a, 42);
+  h_.Create(a_, 42);
   BoolReplies r;
-  b->setServiceType(2, 42, r.Callback());
-  b->setServiceType(2, 0, r.Callback());
+  b_->setServiceType(2, 42, r.Callback());
+  b_->setServiceType(2, 0, r.Callback());
   h_.Run();
-  EXPECT_EQ(a.Session(42)->serviceType(), 65535);
+  EXPECT_EQ(a_.Session(42)->serviceType(), 65535);
   EXPECT_EQ(log_.Count("set for reporter"), 0);
 
-  a->setServiceType(7, 42, r.Callback());
+  a_->setServiceType(7, 42, r.Callback());
   h_.Run();
   EXPECT_THAT(r.all(), ElementsAre(true, true, true));
-  EXPECT_EQ(a.Session(42)->serviceName(), "longformaudio");
+  EXPECT_EQ(a_.Session(42)->serviceName(), "longformaudio");
   EXPECT_EQ(log_.Count(": service type 7 set for reporter  42"), 1);
 }
 
 TEST_F(ServiceTest, GetServiceNameSearchOrderAndZero) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  h_.Create(a, 42, 2);
+  h_.Create(a_, 42, 2);
   Replies<std::uint16_t> r;
-  b->getServiceNameForReporterID(42, r.Callback());
-  b->getServiceNameForReporterID(43, r.Callback());
-  a->getServiceNameForReporterID(0, r.Callback());
+  b_->getServiceNameForReporterID(42, r.Callback());
+  b_->getServiceNameForReporterID(43, r.Callback());
+  a_->getServiceNameForReporterID(0, r.Callback());
   h_.Run();
   EXPECT_THAT(r.all(), ElementsAre(2, 65535, 65535, 65535));
   EXPECT_EQ(log_.Count(": returnning service type 2 for reporter  42"), 1);
 
-  h_.Create(a, 0);  // a session under ID 0 is allowed, and found by the second answer
-  a.Session(0)->setServiceType(3);  // (the protocol cannot type it: ID 0 is refused there)
+  h_.Create(a_, 0);  // a session under ID 0 is allowed, and found by the second answer
+  a_.Session(0)->setServiceType(3);  // (the protocol cannot type it: ID 0 is refused there)
   Replies<std::uint16_t> own;
-  a->getServiceNameForReporterID(0, own.Callback());
+  a_->getServiceNameForReporterID(0, own.Callback());
   h_.Run();
   EXPECT_THAT(own.all(), ElementsAre(65535, 3));
 }
 
 TEST_F(ServiceTest, StartHoldsItsReplyUntilStopAndANewStartDeliversTheOneItReplaces) {
-  Client a = h_.Connect(100);
-  h_.Create(a, 42, 2);
+  h_.Create(a_, 42, 2);
   std::vector<std::string> order;
-  a->startReportingSessionForID(42,
-                                [&](bool ok) { order.push_back(ok ? "start YES" : "start NO"); });
+  a_->startReportingSessionForID(42,
+                                 [&](bool ok) { order.push_back(ok ? "start YES" : "start NO"); });
   h_.Run();
-  auto session = a.Session(42);
+  auto session = a_.Session(42);
   EXPECT_TRUE(order.empty());
   EXPECT_TRUE(session->started());
   ASSERT_TRUE(session->driverSnapShot());  // empty without drivers, but present
   EXPECT_EQ(livo_.Sessions().size(), 1u);
 
-  a->stopReportingSessionForID(42, [&](bool ok) { order.push_back(ok ? "stop YES" : "stop NO"); });
+  a_->stopReportingSessionForID(42, [&](bool ok) { order.push_back(ok ? "stop YES" : "stop NO"); });
   h_.Run();
   EXPECT_THAT(order, ElementsAre("start YES", "stop YES"));
   EXPECT_FALSE(session->started());
@@ -98,46 +96,43 @@ TEST_F(ServiceTest, StartHoldsItsReplyUntilStopAndANewStartDeliversTheOneItRepla
   EXPECT_EQ(log_.Count(": nothing interesting to fetch from the drivers"), 1);
   EXPECT_EQ(log_.Count(": stopping 42"), 1);
 
-  BoolReplies first = h_.Create(a, 7, std::nullopt, true);
-  a.Session(7)->stop();  // stopped behind the handler's back: the reply stays pending
+  BoolReplies first = h_.Create(a_, 7, std::nullopt, true);
+  a_.Session(7)->stop();  // stopped behind the handler's back: the reply stays pending
   EXPECT_TRUE(first.empty());
   BoolReplies second;
-  a->startReportingSessionForID(7, second.Callback());
+  a_->startReportingSessionForID(7, second.Callback());
   h_.Run();
   EXPECT_THAT(first.all(), ElementsAre(true));
   EXPECT_TRUE(second.empty());
-  EXPECT_TRUE(a.Session(7)->started());
+  EXPECT_TRUE(a_.Session(7)->started());
 }
 
 TEST_F(ServiceTest, StartReachesAnotherClientsSessionButStopDoesNot) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  h_.Create(a, 42);
+  h_.Create(a_, 42);
   BoolReplies startByB, stopByB, stopByA;
-  b->startReportingSessionForID(42, startByB.Callback());
+  b_->startReportingSessionForID(42, startByB.Callback());
   h_.Run();
-  auto session = a.Session(42);
+  auto session = a_.Session(42);
   EXPECT_TRUE(session->started());
-  b->stopReportingSessionForID(42, stopByB.Callback());
+  b_->stopReportingSessionForID(42, stopByB.Callback());
   h_.Run();
   EXPECT_THAT(stopByB.all(), ElementsAre(true));
   EXPECT_TRUE(session->started());
   EXPECT_TRUE(startByB.empty());
   EXPECT_EQ(log_.Count(": stopping 42"), 1);  // logged although nothing was stopped
 
-  a->stopReportingSessionForID(42, stopByA.Callback());
+  a_->stopReportingSessionForID(42, stopByA.Callback());
   h_.Run();
   EXPECT_FALSE(session->started());
   EXPECT_THAT(startByB.all(), ElementsAre(true));  // B's reply travels with the session
 }
 
 TEST_F(ServiceTest, StartStopAndDestroyOfZeroOrUnknownIDsReplyAtOnce) {
-  Client a = h_.Connect(100);
   BoolReplies r;
   for (std::int64_t id : {0, 99}) {
-    a->startReportingSessionForID(id, r.Callback());
-    a->stopReportingSessionForID(id, r.Callback());
-    a->destroyReportingSession(id, r.Callback());
+    a_->startReportingSessionForID(id, r.Callback());
+    a_->stopReportingSessionForID(id, r.Callback());
+    a_->destroyReportingSession(id, r.Callback());
   }
   h_.Run();
   EXPECT_EQ(r.size(), 6u);
@@ -150,12 +145,10 @@ TEST_F(ServiceTest, StartStopAndDestroyOfZeroOrUnknownIDsReplyAtOnce) {
 }
 
 TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionOfEveryClient) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  h_.Create(a, 1, 2, true);
-  h_.Create(a, 2, 2);
-  h_.Create(b, 3, 7, true);
-  EXPECT_FALSE(h_.Send(b, {{"k", "v"}}, 3, 1, std::nullopt));
+  h_.Create(a_, 1, 2, true);
+  h_.Create(a_, 2, 2);
+  h_.Create(b_, 3, 7, true);
+  EXPECT_FALSE(h_.Send(b_, {{"k", "v"}}, 3, 1, std::nullopt));
 
   auto sessions = livo_.Sessions();
   ASSERT_EQ(sessions.size(), 2u);
@@ -169,14 +162,13 @@ TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionOfEveryClient) {
 }
 
 TEST_F(ServiceTest, GetAllReportersListsClientByClientInMapOrder) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  const std::pair<Client*, std::int64_t> creates[] = {{&a, 3}, {&a, 1}, {&a, 3}, {&b, 2}, {&b, 3}};
+  const std::pair<Client*, std::int64_t> creates[] = {
+      {&a_, 3}, {&a_, 1}, {&a_, 3}, {&b_, 2}, {&b_, 3}};
   for (auto [c, id] : creates) h_.Create(*c, id);
   Replies<std::vector<std::int64_t>> r;
-  b->getAllReporters(r.Callback());  // replacing 3 kept its place
-  a->destroyReportingSession(3, BoolReplies().Callback());
-  a->getAllReporters(r.Callback());
+  b_->getAllReporters(r.Callback());  // replacing 3 kept its place
+  a_->destroyReportingSession(3, BoolReplies().Callback());
+  a_->getAllReporters(r.Callback());
   h_.Run();
   EXPECT_THAT(r.all(), ElementsAre(ElementsAre(3, 1, 2, 3), ElementsAre(1, 2, 3)));
 }
@@ -217,29 +209,29 @@ TEST(SessionLimitTest, CreatesBeyondEitherLimitMakeNoSession) {
 // --- The delegate: connections ending ------------------------------------------------------
 
 TEST_F(ServiceTest, EndBeforeListingLogsAMissingStartDate) {
-  h_.env.process->SetName(100, "player");
-  auto connection = std::make_shared<FakeIpcConnection>(100);
+  h_.env.process->SetName(300, "player");
+  auto connection = std::make_shared<FakeIpcConnection>(300);
   h_.listener->Accept(connection);
   log_.Clear();
   connection->Invalidate();
   std::vector<std::string> texts;
   for (const auto& line : log_.Lines()) texts.push_back(line.text);
-  EXPECT_THAT(texts, ElementsAre(EndsWith(": clientStartDate is nil. clientpid=100 "
+  EXPECT_THAT(texts, ElementsAre(EndsWith(": clientStartDate is nil. clientpid=300 "
                                           "clientprocessname=unknown"),
                                  EndsWith(": InvalidationHandler: connection exited process=(null) "
                                           "uptime_sec=-1"),
-                                 EndsWith(": clientProcessName is nil. clientpid=100")));
+                                 EndsWith(": clientProcessName is nil. clientpid=300")));
   EXPECT_TRUE(h_.env.analytics->Events().empty());
 
   // The listing still runs first (the removal is queued behind it), then the removal.
   h_.Run();
-  EXPECT_TRUE(h_.delegate->clients().empty());
-  EXPECT_EQ(log_.Count(": removing 100 from the server client list"), 1);
-  EXPECT_EQ(log_.Count(": dealloc 100 from the server client list"), 1);
+  EXPECT_EQ(h_.delegate->clients().size(), 2u);  // a_ and b_ only
+  EXPECT_EQ(log_.Count(": removing 300 from the server client list"), 1);
+  EXPECT_EQ(log_.Count(": dealloc 300 from the server client list"), 1);
 }
 
 TEST_F(ServiceTest, InterruptionRemovesTheClientInvalidationOnlyReports) {
-  Client a = h_.Connect(100, "player");
+  Client a = h_.Connect(300, "player");
   h_.Create(a, 42, std::nullopt, true);
   auto session = a.Session(42);
   a.instance.reset();
@@ -247,29 +239,27 @@ TEST_F(ServiceTest, InterruptionRemovesTheClientInvalidationOnlyReports) {
   a.connection->Interrupt();
   EXPECT_EQ(log_.Count(": InterruptionHandler: connection exited"), 1);
   h_.Run();
-  EXPECT_TRUE(h_.delegate->clients().empty());
+  EXPECT_EQ(h_.delegate->clients().size(), 2u);  // a_ and b_ only
   EXPECT_FALSE(session->started());
 
   a.connection->Invalidate();
   h_.Run();
-  EXPECT_EQ(log_.Count(": removing 100 from the server client list"), 1);
+  EXPECT_EQ(log_.Count(": removing 300 from the server client list"), 1);
   EXPECT_EQ(h_.env.analytics->EventsNamed(kUptimeEvent).size(), 1u);
 }
 
 // --- Defaults and the reporting switch -----------------------------------------------------
 
 TEST_F(ServiceTest, ANotificationReReadsTheSuiteAndPushesItToEverySession) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  h_.Create(a, 1);
-  h_.Create(b, 2, std::nullopt, true);
+  h_.Create(a_, 1);
+  h_.Create(b_, 2, std::nullopt, true);
   h_.env.defaults->Set(kSuite, "device_name", "kitchen");
   h_.PostDefaults();
   auto defaults = h_.delegate->getDefaults();
   ASSERT_TRUE(defaults);
   EXPECT_EQ(*defaults, (Dictionary{{"device_name", "kitchen"}, {"disable_reporting", 0}}));
   EXPECT_TRUE(h_.delegate->isReportingEnabled());
-  for (auto session : {a.Session(1), b.Session(2)}) {
+  for (auto session : {a_.Session(1), b_.Session(2)}) {
     EXPECT_EQ(*session->userInfo()->Find("device_name"), Value("kitchen"));
   }
   EXPECT_EQ(log_.Count(": re-reading quenta defaults"), 1);
@@ -283,15 +273,13 @@ TEST_F(ServiceTest, ANotificationReReadsTheSuiteAndPushesItToEverySession) {
 }
 
 TEST_F(ServiceTest, DisabledReportingRefusesSendsHidesOthers) {
-  Client a = h_.Connect(100);
-  Client b = h_.Connect(200);
-  h_.Create(a, 42, std::nullopt, true);
+  h_.Create(a_, 42, std::nullopt, true);
   h_.env.defaults->Set(kSuite, "disable_reporting", "YES");
   h_.PostDefaults();
   EXPECT_FALSE(h_.delegate->isReportingEnabled());
   for (auto ids : {std::optional<std::vector<std::int64_t>>{{42}},
                    std::optional<std::vector<std::int64_t>>{}}) {
-    auto error = h_.Send(a, {{"EngineOnTime", 1}}, 1, 6, ids);
+    auto error = h_.Send(a_, {{"EngineOnTime", 1}}, 1, 6, ids);
     ASSERT_TRUE(error);
     EXPECT_EQ(error->domain, "com.norvel.audio.reporting");
     EXPECT_EQ(error->code, 1);
@@ -304,8 +292,8 @@ TEST_F(ServiceTest, DisabledReportingRefusesSendsHidesOthers) {
   // Cross-client lookups find nothing, even for the caller's own ID; own lookups still work.
   EXPECT_FALSE(h_.delegate->findReportingSessionForID(42));
   Replies<Dictionary> valid;
-  b->reporterIDValid(42, valid.Callback());
-  a->reporterIDValid(42, valid.Callback());
+  b_->reporterIDValid(42, valid.Callback());
+  a_->reporterIDValid(42, valid.Callback());
   h_.Run();
   EXPECT_THAT(valid.all(), ElementsAre(Dictionary{{"reporterID", 0}, {"serviceType", 65535}},
                                        Dictionary{{"reporterID", 42}, {"serviceType", 65535}}));
@@ -314,7 +302,7 @@ TEST_F(ServiceTest, DisabledReportingRefusesSendsHidesOthers) {
   h_.env.defaults->Remove(kSuite, "disable_reporting");
   h_.PostDefaults();
   EXPECT_TRUE(h_.delegate->isReportingEnabled());
-  EXPECT_FALSE(h_.Send(a, {{"EngineOnTime", 1}}, 1, 6, std::vector<std::int64_t>{42}));
+  EXPECT_FALSE(h_.Send(a_, {{"EngineOnTime", 1}}, 1, 6, std::vector<std::int64_t>{42}));
   EXPECT_EQ(h_.env.enerdex->Events().size(), 1u);
 }
 
@@ -408,7 +396,9 @@ std::string Key(const Dictionary& payload, std::int64_t id = 1, std::uint32_t ca
   return Throttle::buildMessageKey(payload, id, category, type);
 }
 
-TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValues) {
+// The key: payload parts in key order, masked values as "^", then reporter, category, type;
+// then pairs of messages that are (not) duplicates.
+TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValuesAndDuplicates) {
   const std::vector<std::pair<std::string, std::string>> cases = {
       {Throttle::buildMessageKey(Dictionary{{"b", 2}, {"a", "x"}, {"systemuptime_sec", 812}}, 42, 5,
                                  1),
@@ -424,14 +414,7 @@ TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValues) {
       {Key(Dictionary{{"Volume", 0.5}, {"VolumeOperationTime", 3}, {"_throttle_seconds", 1}}),
        "Volume|^|VolumeOperationTime|^|_throttle_seconds|^|reporterID|1|Setup|Start"}};
   for (const auto& [key, expected] : cases) EXPECT_EQ(key, expected);
-}
-
-TEST(MessageKeyTest, DuplicatesAndDistinctMessages) {
-  struct Case {
-    std::string a, b;
-    bool duplicates;
-  };
-  const Case cases[] = {
+  const std::tuple<std::string, std::string, bool> pairs[] = {
       {Key(Dictionary{{"x", 1}, {"qnreporting_timestamp", 1}}),
        Key(Dictionary{{"x", 1}, {"qnreporting_timestamp", 2}}), true},
       {Key(Dictionary{{"Volume", 0.3}, {"VolumeOperationTime", 1}}),
@@ -441,33 +424,27 @@ TEST(MessageKeyTest, DuplicatesAndDistinctMessages) {
       {Key(Dictionary{}, 1, 12), Key(Dictionary{}, 1, 13), true},  // both "Undefined"
       {Key(Dictionary{}, 1, 5, 6), Key(Dictionary{}, 1, 5, 65534), true},
       {Key(Dictionary{}, 1), Key(Dictionary{}, 2), false}};
-  for (const Case& c : cases) EXPECT_EQ(c.a == c.b, c.duplicates) << c.a << " / " << c.b;
+  for (const auto& [x, y, same] : pairs) EXPECT_EQ(x == y, same) << x << " / " << y;
 }
 
 TEST(ThrottleTimeTest, AcceptsIntegerPartUpToFourElseHalfASecondWithAnInfoLine) {
-  struct Case {
-    std::optional<Value> time;
-    double seconds;
-    std::string line;  // the info line's text after the prefix, or "" for none
-  };
-  const Case cases[] = {
+  // Each row: the payload's time (if any), the seconds, the info line's end ("" for none).
+  const std::tuple<std::optional<Value>, double, std::string> cases[] = {
       {std::nullopt, 0.5, ""},
       {Value(4.99), static_cast<double>(4.99f), ""},
       {Value(-1), -1.0, ""},
       {Value(0), 0.0, ""},
       {Value(5), 0.5, ": Rejecting large throttle time. {time=5, max=5.000000}"},
       {Value("2"), 0.5, ": Rejecting non Valbox value of throttle time. {time=2}"}};
-  for (const Case& c : cases) {
+  for (const auto& [time, seconds, line] : cases) {
     LogCapture log;
     Dictionary payload;
-    if (c.time) payload.Set("_throttle_seconds", *c.time);
-    EXPECT_EQ(Throttle::determineSleepTime(payload, log), c.seconds);
+    if (time) payload.Set("_throttle_seconds", *time);
+    EXPECT_EQ(Throttle::determineSleepTime(payload, log), seconds);
     const auto lines = log.Lines();
-    ASSERT_EQ(lines.size(), c.line.empty() ? 0u : 1u);
-    if (!c.line.empty()) {
-      EXPECT_EQ(lines[0].level, LogLevel::kInfo);
-      EXPECT_THAT(lines[0].text, EndsWith(c.line));
-    }
+    ASSERT_EQ(lines.size(), line.empty() ? 0u : 1u);
+    for (const auto& l : lines)
+      EXPECT_TRUE(l.level == LogLevel::kInfo && l.text.ends_with(line)) << l.text;
   }
 }
 
