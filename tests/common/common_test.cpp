@@ -366,9 +366,7 @@ TEST(JsonTest, StrictRejectsWhatJsonCannotHoldAndSaysWhere) {
                 "JSON cannot hold a string that is not valid UTF-8 (at s)"},
                {Value(Dictionary{{"\xc0\xaf", 1}}),
                 "JSON cannot hold a string that is not valid UTF-8 (at the top level)"}};
-  for (const auto& c : cases) {
-    EXPECT_EQ(StrictError(c.value).description, c.description);
-  }
+  for (const auto& c : cases) EXPECT_EQ(StrictError(c.value).description, c.description);
 }
 
 TEST(JsonTest, LenientWritesEverything) {

@@ -203,9 +203,8 @@ std::vector<std::string> NamesIn(const std::string& dir) {
 std::vector<ReportingStoreRow> RowsOf(const std::vector<ReportingStoreRow>& rows,
                                       ReportingStoreRow::Table table) {
   std::vector<ReportingStoreRow> out;
-  for (const auto& row : rows) {
+  for (const auto& row : rows)
     if (row.table == table) out.push_back(row);
-  }
   return out;
 }
 

@@ -11,7 +11,6 @@
 #include <string>
 #include <vector>
 
-#include "common/Frame.h"
 #include "common/Value.h"
 #include "platform/linux/reporting_store_reader.h"
 #include "qnreporting/Client.h"
@@ -47,7 +46,6 @@ class ChildProcess {
   // Kills the process (SIGKILL) if it still runs.
   ~ChildProcess();
 
-  pid_t pid() const { return pid_; }
   bool running();
   void Signal(int signal) const;
   // Waits for the process to end, at most `timeout`; nullopt when it did not.
@@ -104,10 +102,10 @@ class Daemon {
   bool started_ = false;
 };
 
-// The daemon on `home`, with `args`.
+// The daemon on `home`, with `args`, listening on a socket named by --socket.
 inline std::unique_ptr<Daemon> StartOn(const testing::TempDir& home,
                                        std::vector<std::string> args) {
-  return std::make_unique<Daemon>(std::move(args), std::nullopt, -1, home.path());
+  return std::make_unique<Daemon>(std::move(args), home.File("qn.sock"), -1, home.path());
 }
 // The names in `dir`, sorted.
 std::vector<std::string> NamesIn(const std::string& dir);

@@ -79,9 +79,8 @@ class FakeDispatcher final : public Dispatcher {
     std::vector<std::shared_ptr<ConditionState>> live;
     {
       std::lock_guard g(mu_);
-      for (auto& w : conditions_) {
+      for (auto& w : conditions_)
         if (auto s = w.lock()) live.push_back(std::move(s));
-      }
     }
     for (auto& s : live) {
       std::lock_guard user(s->lock);

@@ -138,7 +138,7 @@ class FakeLivoReporting final : public LivoReporting {
                      std::optional<Error>*) override {
       std::lock_guard lock(s_->mu);
       s_->sessions[index_].messages.push_back({category, type, payload});
-      s_->session_messages.push_back({category, type, payload});
+      s_->session_messages.push_back(s_->sessions[index_].messages.back());
       return true;
     }
     void FlushMessages(FlushHandler handler) override {

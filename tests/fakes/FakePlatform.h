@@ -162,8 +162,6 @@ class FakeNotify final : public Notify {
 
  private:
   struct Registration {
-    Registration(std::string n, std::shared_ptr<SerialQueue> q, std::function<void(int)> h, int t)
-        : name(std::move(n)), queue(std::move(q)), handler(std::move(h)), token(t) {}
     std::string name;
     std::shared_ptr<SerialQueue> queue;
     std::function<void(int)> handler;

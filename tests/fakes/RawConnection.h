@@ -65,9 +65,8 @@ class RawConnection {
   std::optional<Value> ReadFrame(std::chrono::milliseconds timeout = std::chrono::seconds(30)) {
     const auto deadline = Clock::now() + timeout;
     bool closed = false;
-    while (pending_.empty()) {
+    while (pending_.empty())
       if (!Receive(deadline, &closed)) return std::nullopt;
-    }
     Value frame = std::move(pending_.front());
     pending_.pop_front();
     return frame;

@@ -30,24 +30,6 @@ class CommandLineTest : public ::testing::Test {
     EXPECT_FALSE(ParseJson(out_.str(), value).has_value()) << out_.str();
     return value;
   }
-  // A store with one stopped framework session (number 1), a single message, a power-log row.
-  void FillStore() {
-    std::filesystem::create_directories(paths().state_dir);
-    std::optional<Error> error;
-    auto store = ReportingStore::Open(paths().state_dir + "/reports.db", nullptr, &error);
-    ASSERT_TRUE(store);
-    const std::int64_t id = store->NewSessionId();
-    store->AddSession(id, Value(Dictionary{{"SessionID", 42}}),
-                      Value(Dictionary{{"ServiceName", "alarm_session"}}));
-    for (int type : {1, 1, 2})
-      store->AddSessionMessage(id, 5, type, Value(Dictionary{{"a", type}}));
-    store->AddSessionMessage(id, 0xFFFF, 0xFFFF, Value(Dictionary{{"a", "1,1,2"}}));
-    store->MarkSessionFlushed(id, nullptr);
-    store->AddSingleMessage(Value(Dictionary{}), Value(Dictionary{}), 5, 1,
-                            Value(Dictionary{{"route", "speaker"}}));
-    store->AddPowerLogEvent(28, "Vistrel_Haptics", Value(Dictionary{{"EngineOnDuration", 2}}));
-    store->Drain();
-  }
   Paths paths() const { return ResolvePaths(PathOptions{home_.path(), std::nullopt}); }
 
   testing::TempDir home_;
@@ -76,7 +58,9 @@ TEST_F(CommandLineTest, UsageErrorsExitTwoAndSayWhatIsWrong) {
   EXPECT_NE(out_.str().find("--follow"), std::string::npos);
 }
 
-TEST_F(CommandLineTest, DefaultsWriteReadsBackJsonOrPlainStringAndDeletes) {
+// defaults: values as JSON or plain strings, read back and deleted; notify post touches the
+// notification file (when anyone ever watched).
+TEST_F(CommandLineTest, DefaultsAndNotify) {
   EXPECT_EQ(Run({"defaults", "write", "disable_reporting", "YES"}), 0) << err_.str();
   EXPECT_EQ(Run({"defaults", "write", "device_name", "\"lab phone\""}), 0);
   EXPECT_EQ(Run({"defaults", "write", "level", "3"}), 0);
@@ -88,9 +72,7 @@ TEST_F(CommandLineTest, DefaultsWriteReadsBackJsonOrPlainStringAndDeletes) {
   EXPECT_EQ(Run({"defaults", "delete", "never_there"}), 0);
   ASSERT_EQ(Run({"defaults", "read"}), 0);
   EXPECT_FALSE(JsonOut().as_dictionary()->Contains("disable_reporting"));
-}
 
-TEST_F(CommandLineTest, NotifyPostTouchesTheNotificationFile) {
   const std::string file = paths().runtime_dir + "/notify/com.norvel.quenta.reporting";
   // Nobody has ever watched: nobody to tell, and nothing is created.
   EXPECT_EQ(Run({"notify", "post", "com.norvel.quenta.reporting"}), 0) << err_.str();
@@ -101,10 +83,25 @@ TEST_F(CommandLineTest, NotifyPostTouchesTheNotificationFile) {
   EXPECT_EQ(Run({"notify", "post", "../escape"}), 1);  // would leave the notification folder
 }
 
-TEST_F(CommandLineTest, EventsFiltersBySinkSessionAndTime) {
+// events filtered by sink, session and time; session tells one session's story.
+TEST_F(CommandLineTest, EventsAndSession) {
   EXPECT_EQ(Run({"events"}), 1);
   EXPECT_NE(err_.str().find("reports.db"), std::string::npos);
-  FillStore();
+  // A store with one stopped framework session (number 1), a single message, a power-log row.
+  std::filesystem::create_directories(paths().state_dir);
+  std::optional<Error> error;
+  auto store = ReportingStore::Open(paths().state_dir + "/reports.db", nullptr, &error);
+  ASSERT_TRUE(store);
+  const std::int64_t id = store->NewSessionId();
+  store->AddSession(id, Value(Dictionary{{"SessionID", 42}}),
+                    Value(Dictionary{{"ServiceName", "alarm_session"}}));
+  for (int type : {1, 1, 2}) store->AddSessionMessage(id, 5, type, Value(Dictionary{{"a", type}}));
+  store->AddSessionMessage(id, 0xFFFF, 0xFFFF, Value(Dictionary{{"a", "1,1,2"}}));
+  store->MarkSessionFlushed(id, nullptr);
+  store->AddSingleMessage(Value(Dictionary{}), Value(Dictionary{}), 5, 1,
+                          Value(Dictionary{{"route", "speaker"}}));
+  store->AddPowerLogEvent(28, "Vistrel_Haptics", Value(Dictionary{{"EngineOnDuration", 2}}));
+  store->Drain();
 
   ASSERT_EQ(Run({"events"}), 0) << err_.str();
   EXPECT_NE(out_.str().find("reporting  single   5 Setup             1 Start         "
@@ -130,10 +127,7 @@ TEST_F(CommandLineTest, EventsFiltersBySinkSessionAndTime) {
     EXPECT_EQ(std::count(text.begin(), text.end(), '\n'), rows)
         << ::testing::PrintToString(args) << out_.str();
   }
-}
 
-TEST_F(CommandLineTest, SessionTellsStartStopCountsAndSummary) {
-  FillStore();
   ASSERT_EQ(Run({"session", "1"}), 0) << err_.str();
   const std::string story = out_.str();
   for (const char* line : {"Session 1: reporter 42, alarm_session, unknown\n", "  messages  4\n",

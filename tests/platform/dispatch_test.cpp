@@ -33,8 +33,6 @@ struct LinuxHarness {
   }
   // Gives work that could wrongly run a chance to do so, before a negative check.
   void RunPending() { std::this_thread::sleep_for(milliseconds(50)); }
-  // Lets `d` of dispatcher time pass.
-  void Advance(Duration d) { std::this_thread::sleep_for(d); }
 };
 
 // Drives the test double: tasks run on the test's thread when it runs them, and time
@@ -53,7 +51,6 @@ struct FakeHarness {
     return false;
   }
   void RunPending() { fake->RunUntilIdle(); }
-  void Advance(Duration d) { fake->AdvanceBy(d); }
 };
 
 template <typename Harness>
@@ -137,29 +134,6 @@ TYPED_TEST(DispatchContractTest, SuspensionsCountAndATaskCanSuspendItsOwnQueue) 
   ASSERT_TRUE(this->h_.RunUntil([&] { return recorded() == 3; }));
   EXPECT_EQ(order, (std::vector<std::string>{"first", "resume", "second"}));
   EXPECT_FALSE(queue->IsCurrent());
-  EXPECT_EQ(queue->label(), "self");
-}
-
-TYPED_TEST(DispatchContractTest, AsyncAfterRunsInDeadlineOrder) {
-  auto queue = this->dispatcher().CreateSerialQueue("later", QualityOfService::kUtility);
-  std::mutex mu;
-  std::vector<char> order;
-  auto record = [&](char c) {
-    return [&, c] {
-      std::lock_guard lock(mu);
-      order.push_back(c);
-    };
-  };
-  queue->AsyncAfter(milliseconds(300), record('c'));
-  queue->AsyncAfter(milliseconds(150), record('b'));
-  queue->Async(record('a'));
-  this->h_.Advance(milliseconds(150));
-  this->h_.Advance(milliseconds(150));
-  ASSERT_TRUE(this->h_.RunUntil([&] {
-    std::lock_guard lock(mu);
-    return order.size() == 3;
-  }));
-  EXPECT_EQ(order, (std::vector<char>{'a', 'b', 'c'}));
 }
 
 TYPED_TEST(DispatchContractTest, TasksQueuedWhenTheLastReferenceGoesStillRun) {

@@ -41,7 +41,8 @@ class ServiceTest : public ::testing::Test {
   Client b_ = h_.Connect(200);
 };
 
-TEST_F(ServiceTest, SetServiceTypeTouchesOnlyTheCallersOwnSessions) {
+// setServiceType touches only the caller's own sessions; the name lookup finds any client's.
+TEST_F(ServiceTest, SetServiceTypeIsOwnSessionsOnlyGetServiceNameSearchesAll) {
   h_.Create(a_, 42);
   BoolReplies r;
   b_->setServiceType(2, 42, r.Callback());
@@ -55,16 +56,15 @@ TEST_F(ServiceTest, SetServiceTypeTouchesOnlyTheCallersOwnSessions) {
   EXPECT_THAT(r.all(), ElementsAre(true, true, true));
   EXPECT_EQ(a_.Session(42)->serviceName(), "longformaudio");
   EXPECT_EQ(log_.Count(": service type 7 set for reporter  42"), 1);
-}
 
-TEST_F(ServiceTest, GetServiceNameSearchOrderAndZero) {
-  h_.Create(a_, 42, 2);
-  Replies<std::uint16_t> r;
-  b_->getServiceNameForReporterID(42, r.Callback());
-  b_->getServiceNameForReporterID(43, r.Callback());
-  a_->getServiceNameForReporterID(0, r.Callback());
+  // The name lookup searches the clients in order; 0 finds nothing at first.
+  a_->setServiceType(2, 42, r.Callback());
+  Replies<std::uint16_t> names;
+  b_->getServiceNameForReporterID(42, names.Callback());
+  b_->getServiceNameForReporterID(43, names.Callback());
+  a_->getServiceNameForReporterID(0, names.Callback());
   h_.Run();
-  EXPECT_THAT(r.all(), ElementsAre(2, 65535, 65535, 65535));
+  EXPECT_THAT(names.all(), ElementsAre(2, 65535, 65535, 65535));
   EXPECT_EQ(log_.Count(": returnning service type 2 for reporter  42"), 1);
 
   h_.Create(a_, 0);  // a session under ID 0 is allowed, and found by the second answer

@@ -119,6 +119,7 @@ TEST_F(SummaryTest, InternalBuildWritesPrettyJsonWithUserInfoFirstInsideItsFolde
   // A host application name cannot lead out of the folder.
   OneMessageSession(0, {{"HostApplicationDisplayID", "../../escape"}});
   files = SummaryFiles();
+  EXPECT_EQ(t_.device_info->Asked("InternalBuild"), 1);  // asked once, then kept
   ASSERT_EQ(files.size(), 2u);
   EXPECT_TRUE(files[0].filename().string().ends_with("-quenta-.._.._escape-generic.json") ||
               files[1].filename().string().ends_with("-quenta-.._.._escape-generic.json"));

@@ -1,10 +1,9 @@
 // One session on fakes: identifiers, service types, the framework session's start with its
 // backends wait, delivery (through the framework session or as single messages), stop; and
-// the shared helpers (internal-build flag, bounded wait).
+// the bounded wait.
 #include <algorithm>
 #include <chrono>
 #include <regex>
-#include <thread>
 
 #include "Statistics/QNReportingUtility.h"
 #include "tests/service/ServiceHarness.h"
@@ -70,7 +69,7 @@ TEST_F(SessionTest, TestServiceTypeNeverGetsAFrameworkSessionNorSendsAnything) {
 
 // The wait for backends: 9 s, then the error lines, and queued deliveries dropped; a late
 // answer changes nothing; an answer of no backends is logged and waits out the 9 s too.
-TEST_F(SessionTest, BackendsNeverFoundHoldsDeliveriesThenDropsThem) {
+TEST_F(SessionTest, TheWaitForBackendsHoldsDeliveries) {
   t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kNever);
   auto session = NewSession();
   session->start();
@@ -111,23 +110,22 @@ TEST_F(SessionTest, BackendsNeverFoundHoldsDeliveriesThenDropsThem) {
   t_.dispatcher->AdvanceBy(9s);
   EXPECT_EQ(t_.log->Count("failed to find backend"), 2);
   EXPECT_FALSE(none->livoReportingSession());
-}
 
-TEST_F(SessionTest, LateBackendsReleaseQueuedDeliveries) {
+  // Backends found late release the queued deliveries; later ones do not wait.
   t_.livo->SetDiscovery(FakeLivoReporting::Discovery::kLate, 2s);
-  auto session = NewSession();
-  session->start();
-  session->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
+  auto late = NewSession(44);
+  late->start();
+  late->sendMessage(Payload({{"n", 1}}), 3, 1, nullptr);
   t_.dispatcher->AdvanceBy(1999ms);
   EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
   t_.dispatcher->AdvanceBy(1ms);
   ASSERT_EQ(t_.livo->AllSessionMessages().size(), 1u);
   EXPECT_EQ(t_.log->Count(": continuing"), 1);
-  session->sendMessage(Payload({{"n", 2}}), 3, 1, nullptr);  // no waiting any more
+  late->sendMessage(Payload({{"n", 2}}), 3, 1, nullptr);  // no waiting any more
   t_.dispatcher->RunUntilIdle();
   EXPECT_EQ(t_.livo->AllSessionMessages().size(), 2u);
   t_.dispatcher->AdvanceBy(20s);
-  EXPECT_FALSE(t_.log->Contains("failed to find backend"));
+  EXPECT_EQ(t_.log->Count("failed to find backend"), 2);
 }
 
 TEST_F(SessionTest, StopFlushesDropsAndClearsAndLogsAFlushError) {
@@ -276,20 +274,6 @@ TEST_F(SessionTest, AlarmSingleMessagesWaitTheirRandomDelay) {
     EXPECT_EQ(t_.livo->SingleMessages().size(), before + 1);
   }
   EXPECT_GT(longest, 0) << "the alarm delay was 0 in every round";
-}
-
-TEST_F(SessionTest, InternalBuildAskedOnceEvenWhenRacing) {
-  t_.device_info->SetAnswer("InternalBuild", true);
-  std::vector<std::thread> threads;
-  std::atomic<int> yes{0};
-  for (int i = 0; i < 8; ++i) {
-    threads.emplace_back([&] { yes += QNReportingIsInternalBuild(*t_.platform); });
-  }
-  for (auto& th : threads) th.join();
-  EXPECT_EQ(yes.load(), 8);
-  t_.device_info->SetAnswer("InternalBuild", false);  // later changes are not seen
-  EXPECT_TRUE(QNReportingIsInternalBuild(*t_.platform));
-  EXPECT_EQ(t_.device_info->Asked("InternalBuild"), 1);
 }
 
 // A wake-up without the flag set waits a full new period; the first deadline no longer

@@ -57,7 +57,7 @@ using ReportingStoreTest = testing::StoreTest;
 // The database may not grow: a batch that needs a new page fails (its flush gets the
 // error), the state is logged once however many batches fail, and writing resumes when
 // there is room, with one line saying how much was lost meanwhile.
-TEST_F(ReportingStoreTest, AFullDatabaseIsLoggedOnceCountedAndWrittenAgainWhenThereIsRoom) {
+TEST_F(ReportingStoreTest, AFullDatabaseIsLoggedOnceAndWrittenAgainWhenThereIsRoom) {
   auto store = OpenStore();
   store->AddPowerLogEvent(1, "before", Value());
   store->Drain();
@@ -308,21 +308,18 @@ class StoreSinksTest : public testing::StoreTest {
   std::shared_ptr<ReportingStore> store_ = OpenStore();
 };
 
-TEST_F(StoreSinksTest, AnalyticsProviderRunsOffTheCallersThread) {
-  auto analytics = NewStoreAnalytics(store_);
+// Analytics providers run on the writer, not the caller's thread. Discovery answers at once
+// while the store is open, however far behind its writer is (a session start must not wait
+// for the disk).
+TEST_F(StoreSinksTest, ProvidersRunOnTheWriterAndDiscoveryAnswersAtOnce) {
   std::thread::id provider_thread;
-  analytics->SendEventLazy("e", [&] {
+  NewStoreAnalytics(store_)->SendEventLazy("e", [&] {
     provider_thread = std::this_thread::get_id();
     return Value();
   });
   store_->Drain();
   EXPECT_NE(provider_thread, std::thread::id());
   EXPECT_NE(provider_thread, std::this_thread::get_id());
-}
-
-// Discovery answers at once while the store is open, however far behind its writer is (a
-// session start must not wait for the disk).
-TEST_F(StoreSinksTest, LivoReportingDiscoveryAnswersAtOnceWhileTheStoreIsOpen) {
   auto session = NewStoreLivoReporting(store_, StoreLivoReportingOptions{std::nullopt})
                      ->CreateSession(Dictionary{}, Dictionary{}, Array{});
   bool answered = false;
@@ -353,7 +350,7 @@ TEST_F(StoreSinksTest, LivoReportingSingleMessagesCarryTheirOwnSessionAndUserInf
   EXPECT_EQ(rows[0].user_info, R"({"ClientName":"com.norvel.quenta","ServiceName":"standalone"})");
 }
 
-TEST_F(StoreSinksTest, LivoReportingClosedStoreRefusesMessagesWithAnErrorAndStillAnswersFlushes) {
+TEST_F(StoreSinksTest, AClosedStoreRefusesMessagesAndStillAnswers) {
   auto livo = NewStoreLivoReporting(store_);
   auto session = livo->CreateSession(Dictionary{}, Dictionary{}, Array{});
   store_->Close();
