@@ -98,8 +98,6 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   ASSERT_TRUE(summary.as_array());
   EXPECT_EQ(summary.as_array()->size(), 5u);  // user info, two messages, drivers, the summary
   EXPECT_EQ(client->destroyReportingSessionSync(42), true);
-  EXPECT_EQ(client->reporterIDValidSync(42),
-            (Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
   client.reset();
   EXPECT_EQ(daemon.Stop(), Exited(0));
 

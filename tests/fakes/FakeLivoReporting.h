@@ -98,7 +98,6 @@ class FakeLivoReporting final : public LivoReporting {
   std::vector<SingleMessage> SingleMessages() const { return Get(&State::singles); }
   // All messages of every framework session.
   std::vector<Message> AllSessionMessages() const { return Get(&State::session_messages); }
-  int TokensMade() const { return static_cast<int>(Get(&State::tokens)); }
 
  private:
   struct State {

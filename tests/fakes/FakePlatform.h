@@ -125,14 +125,12 @@ class FakeDeviceInfo final : public DeviceInfo {
 };
 
 // Post queues each live registration of the name on its queue with its token; Cancel stops
-// later deliveries, queued ones included. Register returns 1 for an empty name, 2 for a
-// missing queue or handler, else the status set by FailRegistrations (0 by default).
+// later deliveries, queued ones included. Register returns the status set by
+// FailRegistrations (0 by default).
 class FakeNotify final : public Notify {
  public:
   std::uint32_t Register(const std::string& name, std::shared_ptr<SerialQueue> queue,
                          std::function<void(int token)> handler, int* token) override {
-    if (name.empty()) return 1;
-    if (!queue || !handler) return 2;
     std::lock_guard lock(mu_);
     if (fail_status_ != 0) return fail_status_;
     auto r = std::make_shared<Registration>(name, std::move(queue), std::move(handler), next_++);
@@ -141,7 +139,6 @@ class FakeNotify final : public Notify {
     return 0;
   }
   std::uint32_t Post(const std::string& name) override {
-    if (name.empty()) return 1;
     std::lock_guard lock(mu_);
     for (const auto& [token, r] : registrations_) {
       if (r->name == name) r->queue->Async([r = r] { r->active ? r->handler(r->token) : void(); });

@@ -141,18 +141,7 @@ TEST_F(CommandLineTest, EventsAndSession) {
   EXPECT_NE(err_.str().find("no session 2"), std::string::npos);
 }
 
-TEST(TimeArgumentTest, ReadsRelativeAbsoluteAndEpochTimes) {
-  const double now = 1'800'000'000;
-  EXPECT_EQ(ParseTimeArgument("-90s", now), now - 90);
-  EXPECT_EQ(ParseTimeArgument("-2h", now), now - 7200);
-  EXPECT_EQ(ParseTimeArgument("1700000000.5", now), 1700000000.5);
-  EXPECT_TRUE(ParseTimeArgument("2026-11-21 13:05", now));
-  for (const char* bad : {"", "-", "-5y", "yesterdayish", "2026-13-45 99:99"}) {
-    EXPECT_FALSE(ParseTimeArgument(bad, now)) << bad;
-  }
-}
-
-TEST(QnreportParseTest, BadLinesSayWhatIsWrong) {
+TEST(QnreportParseTest, BadLinesAndTimes) {
   const std::pair<const char*, const char*> cases[] = {
       {"frobnicate 1", "unknown command \"frobnicate\""},
       {"create", "missing reporter ID"},
@@ -171,6 +160,15 @@ TEST(QnreportParseTest, BadLinesSayWhatIsWrong) {
     auto* text = std::get_if<std::string>(&result);
     ASSERT_TRUE(text) << line << " was accepted";
     EXPECT_NE(text->find(problem), std::string::npos) << line << ": " << *text;
+  }
+  // Times for events --since.
+  const double now = 1'800'000'000;
+  EXPECT_EQ(ParseTimeArgument("-90s", now), now - 90);
+  EXPECT_EQ(ParseTimeArgument("-2h", now), now - 7200);
+  EXPECT_EQ(ParseTimeArgument("1700000000.5", now), 1700000000.5);
+  EXPECT_TRUE(ParseTimeArgument("2026-11-21 13:05", now));
+  for (const char* bad : {"", "-", "-5y", "yesterdayish", "2026-13-45 99:99"}) {
+    EXPECT_FALSE(ParseTimeArgument(bad, now)) << bad;
   }
 }
 

@@ -91,25 +91,6 @@ TEST(LinuxIpcTest, EachConnectionIsInvalidatedOnceWhenItEndsOrTheListenerStops) 
   EXPECT_EQ(a->createReportingSession(2, nullptr), 0u);
 }
 
-TEST(LinuxIpcTest, ClientLibraryReportsTheConnectionErrorFrame) {
-  ListenerHarness harness;
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-  std::mutex mu;
-  std::vector<client::ConnectionError> errors;
-  client->SetConnectionErrorHandler([&](const client::ConnectionError& error) {
-    std::lock_guard lock(mu);
-    errors.push_back(error);
-  });
-  client->SendRequest(static_cast<Op>(40), {}, nullptr);
-  EXPECT_TRUE(client->WaitUntilEnded());
-  std::lock_guard lock(mu);
-  ASSERT_EQ(errors.size(), 1u);
-  EXPECT_EQ(errors[0].domain, protocol::kIpcErrorDomain);
-  EXPECT_EQ(errors[0].code, static_cast<std::int64_t>(ConnectionError::kUnknownOp));
-  EXPECT_NE(errors[0].message.find("40"), std::string::npos) << errors[0].message;
-}
-
 TEST(LinuxIpcTest, AcceptRecoversWhenDescriptorsRunOut) {
 #if defined(__SANITIZE_ADDRESS__)
   // UBSan's vptr check probes memory through a pipe of its own; with every descriptor in
@@ -239,19 +220,27 @@ TEST(LinuxIpcListenerSetupTest, StaleSocketsAreReplacedOtherFilesRefused) {
   EXPECT_TRUE(S_ISREG(info.st_mode));
 }
 
-TEST(ClientTest, WrongResultTypeEndsTheConnectionWithALocalError) {
+// The service's connection error frame reaches the client's handler; a reply of the wrong
+// type ends the connection with a local error, its callback never called.
+TEST(ClientTest, ErrorFramesAndBadRepliesEndTheConnectionWithTheirError) {
   ListenerHarness harness([](Op, const Array&, IpcReply reply) { reply(Value("yes")); });
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-  std::promise<client::ConnectionError> error;
-  client->SetConnectionErrorHandler([&](const client::ConnectionError& e) { error.set_value(e); });
-  bool called = false;
-  client->createReportingSession(1, [&](bool) { called = true; });
-  EXPECT_TRUE(client->WaitUntilEnded());
-  auto e = error.get_future().get();
-  EXPECT_EQ(e.domain, client::kClientErrorDomain);
-  EXPECT_EQ(e.code, static_cast<std::int64_t>(client::ClientErrorCode::kBadReply));
-  EXPECT_FALSE(called);
+  for (const bool bad_reply : {false, true}) {
+    auto client = Connect(harness.socket_path());
+    ASSERT_TRUE(client);
+    std::promise<client::ConnectionError> error;  // a second error would throw
+    client->SetConnectionErrorHandler(
+        [&](const client::ConnectionError& e) { error.set_value(e); });
+    bool called = false;
+    if (bad_reply) client->createReportingSession(1, [&](bool) { called = true; });
+    if (!bad_reply) client->SendRequest(static_cast<Op>(40), {}, nullptr);
+    EXPECT_TRUE(client->WaitUntilEnded());
+    const auto e = error.get_future().get();
+    EXPECT_EQ(e.domain, bad_reply ? client::kClientErrorDomain : protocol::kIpcErrorDomain);
+    EXPECT_EQ(e.code, bad_reply ? static_cast<std::int64_t>(client::ClientErrorCode::kBadReply)
+                                : static_cast<std::int64_t>(ConnectionError::kUnknownOp));
+    EXPECT_TRUE(bad_reply || e.message.find("40") != std::string::npos) << e.message;
+    EXPECT_FALSE(called);
+  }
 }
 
 TEST(ClientTest, PendingCallbacksAreDroppedWhenTheConnectionEnds) {

@@ -190,14 +190,6 @@ TEST_F(SummaryTest, ChangesFiledInSecondsUnregisteredAtStop) {
                    "time=2, id=\"QNReportingService 42\""),
           HasSubstr("time=2.001,")));
 
-  // The entries reach the summary under their four keys, in the order of the changes.
-  auto summary = session->createSummaryEventForSession();
-  ASSERT_TRUE(summary);
-  EXPECT_EQ(*summary->Find("device_orientation"), Value("LandscapeLeft,LandscapeRight"));
-  EXPECT_EQ(*summary->Find("device_orientation_time"), Value("1.234,2.001"));
-  EXPECT_EQ(*summary->Find("ui_orientation"), Value("Portrait"));
-  EXPECT_EQ(*summary->Find("ui_orientation_time"), Value("2"));
-
   session->stop();
   EXPECT_FALSE(session->orientationCallbackID());
   EXPECT_THAT(t_.orientation->Events(), ElementsAre("register device QNReportingService 42",

@@ -8,6 +8,7 @@
 
 #include <atomic>
 #include <condition_variable>
+#include <fstream>
 #include <future>
 #include <mutex>
 #include <thread>
@@ -197,29 +198,18 @@ TEST_F(ReportingStoreTest, AfterCloseRecordsAreRefusedCallbacksStillRun) {
 }
 
 TEST_F(ReportingStoreTest, OpenRefusesNewerSchemasAndNonDatabases) {
-  {
-    sqlite3* db = nullptr;
-    ASSERT_EQ(sqlite3_open(db_path_.c_str(), &db), SQLITE_OK);
-    sqlite3_exec(db, "PRAGMA user_version = 99", nullptr, nullptr, nullptr);
-    sqlite3_close(db);
+  sqlite3* db = nullptr;
+  ASSERT_EQ(sqlite3_open(db_path_.c_str(), &db), SQLITE_OK);
+  sqlite3_exec(db, "PRAGMA user_version = 99", nullptr, nullptr, nullptr);
+  sqlite3_close(db);
+  std::ofstream(dir_.File("junk.db")) << "this is not a database, not even close to one, but long";
+  for (const std::string& path : {db_path_, dir_.File("junk.db"), dir_.File("no/dir/reports.db")}) {
+    std::optional<Error> error;
+    EXPECT_FALSE(ReportingStore::Open(path, log_, &error)) << path;
+    const std::string text = error.value_or(Error{}).description;
+    EXPECT_TRUE(error && (path != db_path_ || text.find("schema version 99") != std::string::npos))
+        << path << ": " << text;
   }
-  std::optional<Error> error;
-  EXPECT_FALSE(ReportingStore::Open(db_path_, log_, &error));
-  ASSERT_TRUE(error);
-  EXPECT_NE(error->description.find("schema version 99"), std::string::npos);
-
-  const std::string junk = dir_.File("junk.db");
-  FILE* f = fopen(junk.c_str(), "w");
-  ASSERT_TRUE(f);
-  fputs("this is not a database, not even close to one, but long enough to look", f);
-  fclose(f);
-  error.reset();
-  EXPECT_FALSE(ReportingStore::Open(junk, log_, &error));
-  EXPECT_TRUE(error);
-
-  error.reset();
-  EXPECT_FALSE(ReportingStore::Open(dir_.File("no/such/dir/reports.db"), log_, &error));
-  EXPECT_TRUE(error);
 }
 
 // ---- Analytics and power log: one contract, run on the store sinks and on the fakes ----
