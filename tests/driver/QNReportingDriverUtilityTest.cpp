@@ -4,32 +4,22 @@
 
 #include <cerrno>
 
-#include "tests/fakes/FakeOstrel.h"
-#include "tests/fakes/LogCapture.h"
+#include "tests/fakes/FakePlatform.h"
 
 namespace qn {
 namespace {
 
 class DriverUtilityTest : public ::testing::Test {
  protected:
-  DriverUtilityTest() {
-    auto platform = std::make_shared<Platform>();
-    platform->log = log_;
-    platform->ostrel = ostrel_;
-    platform_ = platform;
-  }
-
-  QNReportingDriverUtility Make() { return QNReportingDriverUtility(platform_); }
-
+  QNReportingDriverUtility Make() { return QNReportingDriverUtility(t_.platform); }
   static std::int64_t At(const Dictionary& d, const char* key) {
     const Value* v = d.Find(key);
-    EXPECT_NE(v, nullptr) << key;
     return v ? v->as_int64().value_or(-999) : -999;
   }
 
-  std::shared_ptr<testing::LogCapture> log_ = std::make_shared<testing::LogCapture>();
-  std::shared_ptr<testing::FakeOstrel> ostrel_ = std::make_shared<testing::FakeOstrel>();
-  std::shared_ptr<const Platform> platform_;
+  testing::FakePlatform t_;
+  testing::LogCapture* log_ = t_.log.get();
+  testing::FakeOstrel* ostrel_ = t_.ostrel.get();
 };
 
 TEST_F(DriverUtilityTest, NoDriversSubscribesAndReportsNothing) {

@@ -4,51 +4,44 @@
 #include <poll.h>
 #include <signal.h>
 #include <spawn.h>
-#include <sys/socket.h>
 #include <sys/syscall.h>
-#include <sys/un.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
 #include <gtest/gtest.h>
 
-#include <cerrno>
-#include <cstdlib>
+#include <algorithm>
 #include <cstring>
 #include <filesystem>
 #include <thread>
 
-#include "common/Frame.h"
 #include "common/Json.h"
-#include "common/MsgPack.h"
 #include "tests/store/store_test_util.h"
 
 extern char** environ;
+constexpr const char* kIpcDomain = "com.norvel.quenta.ipc";
 
 namespace qn::e2e {
 
 namespace {
 
-// The parent's environment without the variables through which systemd talks to a service,
-// so that the daemon never mistakes the test's environment for its own.
-std::vector<std::string> ChildEnvironment() {
-  std::vector<std::string> out;
-  for (char** entry = environ; entry && *entry; ++entry) {
-    std::string_view e = *entry;
-    if (e.starts_with("NOTIFY_SOCKET=") || e.starts_with("LISTEN_FDS=") ||
-        e.starts_with("LISTEN_PID=") || e.starts_with("LISTEN_FDNAMES=") ||
-        e.starts_with("JOURNAL_STREAM=")) {
-      continue;
-    }
-    out.emplace_back(e);
-  }
-  return out;
-}
-
+// argv / envp for posix_spawn: the parent's environment without the variables through which
+// systemd talks to a service, so that the daemon never mistakes the test's for its own.
 std::vector<char*> Pointers(std::vector<std::string>& strings) {
   std::vector<char*> out;
   for (auto& s : strings) out.push_back(s.data());
   out.push_back(nullptr);
+  return out;
+}
+std::vector<std::string> ChildEnvironment() {
+  std::vector<std::string> out;
+  for (char** entry = environ; entry && *entry; ++entry) {
+    const std::string e = *entry;
+    const std::string name = e.substr(0, e.find('='));
+    if (name != "NOTIFY_SOCKET" && name != "JOURNAL_STREAM" && !name.starts_with("LISTEN_")) {
+      out.push_back(e);
+    }
+  }
   return out;
 }
 
@@ -110,42 +103,22 @@ ChildProcess::~ChildProcess() {
   if (pidfd_ >= 0) ::close(pidfd_);
 }
 
-bool ChildProcess::running() {
-  if (pid_ <= 0 || status_) return false;
-  int status = 0;
-  if (::waitpid(pid_, &status, WNOHANG) == pid_) {
-    status_ = FromWaitStatus(status);
-    return false;
-  }
-  return true;
-}
+bool ChildProcess::running() { return pid_ > 0 && !Wait(std::chrono::milliseconds(0)); }
 
 void ChildProcess::Signal(int signal) const {
   if (pid_ > 0 && !status_) ::kill(pid_, signal);
 }
 
 std::optional<ExitStatus> ChildProcess::Wait(std::chrono::milliseconds timeout) {
-  if (pid_ <= 0) return std::nullopt;
-  if (status_) return status_;
-  const auto deadline = std::chrono::steady_clock::now() + timeout;
-  for (;;) {
-    int status = 0;
-    pid_t got = ::waitpid(pid_, &status, WNOHANG);
-    if (got == pid_) {
-      status_ = FromWaitStatus(status);
-      return status_;
-    }
-    const auto left = std::chrono::duration_cast<std::chrono::milliseconds>(
-        deadline - std::chrono::steady_clock::now());
-    if (left.count() <= 0) return std::nullopt;
-    if (pidfd_ >= 0) {
-      // The pidfd becomes readable when the process ends.
-      pollfd p{pidfd_, POLLIN, 0};
-      ::poll(&p, 1, static_cast<int>(left.count()));
-    } else {
-      std::this_thread::sleep_for(5ms);
-    }
+  if (pid_ <= 0 || status_) return status_;
+  // The pidfd becomes readable when the process ends.
+  pollfd p{pidfd_, POLLIN, 0};
+  int status = 0;
+  if (::poll(&p, 1, static_cast<int>(timeout.count())) == 1 &&
+      ::waitpid(pid_, &status, 0) == pid_) {
+    status_ = FromWaitStatus(status);
   }
+  return status_;
 }
 
 std::string ChildProcess::Stdout() const { return testing::ReadFileText(stdout_path_); }
@@ -154,8 +127,9 @@ std::string ChildProcess::Stderr() const { return testing::ReadFileText(stderr_p
 // --- Daemon ------------------------------------------------------------------------------
 
 Daemon::Daemon(std::vector<std::string> extra_args, std::optional<std::string> socket,
-               int stderr_fd)
-    : socket_path_(socket.value_or(home_.path() + "/run/reporting.sock")) {
+               int stderr_fd, std::string home_dir)
+    : home_path_(home_dir.empty() ? home_.path() : home_dir),
+      socket_path_(socket.value_or(home_path_ + "/run/reporting.sock")) {
   std::vector<std::string> args{"--home", home()};
   if (socket) args.insert(args.end(), {"--socket", *socket});
   args.insert(args.end(), extra_args.begin(), extra_args.end());
@@ -193,38 +167,54 @@ std::vector<ReportingStoreRow> Daemon::Rows(std::optional<ReportingSink> sink) c
   return testing::ReadRows(db_path(), sink);
 }
 
-bool Daemon::WaitForRows(
-    const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition) {
-  const auto deadline = std::chrono::steady_clock::now() + kPatience;
-  for (;;) {
-    if (condition(Rows())) return true;
+bool Eventually(const std::function<bool()>& condition) {
+  for (const auto deadline = std::chrono::steady_clock::now() + kPatience; !condition();) {
     if (std::chrono::steady_clock::now() > deadline) return false;
     std::this_thread::sleep_for(10ms);
   }
+  return true;
+}
+
+bool Daemon::WaitForRows(
+    const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition) {
+  return Eventually([&] { return condition(Rows()); });
 }
 
 bool Daemon::WaitForStat(std::initializer_list<const char*> path, std::int64_t least) {
-  const auto deadline = std::chrono::steady_clock::now() + kPatience;
-  while (std::chrono::steady_clock::now() < deadline) {
+  return Eventually([&] {
     Value stats = Json(testing::ReadFileText(home() + "/run/stats.json"));
     const Value* at = &stats;
-    for (const char* key : path) {
-      const Dictionary* level = at ? at->as_dictionary() : nullptr;
-      at = level ? level->Find(key) : nullptr;
-    }
-    if (at && at->as_int64().value_or(0) >= least) return true;
-    std::this_thread::sleep_for(50ms);
+    for (const char* key : path)
+      at = at && at->as_dictionary() ? at->as_dictionary()->Find(key) : nullptr;
+    return at && at->as_int64().value_or(0) >= least;
+  });
+}
+
+std::vector<std::string> NamesIn(const std::string& dir) {
+  std::vector<std::string> names;
+  std::error_code ec;
+  for (const auto& entry : std::filesystem::directory_iterator(dir, ec)) {
+    names.push_back(entry.path().filename().string());
   }
-  return false;
+  std::sort(names.begin(), names.end());
+  return names;
 }
 
 std::vector<ReportingStoreRow> RowsOf(const std::vector<ReportingStoreRow>& rows,
                                       ReportingStoreRow::Table table) {
   std::vector<ReportingStoreRow> out;
-  for (const auto& row : rows) {
+  for (const auto& row : rows)
     if (row.table == table) out.push_back(row);
-  }
   return out;
+}
+
+std::int64_t ErrorCode(const Value& frame) {
+  const Array* a = frame.as_array();
+  const Dictionary* body =
+      a && a->size() == 2 && a->front() == Value(0) ? a->back().as_dictionary() : nullptr;
+  const bool ok = body && body->Find("domain") && *body->Find("domain") == Value(kIpcDomain) &&
+                  body->Find("message") && body->Find("message")->is_string();
+  return ok && body->Find("code") ? body->Find("code")->as_int64().value_or(-1) : -1;
 }
 
 Value Json(const std::string& text) {

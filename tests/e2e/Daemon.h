@@ -11,7 +11,6 @@
 #include <string>
 #include <vector>
 
-#include "common/Frame.h"
 #include "common/Value.h"
 #include "platform/linux/reporting_store_reader.h"
 #include "qnreporting/Client.h"
@@ -24,6 +23,10 @@ using namespace std::chrono_literals;
 
 // Generous bounds for things that happen in milliseconds; they only end a hung test.
 inline constexpr std::chrono::milliseconds kPatience = 30s;
+
+// Polls `condition` every 10 ms until it holds (true) or kPatience passes (false), for state
+// with no event to wait on (rows written after a reply, the stats file, a socket file).
+bool Eventually(const std::function<bool()>& condition);
 
 // How a child process ended.
 struct ExitStatus {
@@ -43,7 +46,6 @@ class ChildProcess {
   // Kills the process (SIGKILL) if it still runs.
   ~ChildProcess();
 
-  pid_t pid() const { return pid_; }
   bool running();
   void Signal(int signal) const;
   // Waits for the process to end, at most `timeout`; nullopt when it did not.
@@ -66,10 +68,12 @@ class Daemon {
   // and waits until it accepts connections (by retrying connect; fails the test when it
   // never does or exits). The probe that finds the daemon ready is a client too: it makes
   // one request, so the daemon always lists it, and sends its uptime event when it leaves.
+  // `home`, when given, is a folder of the caller's (files can be placed there first).
   explicit Daemon(std::vector<std::string> extra_args = {},
-                  std::optional<std::string> socket = std::nullopt, int stderr_fd = -1);
+                  std::optional<std::string> socket = std::nullopt, int stderr_fd = -1,
+                  std::string home = "");
 
-  const std::string& home() const { return home_.path(); }
+  const std::string& home() const { return home_path_; }
   const std::string& socket_path() const { return socket_path_; }
   std::string db_path() const { return home() + "/state/reports.db"; }
   ChildProcess& process() { return *process_; }
@@ -92,10 +96,19 @@ class Daemon {
 
  private:
   testing::TempDir home_;
+  std::string home_path_;
   std::string socket_path_;
   std::unique_ptr<ChildProcess> process_;
   bool started_ = false;
 };
+
+// The daemon on `home`, with `args`, listening on a socket named by --socket.
+inline std::unique_ptr<Daemon> StartOn(const testing::TempDir& home,
+                                       std::vector<std::string> args) {
+  return std::make_unique<Daemon>(std::move(args), home.File("qn.sock"), -1, home.path());
+}
+// The names in `dir`, sorted.
+std::vector<std::string> NamesIn(const std::string& dir);
 
 // Whether a sendMessageSync result is a reply without an error.
 inline bool RepliedWithoutError(const std::optional<std::optional<client::ReplyError>>& result) {
@@ -105,6 +118,9 @@ inline bool RepliedWithoutError(const std::optional<std::optional<client::ReplyE
 // The rows of one table.
 std::vector<ReportingStoreRow> RowsOf(const std::vector<ReportingStoreRow>& rows,
                                       ReportingStoreRow::Table table);
+// The code of a connection error frame [0, {"domain": "com.norvel.quenta.ipc", "code": N,
+// "message": text}]; -1 for any other frame.
+std::int64_t ErrorCode(const Value& frame);
 // A row's JSON column parsed into a Value (null when it is not JSON).
 Value Json(const std::string& text);
 // The analytics rows named `name`.

@@ -1,88 +1,21 @@
-// What the daemon was handed survives its exit: summary files, stale temporary files, and
-// every committed row after kill -9.
-#include <gmock/gmock.h>
+// What the daemon was handed survives a kill -9 under load, and the daemon as systemd
+// starts it: socket activation with its readiness notification.
 #include <gtest/gtest.h>
+#include <poll.h>
 #include <sqlite3.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+#include <unistd.h>
 
 #include <algorithm>
-#include <atomic>
 #include <filesystem>
-#include <fstream>
-#include <map>
 #include <set>
-#include <string>
-#include <vector>
 
-#include "common/Files.h"
-#include "common/Json.h"
 #include "tests/e2e/Daemon.h"
 #include "tests/store/store_test_util.h"
 
 namespace qn::e2e {
 namespace {
-
-using ::testing::EndsWith;
-
-// The daemon on a --home of the caller's, so that files can be placed before it starts.
-std::unique_ptr<Daemon> StartOn(const testing::TempDir& home, std::vector<std::string> args) {
-  args.insert(args.begin(), {"--home", home.path()});
-  return std::make_unique<Daemon>(args, home.File("run/reporting.sock"));
-}
-
-// The names in `dir`, sorted.
-std::vector<std::string> NamesIn(const std::string& dir) {
-  std::vector<std::string> names;
-  std::error_code ec;
-  for (const auto& entry : std::filesystem::directory_iterator(dir, ec)) {
-    names.push_back(entry.path().filename().string());
-  }
-  std::sort(names.begin(), names.end());
-  return names;
-}
-
-TEST(DurabilityTest, SummaryFileIsInPlaceWhenTheStopReplyArrivesAndKillServiceKeepsIt) {
-  testing::TempDir home;
-  const std::string dir = home.File("log/DiagnosticLogs/Audio/Reporting");
-  ASSERT_FALSE(CreateDirectories(dir, 0777));
-  // What an earlier run left when it ended between writing and renaming.
-  { std::ofstream(dir + "/.20240101-000000+0000-quenta-unknown-generic.json.tmp-7-0-1f") << "["; }
-  auto daemon = StartOn(home, {"--internal-build"});
-  ASSERT_TRUE(daemon->started());
-  EXPECT_THAT(NamesIn(dir), ::testing::IsEmpty());
-
-  struct Row {
-    std::int64_t id;
-    std::uint16_t serviceType;
-    const char* suffix;
-    bool killAfterReply;
-  };
-  auto client = daemon->Connect();
-  ASSERT_TRUE(client);
-  std::size_t expected = 0;
-  for (const Row& row : {Row{1, 0, "-quenta-unknown-generic.json", false},
-                         Row{2, 13, "-quenta-unknown-telephony.json", true}}) {
-    SCOPED_TRACE(row.suffix);
-    EXPECT_EQ(client->createReportingSessionSync(row.id), true);
-    EXPECT_EQ(client->setServiceTypeSync(row.serviceType, row.id), true);
-    client->startReportingSessionForID(row.id, nullptr);
-    EXPECT_TRUE(RepliedWithoutError(client->sendMessageSync(Value(Dictionary{{"n", row.id}}), 1, 1,
-                                                            std::vector<std::int64_t>{row.id})));
-    ASSERT_EQ(client->stopReportingSessionForIDSync(row.id), true);
-    if (row.killAfterReply) {
-      client->killService();
-      EXPECT_EQ(daemon->process().Wait(), Exited(2));
-    }
-    const auto names = NamesIn(dir);
-    ASSERT_EQ(names.size(), ++expected);
-    const auto file = std::find_if(names.begin(), names.end(),
-                                   [&](const auto& name) { return name.ends_with(row.suffix); });
-    ASSERT_NE(file, names.end());
-    Value content;
-    EXPECT_FALSE(ParseJson(testing::ReadFileText(dir + "/" + *file), content));
-    ASSERT_TRUE(content.as_array());
-    EXPECT_EQ(content.as_array()->size(), 3u);  // userInfo, the message, the summary event
-  }
-}
 
 // The "n" of every message row in the store at `db`.
 std::set<std::int64_t> StoredNumbers(const std::string& db) {
@@ -111,8 +44,7 @@ std::string IntegrityCheck(const std::string& db) {
 }
 
 // kill -9 while pipelined messages pour in: what was committed before stays, the database
-// is intact, and the restarted daemon serves and writes. How much acknowledged work the
-// kill lost (messages, and microseconds before the kill) is recorded as test properties.
+// is intact, and the restarted daemon serves and writes.
 TEST(DurabilityTest, KillNineUnderLoadLosesNoCommittedRowAndTheRestartServes) {
   testing::TempDir home;
   const std::string db = home.File("state/reports.db");
@@ -122,50 +54,25 @@ TEST(DurabilityTest, KillNineUnderLoadLosesNoCommittedRowAndTheRestartServes) {
   ASSERT_TRUE(client);
   ASSERT_EQ(client->createReportingSessionSync(1), true);
   client->startReportingSessionForID(1, nullptr);
-
-  constexpr int kRounds = 12;
-  constexpr int kPerRound = 500;
-  std::map<std::int64_t, std::chrono::steady_clock::time_point> acknowledged;
-  std::mutex mu;
+  constexpr int kRounds = 12, kPerRound = 500;
   std::set<std::int64_t> committed;
-  auto acknowledge = [&](std::int64_t n) {
-    std::lock_guard lock(mu);
-    acknowledged[n] = std::chrono::steady_clock::now();
-  };
   for (std::int64_t n = 0; n < kRounds * kPerRound; ++n) {
     Value message(Dictionary{{"n", n}});
     if ((n + 1) % kPerRound != 0) {
-      client->sendMessage(message, 1, 1, std::vector<std::int64_t>{1},
-                          [&, n](const auto& error) { error ? void() : acknowledge(n); });
+      client->sendMessage(message, 1, 1, std::vector<std::int64_t>{1}, nullptr);
       continue;
     }
     // A round ends with a reply awaited; the replies to the round came before it.
     ASSERT_TRUE(RepliedWithoutError(client->sendMessageSync(message, 1, 1, {{1}})));
-    acknowledge(n);
     if (n + 1 == kRounds * kPerRound / 2) committed = StoredNumbers(db);
   }
   daemon->process().Signal(SIGKILL);
-  const auto killed = std::chrono::steady_clock::now();
   ASSERT_EQ(daemon->process().Wait(), (ExitStatus{false, SIGKILL}));
   client.reset();
-  EXPECT_EQ(acknowledged.size(), static_cast<std::size_t>(kRounds * kPerRound));
   EXPECT_EQ(IntegrityCheck(db), "ok");
   const std::set<std::int64_t> stored = StoredNumbers(db);
   EXPECT_FALSE(committed.empty());
   EXPECT_TRUE(std::includes(stored.begin(), stored.end(), committed.begin(), committed.end()));
-  std::size_t lost = 0;
-  auto oldest_lost = killed;
-  for (const auto& [n, when] : acknowledged) {
-    if (stored.count(n)) continue;
-    ++lost;
-    oldest_lost = std::min(oldest_lost, when);
-  }
-  ::testing::Test::RecordProperty("acknowledged", static_cast<int>(acknowledged.size()));
-  ::testing::Test::RecordProperty("lost_acknowledged", static_cast<int>(lost));
-  ::testing::Test::RecordProperty(
-      "lost_window_us",
-      static_cast<int>(
-          std::chrono::duration_cast<std::chrono::microseconds>(killed - oldest_lost).count()));
 
   auto restarted = StartOn(home, {});
   ASSERT_TRUE(restarted->started());
@@ -182,6 +89,63 @@ TEST(DurabilityTest, KillNineUnderLoadLosesNoCommittedRowAndTheRestartServes) {
   EXPECT_TRUE(final_rows.count(after));
   EXPECT_TRUE(std::includes(final_rows.begin(), final_rows.end(), stored.begin(), stored.end()));
   EXPECT_EQ(IntegrityCheck(db), "ok");
+}
+
+constexpr const char* kActivator = "/usr/bin/systemd-socket-activate";
+
+// A datagram socket bound at `path`, where the daemon's readiness notification arrives.
+int NotificationSocket(const std::string& path) {
+  const int fd = ::socket(AF_UNIX, SOCK_DGRAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{};
+  address.sun_family = AF_UNIX;
+  path.copy(address.sun_path, sizeof address.sun_path - 1);
+  if (::bind(fd, reinterpret_cast<sockaddr*>(&address), sizeof address) != 0) {
+    ::close(fd);
+    return -1;
+  }
+  return fd;
+}
+
+// Every notification that arrives within `timeout`, joined by newlines.
+std::string Notifications(int fd, std::chrono::milliseconds timeout) {
+  std::string all;
+  pollfd p{fd, POLLIN, 0};
+  while (::poll(&p, 1, static_cast<int>(timeout.count())) == 1) {
+    char buffer[512];
+    const ssize_t n = ::recv(fd, buffer, sizeof buffer, 0);
+    if (n <= 0) break;
+    all.append(buffer, static_cast<std::size_t>(n)).push_back('\n');
+    if (all.find("READY=1\n") != std::string::npos) break;
+  }
+  return all;
+}
+
+TEST(SocketActivationTest, TheFirstConnectionStartsTheDaemonWhichAnswersAndNotifies) {
+  if (::access(kActivator, X_OK) != 0) GTEST_SKIP() << kActivator << " is not installed";
+  testing::TempDir home;
+  const std::string socket = home.path() + "/activated.sock";
+  const int notify = NotificationSocket(home.path() + "/notify.sock");
+  ASSERT_GE(notify, 0);
+  ChildProcess activator(
+      kActivator,
+      {"--listen=" + socket, "--setenv=NOTIFY_SOCKET=" + home.path() + "/notify.sock",
+       QN_DAEMON_PATH, "--home", home.path()},
+      home.path());
+  ASSERT_TRUE(Eventually([&] { return std::filesystem::exists(socket); })) << activator.Stderr();
+  // Nothing has started the daemon yet: it creates its store when it starts.
+  EXPECT_FALSE(std::filesystem::exists(home.path() + "/state/reports.db"));
+
+  auto client = client::Client::Connect(socket);
+  ASSERT_TRUE(client);
+  EXPECT_EQ(client->createReportingSessionSync(7), true) << activator.Stderr();
+  EXPECT_NE(Notifications(notify, kPatience).find("READY=1\n"), std::string::npos);
+  EXPECT_TRUE(std::filesystem::exists(home.path() + "/state/reports.db"));
+  client.reset();
+
+  // The activator has become the daemon, which the socket's owner stops with SIGTERM.
+  activator.Signal(SIGTERM);
+  EXPECT_EQ(activator.Wait(), Exited(0)) << activator.Stderr();
+  ::close(notify);
 }
 
 }  // namespace

@@ -1,7 +1,9 @@
-// Sessions end to end: the real daemon, the real client library, the rows in the store.
+// The daemon end to end through the real client library: a session's flow into the store
+// and its summary file, clients leaving, killService, signals, the command line.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
+#include <algorithm>
 #include <filesystem>
 #include <fstream>
 #include <mutex>
@@ -14,7 +16,10 @@ namespace qn::e2e {
 namespace {
 
 using ::testing::ElementsAre;
+using ::testing::HasSubstr;
 using Table = ReportingStoreRow::Table;
+
+constexpr const char* kUptimeEvent = "com.norvel.quenta.qnreportingclientuptime";
 
 void WriteCounter(const std::string& path, std::int64_t value) {
   std::filesystem::create_directories(std::filesystem::path(path).parent_path());
@@ -33,14 +38,29 @@ const Value* Field(const Value& dictionary, const char* key) {
   return d ? d->Find(key) : nullptr;
 }
 
+std::vector<std::int64_t> Categories(const std::vector<ReportingStoreRow>& rows) {
+  std::vector<std::int64_t> out;
+  for (const auto& row : RowsOf(rows, Table::kLivoMessage)) out.push_back(row.category);
+  return out;
+}
+
+// One session from create to destroy on an internal build, after a broadcast that found no
+// started session (a standalone message): the rows in the store, the summary file in place
+// when the stop reply arrives (a stale temporary file of an earlier run gone).
 TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
-  testing::TempDir stats;
+  testing::TempDir stats, home;
   const std::string counter = stats.path() + "/Speaker/Main/frames";
   WriteCounter(counter, 10);  // the daemon subscribes to its drivers at start-up
-  Daemon daemon({"--driver-stats", stats.path()});
+  const std::string summaries = home.File("log/DiagnosticLogs/Audio/Reporting");
+  std::filesystem::create_directories(summaries);
+  std::ofstream(summaries + "/.20240101-000000+0000-quenta-unknown-generic.json.tmp-7-0-1f") << "[";
+  auto started = StartOn(home, {"--driver-stats", stats.path(), "--internal-build"});
+  Daemon& daemon = *started;
   ASSERT_TRUE(daemon.started());
   auto client = daemon.Connect();
   ASSERT_TRUE(client);
+  EXPECT_TRUE(RepliedWithoutError(
+      client->sendMessageSync(Value(Dictionary{{"k", "v"}}), 5, 1, std::nullopt)));
 
   EXPECT_EQ(client->createReportingSessionSync(42), true);
   EXPECT_EQ(client->setServiceTypeSync(2, 42), true);
@@ -71,9 +91,13 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
     std::lock_guard lock(mu);
     EXPECT_THAT(order, ElementsAre("start YES", "stop YES"));
   }
+  const auto files = NamesIn(summaries);
+  ASSERT_EQ(files.size(), 1u);
+  EXPECT_TRUE(files[0].ends_with("-quenta-com.example.app-telephony.json")) << files[0];
+  const Value summary = Json(testing::ReadFileText(summaries + "/" + files[0]));
+  ASSERT_TRUE(summary.as_array());
+  EXPECT_EQ(summary.as_array()->size(), 5u);  // user info, two messages, drivers, the summary
   EXPECT_EQ(client->destroyReportingSessionSync(42), true);
-  EXPECT_EQ(client->reporterIDValidSync(42),
-            (Dictionary{{"reporterID", 0}, {"serviceType", 65535}}));
   client.reset();
   EXPECT_EQ(daemon.Stop(), Exited(0));
 
@@ -88,18 +112,23 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
 
   std::vector<std::int64_t> categories;
   std::vector<Value> payloads;
-  for (const auto& row : RowsOf(rows, Table::kLivoMessage)) {
-    ASSERT_EQ(row.session, sessions[0].id) << "no single messages expected";
+  auto messages = RowsOf(rows, Table::kLivoMessage);
+  ASSERT_EQ(messages.size(), 5u);
+  EXPECT_FALSE(messages[0].session);  // the standalone message
+  EXPECT_EQ(*Field(Json(messages[0].user_info), "ServiceName"), Value("standalone"));
+  for (const auto& row : messages) {
+    EXPECT_EQ(row.session, row.session ? sessions[0].id : row.session);
     categories.push_back(row.category);
     payloads.push_back(Json(row.payload));
   }
   // The two messages, the driver statistics delta, then the summary event.
-  ASSERT_THAT(categories, ElementsAre(5, 11, 9, 0xFFFF));
-  EXPECT_EQ(payloads[0], Value(Dictionary{{"route", "speaker"}}));
-  EXPECT_EQ(payloads[1], Value(Dictionary{{"two_words", 1}}));
-  EXPECT_EQ(payloads[2], Value(Dictionary{{"Speaker_frames", 15}}));
-  EXPECT_TRUE(Field(payloads[3], "QN_Session_Summary_Event"));
+  ASSERT_THAT(categories, ElementsAre(5, 5, 11, 9, 0xFFFF));
+  EXPECT_EQ(payloads[1], Value(Dictionary{{"route", "speaker"}}));
+  EXPECT_EQ(payloads[2], Value(Dictionary{{"two_words", 1}}));
+  EXPECT_EQ(payloads[3], Value(Dictionary{{"Speaker_frames", 15}}));
+  EXPECT_TRUE(Field(payloads[4], "QN_Session_Summary_Event"));
 
+  // The analytics bridge saw the session's messages only, not the standalone one.
   for (const char* name : {"com.norvel.quenta.Setup.Start", "com.norvel.quenta.Volume.Stop",
                            "com.norvel.quenta.Ostreling.Generic"}) {
     auto events = AnalyticsNamed(rows, name);
@@ -115,31 +144,110 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   EXPECT_GE(Field(uptime_payload, "seconds")->as_double().value_or(-1), 0.0);
 }
 
-TEST(SessionFlowTest, BroadcastWithoutAStartedSessionIsOneStandaloneMessage) {
+// killService: exit status 2; what the store was handed is kept, and so is the summary file of
+// the session stopped right before.
+TEST(LifecycleTest, KillServiceExitsTwoAndTheStoreKeepsAll) {
+  Daemon daemon({"--internal-build"});
+  ASSERT_TRUE(daemon.started());
+  auto killer = daemon.Connect();
+  auto bystander = daemon.Connect();
+  ASSERT_TRUE(killer && bystander);
+  EXPECT_EQ(killer->createReportingSessionSync(42), true);
+  EXPECT_EQ(killer->setServiceTypeSync(3, 42), true);
+  killer->startReportingSessionForID(42, nullptr);
+  const Value message(Dictionary{{"EngineOnTime", 2.5}, {"qnreporting_timestamp", 1700000000}});
+  EXPECT_TRUE(RepliedWithoutError(killer->sendMessageSync(message, 5, 6, {{42}})));
+  EXPECT_EQ(killer->stopReportingSessionForIDSync(42), true);
+  // Both bridges hand their events to the store on the server queue. The reply to the last
+  // message comes once every earlier one is handed over; the kill right after it must not
+  // lose what the store has not written yet.
+  constexpr std::size_t kMessages = 2001;
+  for (std::size_t n = 1; n + 1 < kMessages; ++n) {
+    killer->sendMessage(Value(Dictionary{{"EngineOnTime", 2.5}, {"qnreporting_timestamp", n}}), 5,
+                        6, std::vector<std::int64_t>{42}, nullptr);
+  }
+  EXPECT_TRUE(RepliedWithoutError(killer->sendMessageSync(message, 5, 6, {{42}})));
+  killer->killService();
+  EXPECT_EQ(daemon.process().Wait(), Exited(2));
+  EXPECT_EQ(NamesIn(daemon.home() + "/log/DiagnosticLogs/Audio/Reporting").size(), 1u);
+  EXPECT_TRUE(bystander->WaitUntilEnded());
+  EXPECT_THAT(daemon.process().Stderr(), HasSubstr(": DESTROYING SERVICE"));
+
+  const auto rows = daemon.Rows();
+  EXPECT_EQ(AnalyticsNamed(rows, "com.norvel.quenta.Setup.Undefined").size(), kMessages);
+  auto power = RowsOf(rows, Table::kPowerLogEvent);
+  ASSERT_EQ(power.size(), kMessages);
+  EXPECT_EQ(power[0].name, "Vistrel_Haptics");
+  EXPECT_EQ(power[0].subsystem, 28);
+  // The exit stops nothing: only the readiness probe had left.
+  EXPECT_EQ(AnalyticsNamed(rows, kUptimeEvent).size(), 1u);
+}
+
+// A client that leaves has its sessions stopped (its start reply never comes); SIGHUP
+// re-reads the defaults (written here, read only when told); SIGTERM stops every session
+// left, writes the store and exits with 0.
+TEST(LifecycleTest, LeavingClientsSighupAndSigterm) {
   Daemon daemon;
   ASSERT_TRUE(daemon.started());
+  auto leaving = daemon.Connect();
   auto client = daemon.Connect();
-  ASSERT_TRUE(client);
-  EXPECT_EQ(client->createReportingSessionSync(5), true);  // created, never started
+  ASSERT_TRUE(leaving && client);
+  EXPECT_EQ(leaving->createReportingSessionSync(7), true);
+  bool start_replied = false;
+  leaving->startReportingSessionForID(7, [&](bool) { start_replied = true; });
   EXPECT_TRUE(RepliedWithoutError(
-      client->sendMessageSync(Value(Dictionary{{"k", "v"}}), 5, 1, std::nullopt)));
+      leaving->sendMessageSync(Value(Dictionary{{"a", 1}}), 3, 1, std::vector<std::int64_t>{7})));
+  leaving.reset();
+  EXPECT_FALSE(start_replied);
+  // The removal runs on the server queue after the connection ended.
+  EXPECT_TRUE(
+      Eventually([&] { return client->getAllReportersSync() == std::vector<std::int64_t>{}; }));
+  ASSERT_TRUE(daemon.WaitForRows([](const auto& rows) {
+    return Categories(rows) == std::vector<std::int64_t>{3, 0xFFFF};
+  }));
 
-  // The standalone message is sent from the background queue after the reply.
-  ASSERT_TRUE(daemon.WaitForRows(
-      [](const auto& rows) { return !RowsOf(rows, Table::kLivoMessage).empty(); }));
-  client.reset();
-  EXPECT_EQ(daemon.Stop(), Exited(0));
+  for (std::int64_t id : {1, 2, 3}) {
+    EXPECT_EQ(client->createReportingSessionSync(id), true);
+    client->startReportingSessionForID(id, nullptr);
+    EXPECT_TRUE(RepliedWithoutError(client->sendMessageSync(Value(Dictionary{{"n", id}}), 1, 1,
+                                                            std::vector<std::int64_t>{id})));
+  }
+  const std::string defaults = daemon.home() + "/state/defaults";
+  std::filesystem::create_directories(defaults);
+  std::ofstream(defaults + "/com.norvel.quenta.json.tmp") << R"({"disable_reporting": true})";
+  std::filesystem::rename(defaults + "/com.norvel.quenta.json.tmp",
+                          defaults + "/com.norvel.quenta.json");
+  auto send = [&] { return client->sendMessageSync(Value(Dictionary{}), 1, 1, {{1}}); };
+  EXPECT_TRUE(RepliedWithoutError(send()));
+  daemon.process().Signal(SIGHUP);
+  std::optional<std::optional<client::ReplyError>> refused;
+  ASSERT_TRUE(Eventually([&] { return (refused = send()) && *refused; }));
+  EXPECT_EQ((*refused)->domain, "com.norvel.audio.reporting");
+  EXPECT_EQ((*refused)->code, 1);
+  EXPECT_TRUE((*refused)->userInfo.is_null());
+
+  EXPECT_EQ(daemon.Stop(SIGTERM), Exited(0));
+  EXPECT_TRUE(client->WaitUntilEnded());
+  EXPECT_FALSE(std::filesystem::exists(daemon.socket_path()));
   const auto rows = daemon.Rows();
-  const auto messages = RowsOf(rows, Table::kLivoMessage);
-  ASSERT_EQ(messages.size(), 1u);
-  EXPECT_FALSE(messages[0].session);
-  EXPECT_EQ(messages[0].category, 5);
-  EXPECT_EQ(messages[0].type, 1);
-  EXPECT_EQ(*Field(Json(messages[0].user_info), "ServiceName"), Value("standalone"));
-  EXPECT_TRUE(RowsOf(rows, Table::kLivoSession).empty());
-  // The analytics bridge is not called for standalone messages.
-  for (const auto& row : RowsOf(rows, Table::kAnalyticsEvent)) {
-    EXPECT_EQ(row.name, "com.norvel.quenta.qnreportingclientuptime");
+  const auto sessions = RowsOf(rows, Table::kLivoSession);
+  ASSERT_EQ(sessions.size(), 4u);
+  for (const auto& session : sessions) EXPECT_TRUE(session.flushed);
+  const auto categories = Categories(rows);
+  EXPECT_EQ(std::count(categories.begin(), categories.end(), 0xFFFF), 4);
+  EXPECT_EQ(AnalyticsNamed(rows, kUptimeEvent).size(), 3u);  // the probe and both clients
+}
+
+// CLI11 does the parsing; this pins the exit codes a service manager sees.
+TEST(CommandLineTest, HelpExitsZeroBadArgumentsExitTwo) {
+  testing::TempDir dir;
+  ChildProcess help(QN_DAEMON_PATH, {"--help"}, dir.path());
+  EXPECT_EQ(help.Wait(), Exited(0));
+  EXPECT_THAT(help.Stdout(), HasSubstr("--home DIR"));
+  for (const char* bad : {"--bogus", "--home"}) {
+    ChildProcess process(QN_DAEMON_PATH, {bad}, dir.path());
+    EXPECT_EQ(process.Wait(), Exited(2)) << bad;
+    EXPECT_THAT(process.Stderr(), HasSubstr("qnreportingd: ")) << bad;
   }
 }
 

@@ -8,14 +8,12 @@
 
 namespace qn::testing {
 
-// A fresh folder under the system's temporary folder, removed with everything in it.
-// Aborts the test program when no folder can be made (nothing hermetic would follow).
+// A fresh folder under the system's temporary folder, removed with everything in it. Aborts
+// the test program when no folder can be made (nothing hermetic would follow).
 class TempDir {
  public:
-  TempDir() {
-    std::string pattern = (std::filesystem::temp_directory_path() / "qn-test-XXXXXX").string();
-    if (mkdtemp(pattern.data()) == nullptr) std::abort();
-    path_ = pattern;
+  TempDir() : path_((std::filesystem::temp_directory_path() / "qn-test-XXXXXX").string()) {
+    if (mkdtemp(path_.data()) == nullptr) std::abort();
   }
   ~TempDir() {
     std::error_code ignored;
@@ -23,10 +21,8 @@ class TempDir {
   }
   TempDir(const TempDir&) = delete;
   TempDir& operator=(const TempDir&) = delete;
-
   const std::string& path() const { return path_; }
-  // `name` below the folder.
-  std::string File(const std::string& name) const { return path_ + "/" + name; }
+  std::string File(const std::string& name) const { return path_ + "/" + name; }  // below it
 
  private:
   std::string path_;
@@ -34,9 +30,8 @@ class TempDir {
 
 // The whole content of a file ("" when it cannot be read).
 inline std::string ReadFileText(const std::string& path) {
-  std::ifstream in(path, std::ios::binary);
   std::ostringstream text;
-  text << in.rdbuf();
+  text << std::ifstream(path, std::ios::binary).rdbuf();
   return text.str();
 }
 

@@ -58,8 +58,7 @@ void Exercise(std::string_view body, Service& service) {
     const qn::Array& items = *value->as_array();
     Check(qn::protocol::ArgumentsOf(header->op).size() + 2 == items.size());
     if (header->op == qn::protocol::Op::kKillService) return;  // ends the process by design
-    service.connection->Request(header->op, qn::Array(items.begin() + 2, items.end()),
-                                header->request_id);
+    service.connection->Request(header->op, qn::Array(items.begin() + 2, items.end()));
     service.env.dispatcher->RunUntilIdle();
   } else {
     auto& problem = std::get<qn::protocol::RequestProblem>(checked);

@@ -1,47 +1,183 @@
-// qnreport: the line parser, and the shell against an in-process listener.
-
+// qnreport: the command line in-process on a temporary home (usage errors, defaults, notify,
+// events, session), the shell's line parser, and the shell against an in-process listener.
 #include <gtest/gtest.h>
 
+#include <filesystem>
 #include <sstream>
 
 #include "common/Json.h"
+#include "platform/linux/reporting_store.h"
 #include "tests/ipc/ipc_test_util.h"
+#include "tools/qnreport/Admin.h"
+#include "tools/qnreport/Cli.h"
 #include "tools/qnreport/Commands.h"
 #include "tools/qnreport/Shell.h"
 
-namespace qn::testing {
+namespace qn::qnreport {
 namespace {
 
-using qnreport::ParseCommand;
+class CommandLineTest : public ::testing::Test {
+ protected:
+  int Run(std::vector<std::string> args) {
+    args.insert(args.begin(), {"--home", home_.path()});
+    out_.str("");
+    err_.str("");
+    std::istringstream in;
+    return RunCommandLine(args, in, out_, err_);
+  }
+  Value JsonOut() {
+    Value value;
+    EXPECT_FALSE(ParseJson(out_.str(), value).has_value()) << out_.str();
+    return value;
+  }
+  Paths paths() const { return ResolvePaths(PathOptions{home_.path(), std::nullopt}); }
 
-std::string Problem(std::string_view line) {
-  auto result = ParseCommand(line);
-  if (auto* problem = std::get_if<std::string>(&result)) return *problem;
-  ADD_FAILURE() << line << " was accepted";
-  return {};
+  testing::TempDir home_;
+  std::ostringstream out_, err_;
+};
+
+TEST_F(CommandLineTest, UsageErrorsExitTwoAndSayWhatIsWrong) {
+  const std::vector<std::pair<std::vector<std::string>, std::string>> cases = {
+      {{}, "missing command"},
+      {{"bogus"}, "bogus"},
+      {{"defaults"}, "subcommand"},
+      {{"defaults", "write", "only_key"}, "VALUE"},
+      {{"notify", "post"}, "NAME"},
+      {{"events", "--sink", "elsewhere"}, "--sink"},
+      {{"events", "--since", "soonish"}, "not a time"},
+      {{"--timeout", "0", "valid", "1"}, "positive number"},
+      {{"create", "abc"}, "not a 64-bit integer"},
+      {{"send", "{}", "5", "70000"}, "type"},
+      {{"session"}, "N"}};
+  for (const auto& [args, problem] : cases) {
+    EXPECT_EQ(Run(args), 2) << ::testing::PrintToString(args);
+    EXPECT_NE(err_.str().find(problem), std::string::npos) << err_.str();
+    EXPECT_NE(err_.str().find("--help"), std::string::npos) << err_.str();
+  }
+  EXPECT_EQ(Run({"events", "--help"}), 0);
+  EXPECT_NE(out_.str().find("--follow"), std::string::npos);
 }
 
-TEST(QnreportParseTest, BadLinesSayWhatIsWrong) {
-  EXPECT_NE(Problem("frobnicate 1").find("unknown command \"frobnicate\""), std::string::npos);
-  EXPECT_NE(Problem("create").find("missing reporter ID"), std::string::npos);
-  EXPECT_NE(Problem("create 9223372036854775808").find("not a 64-bit integer"), std::string::npos);
-  EXPECT_NE(Problem("type 1 65536").find("16-bit"), std::string::npos);
-  EXPECT_NE(Problem("create 1 2").find("unexpected \"2\""), std::string::npos);
-  EXPECT_NE(Problem("config 1 {\"a\":").find("JSON object"), std::string::npos);
-  EXPECT_NE(Problem("config 1 [1]").find("not an array"), std::string::npos);
-  EXPECT_NE(Problem("config 1 {\"a\" 1}").find("not valid JSON"), std::string::npos);
-  EXPECT_NE(Problem("send {} 4294967296 1").find("32-bit"), std::string::npos);
-  EXPECT_NE(Problem("send {} 1 1 1,x").find("bad reporter ID \"x\""), std::string::npos);
-  EXPECT_NE(Problem("send {} 1").find("usage"), std::string::npos);
-  EXPECT_NE(Problem("sleep -1").find("seconds"), std::string::npos);
+// defaults: values as JSON or plain strings, read back and deleted; notify post touches the
+// notification file (when anyone ever watched).
+TEST_F(CommandLineTest, DefaultsAndNotify) {
+  EXPECT_EQ(Run({"defaults", "write", "disable_reporting", "YES"}), 0) << err_.str();
+  EXPECT_EQ(Run({"defaults", "write", "device_name", "\"lab phone\""}), 0);
+  EXPECT_EQ(Run({"defaults", "write", "level", "3"}), 0);
+  ASSERT_EQ(Run({"defaults", "read"}), 0);
+  EXPECT_EQ(
+      JsonOut(),
+      Value(Dictionary{{"disable_reporting", "YES"}, {"device_name", "lab phone"}, {"level", 3}}));
+  EXPECT_EQ(Run({"defaults", "delete", "disable_reporting"}), 0);
+  EXPECT_EQ(Run({"defaults", "delete", "never_there"}), 0);
+  ASSERT_EQ(Run({"defaults", "read"}), 0);
+  EXPECT_FALSE(JsonOut().as_dictionary()->Contains("disable_reporting"));
+
+  const std::string file = paths().runtime_dir + "/notify/com.norvel.quenta.reporting";
+  // Nobody has ever watched: nobody to tell, and nothing is created.
+  EXPECT_EQ(Run({"notify", "post", "com.norvel.quenta.reporting"}), 0) << err_.str();
+  EXPECT_FALSE(std::filesystem::exists(file));
+  std::filesystem::create_directories(paths().runtime_dir + "/notify");
+  EXPECT_EQ(Run({"notify", "post", "com.norvel.quenta.reporting"}), 0) << err_.str();
+  EXPECT_TRUE(std::filesystem::exists(file));
+  EXPECT_EQ(Run({"notify", "post", "../escape"}), 1);  // would leave the notification folder
+}
+
+// events filtered by sink, session and time; session tells one session's story.
+TEST_F(CommandLineTest, EventsAndSession) {
+  EXPECT_EQ(Run({"events"}), 1);
+  EXPECT_NE(err_.str().find("reports.db"), std::string::npos);
+  // A store with one stopped framework session (number 1), a single message, a power-log row.
+  std::filesystem::create_directories(paths().state_dir);
+  std::optional<Error> error;
+  auto store = ReportingStore::Open(paths().state_dir + "/reports.db", nullptr, &error);
+  ASSERT_TRUE(store);
+  const std::int64_t id = store->NewSessionId();
+  store->AddSession(id, Value(Dictionary{{"SessionID", 42}}),
+                    Value(Dictionary{{"ServiceName", "alarm_session"}}));
+  for (int type : {1, 1, 2}) store->AddSessionMessage(id, 5, type, Value(Dictionary{{"a", type}}));
+  store->AddSessionMessage(id, 0xFFFF, 0xFFFF, Value(Dictionary{{"a", "1,1,2"}}));
+  store->MarkSessionFlushed(id, nullptr);
+  store->AddSingleMessage(Value(Dictionary{}), Value(Dictionary{}), 5, 1,
+                          Value(Dictionary{{"route", "speaker"}}));
+  store->AddPowerLogEvent(28, "Vistrel_Haptics", Value(Dictionary{{"EngineOnDuration", 2}}));
+  store->Drain();
+
+  ASSERT_EQ(Run({"events"}), 0) << err_.str();
+  EXPECT_NE(out_.str().find("reporting  single   5 Setup             1 Start         "
+                            "{\"route\":\"speaker\"}"),
+            std::string::npos)
+      << out_.str();
+  EXPECT_NE(out_.str().find("Vistrel_Haptics"), std::string::npos);
+
+  ASSERT_EQ(Run({"events", "--sink", "powerlog", "--json"}), 0);
+  EXPECT_EQ(*JsonOut().as_dictionary()->Find("name"), Value("Vistrel_Haptics"));
+
+  const std::vector<std::pair<std::vector<std::string>, int>> counts = {
+      {{}, 7},
+      {{"--session", "1"}, 5},
+      {{"--session", "2"}, 0},
+      {{"--since", "-1h"}, 7},
+      {{"--since", "-1h", "--sink", "reporting"}, 6},
+      {{"--since", "4000000000"}, 0}};
+  for (auto [args, rows] : counts) {
+    args.insert(args.begin(), {"events", "--json"});
+    ASSERT_EQ(Run(args), 0) << err_.str();
+    const std::string text = out_.str();
+    EXPECT_EQ(std::count(text.begin(), text.end(), '\n'), rows)
+        << ::testing::PrintToString(args) << out_.str();
+  }
+
+  ASSERT_EQ(Run({"session", "1"}), 0) << err_.str();
+  const std::string story = out_.str();
+  for (const char* line : {"Session 1: reporter 42, alarm_session, unknown\n", "  messages  4\n",
+                           "    5 Setup               1 Start           2\n",
+                           "    5 Setup               2 Stop            1\n",
+                           "  summary   {\"a\":\"1,1,2\"}\n", "  drivers   no driver"}) {
+    EXPECT_NE(story.find(line), std::string::npos) << line << " in\n" << story;
+  }
+  EXPECT_EQ(story.find("stopped   not yet"), std::string::npos) << story;
+  EXPECT_EQ(Run({"session", "2"}), 1);
+  EXPECT_NE(err_.str().find("no session 2"), std::string::npos);
+}
+
+TEST(QnreportParseTest, BadLinesAndTimes) {
+  const std::pair<const char*, const char*> cases[] = {
+      {"frobnicate 1", "unknown command \"frobnicate\""},
+      {"create", "missing reporter ID"},
+      {"create 9223372036854775808", "not a 64-bit integer"},
+      {"type 1 65536", "16-bit"},
+      {"create 1 2", "unexpected \"2\""},
+      {"config 1 {\"a\":", "JSON object"},
+      {"config 1 [1]", "not an array"},
+      {"config 1 {\"a\" 1}", "not valid JSON"},
+      {"send {} 4294967296 1", "32-bit"},
+      {"send {} 1 1 1,x", "bad reporter ID \"x\""},
+      {"send {} 1", "usage"},
+      {"sleep -1", "seconds"}};
+  for (const auto& [line, problem] : cases) {
+    auto result = ParseCommand(line);
+    auto* text = std::get_if<std::string>(&result);
+    ASSERT_TRUE(text) << line << " was accepted";
+    EXPECT_NE(text->find(problem), std::string::npos) << line << ": " << *text;
+  }
+  // Times for events --since.
+  const double now = 1'800'000'000;
+  EXPECT_EQ(ParseTimeArgument("-90s", now), now - 90);
+  EXPECT_EQ(ParseTimeArgument("-2h", now), now - 7200);
+  EXPECT_EQ(ParseTimeArgument("1700000000.5", now), 1700000000.5);
+  EXPECT_TRUE(ParseTimeArgument("2026-11-21 13:05", now));
+  for (const char* bad : {"", "-", "-5y", "yesterdayish", "2026-13-45 99:99"}) {
+    EXPECT_FALSE(ParseTimeArgument(bad, now)) << bad;
+  }
 }
 
 TEST(QnreportShellTest, OneConnectionEveryReplyAsAJsonLine) {
-  ListenerHarness harness([](protocol::Op op, const Array& args, IpcReply reply) {
+  testing::ListenerHarness harness([](protocol::Op op, const Array& args, IpcReply reply) {
     if (op == protocol::Op::kGetServiceNameForReporterID && args[0] == Value(0)) {
       reply(Value(65535));
     }
-    FakeExportedObject::DefaultReply(op, args, reply);
+    testing::FakeExportedObject::DefaultReply(op, args, reply);
   });
   auto client = client::Client::Connect(harness.socket_path());
   ASSERT_TRUE(client);
@@ -49,7 +185,7 @@ TEST(QnreportShellTest, OneConnectionEveryReplyAsAJsonLine) {
       "create 42\ntype 42 2\nbogus\nname 0\nsend {\"route\": \"speaker\"} 5 1 42\nwait\n"
       "valid 42\nreporters\n");
   std::ostringstream out;
-  EXPECT_EQ(qnreport::RunShell(*client, in, out, std::chrono::seconds(20)), 0);
+  EXPECT_EQ(RunShell(*client, in, out, std::chrono::seconds(20)), 0);
   // The error line is printed when its line is read; the replies when they arrive.
   std::istringstream printed(out.str());
   std::string line, replies;
@@ -75,4 +211,4 @@ TEST(QnreportShellTest, OneConnectionEveryReplyAsAJsonLine) {
 }
 
 }  // namespace
-}  // namespace qn::testing
+}  // namespace qn::qnreport

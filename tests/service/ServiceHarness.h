@@ -3,12 +3,10 @@
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
 
-#include <cstdint>
 #include <functional>
 #include <memory>
 #include <optional>
 #include <string>
-#include <utility>
 #include <vector>
 
 #include "Statistics/Service/QNReportingServerInstance.h"
@@ -27,18 +25,15 @@ inline std::shared_ptr<const Dictionary> Payload(Dictionary d) {
 
 // Records every value a reply callback is called with.
 template <typename T>
-class Replies {
- public:
+struct Replies {
+  std::shared_ptr<std::vector<T>> values = std::make_shared<std::vector<T>>();
   std::function<void(T)> Callback() const {
-    return [values = values_](T value) { values->push_back(std::move(value)); };
+    return [v = values](T value) { v->push_back(std::move(value)); };
   }
-  std::size_t size() const { return values_->size(); }
-  bool empty() const { return values_->empty(); }
-  const T& operator[](std::size_t i) const { return values_->at(i); }
-  const std::vector<T>& all() const { return *values_; }
-
- private:
-  std::shared_ptr<std::vector<T>> values_ = std::make_shared<std::vector<T>>();
+  std::size_t size() const { return values->size(); }
+  bool empty() const { return values->empty(); }
+  const T& operator[](std::size_t i) const { return values->at(i); }
+  const std::vector<T>& all() const { return *values; }
 };
 using BoolReplies = Replies<bool>;
 

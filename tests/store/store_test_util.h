@@ -1,7 +1,6 @@
 #pragma once
 
 #include <gtest/gtest.h>
-#include <nlohmann/json.hpp>
 
 #include <memory>
 #include <optional>
@@ -45,10 +44,6 @@ inline std::vector<ReportingStoreRow> ReadRows(const std::string& db,
   });
   EXPECT_FALSE(error) << error->Description();
   return rows;
-}
-
-inline nlohmann::json ParseJson(const std::string& text) {
-  return nlohmann::json::parse(text, nullptr, /*allow_exceptions=*/false);
 }
 
 }  // namespace qn::testing

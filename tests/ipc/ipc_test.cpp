@@ -1,7 +1,5 @@
-// The Linux IPC layer, driven through the real client library and through raw sockets.
-
-#include <gtest/gtest.h>
-
+// The Linux IPC layer driven through the real client library (C++ and C) and raw sockets,
+// and the daemon's folders.
 #include <fcntl.h>
 #include <sys/resource.h>
 #include <sys/socket.h>
@@ -9,9 +7,14 @@
 #include <sys/un.h>
 #include <unistd.h>
 
-#include "qnreporting/Client.h"
+#include <future>
+
+#include "common/Paths.h"
+#include "qnreporting/qnreporting.h"
 #include "tests/fakes/RawConnection.h"
 #include "tests/ipc/ipc_test_util.h"
+
+extern "C" int qn_c_api_round_trip(const char* socket_path);
 
 namespace qn::testing {
 namespace {
@@ -19,21 +22,6 @@ namespace {
 using client::Client;
 using protocol::ConnectionError;
 using protocol::Op;
-
-LinuxIpcOptions Options(const std::string& path) {
-  LinuxIpcOptions options;
-  options.socket_path = path;
-  options.socket_activation = false;
-  options.notify_ready = false;
-  return options;
-}
-
-std::unique_ptr<Client> Connect(const std::string& path) {
-  std::string error;
-  auto client = Client::Connect(path, &error);
-  EXPECT_NE(client, nullptr) << error;
-  return client;
-}
 
 TEST(LinuxIpcTest, SocketFileHasMode0660AndGoesAwayWhenStopped) {
   auto harness = std::make_unique<ListenerHarness>();
@@ -79,57 +67,28 @@ TEST(LinuxIpcTest, RepliesMadeOnOtherThreadsKeepTheirOrder) {
   EXPECT_EQ(arrived.size(), 40u);
 }
 
-TEST(LinuxIpcTest, InvalidationRunsOnceAndReleasesTheExportedObject) {
+// A connection that ends is invalidated once and its exported object released; Stop
+// invalidates every open one once, and Resume returns.
+TEST(LinuxIpcTest, EachConnectionIsInvalidatedOnceWhenItEndsOrTheListenerStops) {
   ListenerHarness harness;
-  {
-    auto client = Connect(harness.socket_path());
-    ASSERT_TRUE(client);
-    EXPECT_EQ(client->createReportingSessionSync(1), true);
-  }  // closes
+  auto first = Connect(harness.socket_path());
+  ASSERT_TRUE(first && first->createReportingSessionSync(1) == true);
+  first.reset();
   ASSERT_TRUE(Eventually([&] { return harness.delegate().invalidations() == 1; }));
-  auto accepted = harness.delegate().accepted();
-  ASSERT_EQ(accepted.size(), 1u);
-  EXPECT_TRUE(accepted[0].object.expired());
-  // Nothing that happens later invalidates it again.
-  harness.Stop();
-  EXPECT_EQ(*accepted[0].invalidations, 1);
-}
-
-TEST(LinuxIpcTest, StopInvalidatesEveryOpenConnectionOnceAndResumeReturns) {
-  ListenerHarness harness;
+  EXPECT_TRUE(harness.delegate().accepted().at(0).object.expired());
   auto a = Connect(harness.socket_path());
   auto b = Connect(harness.socket_path());
   ASSERT_TRUE(a && b);
   std::atomic<int> ended{0};
-  a->SetInvalidationHandler([&] { ++ended; });
-  b->SetInvalidationHandler([&] { ++ended; });
-  EXPECT_EQ(a->createReportingSessionSync(1), true);
-  EXPECT_EQ(b->createReportingSessionSync(1), true);
+  for (auto* c : {a.get(), b.get()}) {
+    c->SetInvalidationHandler([&] { ++ended; });
+    EXPECT_EQ(c->createReportingSessionSync(1), true);
+  }
   harness.Stop();  // returns only once Resume has returned
   for (const auto& entry : harness.delegate().accepted()) EXPECT_EQ(*entry.invalidations, 1);
-  EXPECT_TRUE(a->WaitUntilEnded());
-  EXPECT_TRUE(b->WaitUntilEnded());
+  EXPECT_TRUE(a->WaitUntilEnded() && b->WaitUntilEnded());
   EXPECT_EQ(ended, 2);
   EXPECT_EQ(a->createReportingSession(2, nullptr), 0u);
-}
-
-TEST(LinuxIpcTest, ClientLibraryReportsTheConnectionErrorFrame) {
-  ListenerHarness harness;
-  auto client = Connect(harness.socket_path());
-  ASSERT_TRUE(client);
-  std::mutex mu;
-  std::vector<client::ConnectionError> errors;
-  client->SetConnectionErrorHandler([&](const client::ConnectionError& error) {
-    std::lock_guard lock(mu);
-    errors.push_back(error);
-  });
-  client->SendRequest(static_cast<Op>(40), {}, nullptr);
-  EXPECT_TRUE(client->WaitUntilEnded());
-  std::lock_guard lock(mu);
-  ASSERT_EQ(errors.size(), 1u);
-  EXPECT_EQ(errors[0].domain, protocol::kIpcErrorDomain);
-  EXPECT_EQ(errors[0].code, static_cast<std::int64_t>(ConnectionError::kUnknownOp));
-  EXPECT_NE(errors[0].message.find("40"), std::string::npos) << errors[0].message;
 }
 
 TEST(LinuxIpcTest, AcceptRecoversWhenDescriptorsRunOut) {
@@ -186,16 +145,16 @@ TEST(LinuxIpcTest, AConnectionIsReadOnlyWhileFewRequestsWaitToBeTakenIn) {
   auto object = harness.delegate().accepted().at(0).object.lock();
   object->HoldTakenIn(true);
   ASSERT_TRUE(raw.Write(ValidRequests(2, 101)));
-  ASSERT_TRUE(Eventually([&] { return object->calls().size() == 11; }));
+  ASSERT_TRUE(Eventually([&] { return object->requests == 11; }));
   std::this_thread::sleep_for(std::chrono::milliseconds(100));  // time to (wrongly) read on
-  EXPECT_EQ(object->calls().size(), 11u);
+  EXPECT_EQ(object->requests, 11);
   EXPECT_EQ(Counters::Get(options.counters->pausedForRequests), 1u);
   object->HoldTakenIn(false);
   for (std::uint32_t id = 2; id <= 101; ++id) {
     const auto reply = raw.ReadFrame();
     ASSERT_TRUE(reply && reply->as_array()->front() == Value(id));
   }
-  EXPECT_EQ(object->calls().size(), 101u);
+  EXPECT_EQ(object->requests, 101);
 }
 
 // While the store is behind, connections that have sent messages are not read; others are.
@@ -237,36 +196,144 @@ TEST(LinuxIpcTest, AReplyTooLargeForAFrameClosesWithTheErrorFrame) {
             Value(static_cast<std::int64_t>(ConnectionError::kReplyTooLarge)));
 }
 
-TEST(LinuxIpcListenerSetupTest, StaleSocketFileIsReplaced) {
+// A socket file whose listener is gone (closed without unlinking) is replaced; a path that
+// is not a socket is refused and kept.
+TEST(LinuxIpcListenerSetupTest, StaleSocketsAreReplacedOtherFilesRefused) {
   TempDir dir;
-  const std::string path = dir.path() + "/reporting.sock";
-  // A socket file whose listener is gone (closed without unlinking).
-  const int stale = BindUnixSocket(SOCK_STREAM, path);
-  ASSERT_GE(stale, 0);
+  const std::string path = dir.File("reporting.sock");
+  const int stale = ::socket(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0);
+  sockaddr_un address{.sun_family = AF_UNIX, .sun_path = {}};
+  path.copy(address.sun_path, sizeof address.sun_path - 1);
+  ASSERT_EQ(::bind(stale, reinterpret_cast<sockaddr*>(&address), sizeof address), 0);
   ::close(stale);
-  auto log = std::make_shared<LogCapture>();
-  auto made = NewLinuxIpcListener(Options(path), log);
-  ASSERT_TRUE(made.listener) << made.error;
-  made.listener->SetDelegate(std::make_shared<FakeDelegate>());
-  std::thread thread([&] { made.listener->Resume(); });
-  auto client = Connect(path);
-  EXPECT_TRUE(client && client->createReportingSessionSync(1) == true);
-  made.listener->Stop();
-  thread.join();
-}
-
-TEST(LinuxIpcListenerSetupTest, PathThatIsNotASocketIsRefusedAndKept) {
-  TempDir dir;
-  const std::string path = dir.path() + "/reporting.sock";
-  int fd = ::open(path.c_str(), O_CREAT | O_WRONLY, 0600);
-  ASSERT_GE(fd, 0);
-  ::close(fd);
-  auto made = NewLinuxIpcListener(Options(path), std::make_shared<LogCapture>());
-  EXPECT_FALSE(made.listener);
-  EXPECT_NE(made.error.find("not a socket"), std::string::npos) << made.error;
+  {
+    ListenerHarness harness(nullptr, {}, path);
+    auto client = Connect(path);
+    EXPECT_TRUE(client && client->createReportingSessionSync(1) == true);
+  }
+  ::close(::open(path.c_str(), O_CREAT | O_WRONLY, 0600));
+  ListenerHarness refused(nullptr, {}, path);
+  EXPECT_FALSE(refused.listening());
+  EXPECT_NE(refused.error().find("not a socket"), std::string::npos) << refused.error();
   struct stat info;
   ASSERT_EQ(::lstat(path.c_str(), &info), 0);
   EXPECT_TRUE(S_ISREG(info.st_mode));
+}
+
+// The service's connection error frame reaches the client's handler; a reply of the wrong
+// type ends the connection with a local error, its callback never called.
+TEST(ClientTest, ErrorFramesAndBadRepliesEndTheConnectionWithTheirError) {
+  ListenerHarness harness([](Op, const Array&, IpcReply reply) { reply(Value("yes")); });
+  for (const bool bad_reply : {false, true}) {
+    auto client = Connect(harness.socket_path());
+    ASSERT_TRUE(client);
+    std::promise<client::ConnectionError> error;  // a second error would throw
+    client->SetConnectionErrorHandler(
+        [&](const client::ConnectionError& e) { error.set_value(e); });
+    bool called = false;
+    if (bad_reply) client->createReportingSession(1, [&](bool) { called = true; });
+    if (!bad_reply) client->SendRequest(static_cast<Op>(40), {}, nullptr);
+    EXPECT_TRUE(client->WaitUntilEnded());
+    const auto e = error.get_future().get();
+    EXPECT_EQ(e.domain, bad_reply ? client::kClientErrorDomain : protocol::kIpcErrorDomain);
+    EXPECT_EQ(e.code, bad_reply ? static_cast<std::int64_t>(client::ClientErrorCode::kBadReply)
+                                : static_cast<std::int64_t>(ConnectionError::kUnknownOp));
+    EXPECT_TRUE(bad_reply || e.message.find("40") != std::string::npos) << e.message;
+    EXPECT_FALSE(called);
+  }
+}
+
+TEST(ClientTest, PendingCallbacksAreDroppedWhenTheConnectionEnds) {
+  ListenerHarness harness([](Op, const Array&, IpcReply) {});  // never replies
+  auto client = Connect(harness.socket_path());
+  ASSERT_TRUE(client);
+  std::atomic<int> invalidations{0};
+  client->SetInvalidationHandler([&] { ++invalidations; });
+  auto token = std::make_shared<int>(0);
+  std::weak_ptr<int> watch = token;
+  client->createReportingSession(1, [token](bool) { ADD_FAILURE() << "no reply was sent"; });
+  token.reset();
+  EXPECT_EQ(client->outstanding(), 1u);
+  EXPECT_FALSE(client->WaitForReplies(std::chrono::milliseconds(50)));
+  harness.Stop();
+  EXPECT_TRUE(client->WaitUntilEnded());
+  EXPECT_EQ(invalidations, 1);
+  EXPECT_TRUE(watch.expired()) << "the callback was released";
+  EXPECT_FALSE(client->WaitForReplies()) << "the reply can no longer come";
+  EXPECT_EQ(client->createReportingSessionSync(2), std::nullopt);
+  client->Close();
+  EXPECT_EQ(invalidations, 1);
+}
+
+// A request too large for a frame is not sent; a blocking call from a callback (on the
+// connection's thread) returns instead of deadlocking.
+TEST(ClientTest, OversizedRequestsAndBlockingCallsFromCallbacksFailAtOnce) {
+  ListenerHarness harness;
+  auto client = Connect(harness.socket_path());
+  ASSERT_TRUE(client);
+  Value huge(Dictionary{{"blob", std::string(protocol::kMaxBodyBytes, 'x')}});
+  EXPECT_EQ(client->sendMessage(huge, 1, 1, std::nullopt, nullptr), 0u);
+  EXPECT_EQ(client->outstanding(), 0u);
+  std::promise<std::optional<bool>> inner;
+  client->createReportingSession(1, [&](bool) {
+    inner.set_value(client->createReportingSessionSync(2, std::chrono::seconds(30)));
+  });
+  auto future = inner.get_future();
+  ASSERT_EQ(future.wait_for(std::chrono::seconds(20)), std::future_status::ready);
+  EXPECT_EQ(future.get(), std::nullopt);
+}
+
+TEST(CApiTest, EveryOperationFromC) {
+  ListenerHarness harness([](protocol::Op op, const Array& args, IpcReply reply) {
+    // sendMessage without reporter IDs is refused, as with reporting disabled.
+    if (op == protocol::Op::kSendMessage && args[3].is_null()) {
+      reply(Value(Dictionary{
+          {"domain", "com.norvel.audio.reporting"}, {"code", 1}, {"userInfo", Value()}}));
+      return;
+    }
+    FakeExportedObject::DefaultReply(op, args, reply);
+  });
+  EXPECT_EQ(qn_c_api_round_trip(harness.socket_path().c_str()), 0);
+  EXPECT_TRUE(Eventually([&] { return harness.delegate().invalidations() == 1; }));
+}
+
+TEST(CApiTest, ConnectFailureDescribesTheProblem) {
+  TempDir dir;
+  char error[256] = "untouched";
+  const std::string path = dir.path() + "/none.sock";
+  EXPECT_EQ(qn_client_connect(path.c_str(), error, sizeof error), nullptr);
+  EXPECT_NE(std::string(error).find("none.sock"), std::string::npos) << error;
+  qn_client_free(nullptr);
+  EXPECT_EQ(qn_client_create_session(nullptr, 1, 0), QN_BAD_ARGUMENT);
+}
+
+TEST(PathsTest, HomeRootAndOtherUsersFolders) {
+  PathEnvironment root;                  // uid 0
+  root.xdg_runtime_dir = "/run/user/0";  // ignored for root
+  PathEnvironment user{.uid = 1000,
+                       .xdg_runtime_dir = "/run/user/1000",
+                       .xdg_state_home = "/home/u/.state",
+                       .home = "/home/u"};
+  PathEnvironment bare = user;  // without the XDG variables
+  bare.xdg_runtime_dir = bare.xdg_state_home = std::nullopt;
+  const struct {
+    Paths paths;
+    const char *runtime, *state, *log;
+  } rows[] = {
+      {ResolvePaths(PathOptions{"/srv/q/", std::nullopt}, root), "/srv/q/run", "/srv/q/state",
+       "/srv/q/log"},
+      {ResolvePaths({}, root), "/run/quenta", "/var/lib/quenta", "/var/log/quenta"},
+      {ResolvePaths({}, user), "/run/user/1000/quenta", "/home/u/.state/quenta",
+       "/home/u/.state/quenta/log"},
+      {ResolvePaths({}, bare), "/tmp/quenta-1000", "/home/u/.local/state/quenta",
+       "/home/u/.local/state/quenta/log"},
+  };
+  for (const auto& row : rows) {
+    EXPECT_EQ(row.paths.runtime_dir, row.runtime);
+    EXPECT_EQ(row.paths.state_dir, row.state);
+    EXPECT_EQ(row.paths.log_dir, row.log);
+    EXPECT_EQ(row.paths.socket_path, std::string(row.runtime) + "/reporting.sock");
+  }
 }
 
 }  // namespace
