@@ -39,6 +39,9 @@ class RawConnection {
   }
   bool connected() const { return connected_; }
 
+  // Ends this side's stream (the peer reads end of stream); replies can still be read.
+  void EndStream() { ::shutdown(fd_, SHUT_WR); }
+
   // Writes every byte (false when the peer closed first).
   bool Write(const std::string& bytes) {
     for (std::size_t done = 0; done < bytes.size();) {

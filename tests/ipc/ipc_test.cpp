@@ -196,6 +196,34 @@ TEST(LinuxIpcTest, AReplyTooLargeForAFrameClosesWithTheErrorFrame) {
             Value(static_cast<std::int64_t>(ConnectionError::kReplyTooLarge)));
 }
 
+// A peer that ends its stream right after its requests still gets their replies, even
+// those made after the end of stream was read, and then the close.
+TEST(LinuxIpcTest, APeerThatEndsItsStreamIsAnsweredBeforeTheClose) {
+  std::mutex mu;
+  std::vector<IpcReply> kept;
+  ListenerHarness harness([&](Op op, const Array& args, IpcReply reply) {
+    if (args[0] == Value(1)) return FakeExportedObject::DefaultReply(op, args, reply);
+    std::lock_guard lock(mu);
+    kept.push_back(std::move(reply));
+  });
+  RawConnection raw(harness.socket_path());
+  ASSERT_TRUE(raw.Write(RawConnection::Frame(Value(Array{9, 1, 1}))) && raw.ReadFrame());
+  auto object = harness.delegate().accepted().at(0).object.lock();
+  object->HoldTakenIn(true);
+  ASSERT_TRUE(raw.Write(ValidRequests(2, 10)));
+  raw.EndStream();
+  ASSERT_TRUE(Eventually([&] { return object->requests == 10; }));
+  std::this_thread::sleep_for(std::chrono::milliseconds(50));  // the end of stream is read
+  {
+    std::lock_guard lock(mu);
+    for (auto& reply : kept) reply(Value(true));
+  }
+  object->HoldTakenIn(false);
+  bool closed = false;
+  EXPECT_EQ(raw.ReadUntilClosed(&closed).size(), 9u);
+  EXPECT_TRUE(closed);
+}
+
 // A socket file whose listener is gone (closed without unlinking) is replaced; a path that
 // is not a socket is refused and kept.
 TEST(LinuxIpcListenerSetupTest, StaleSocketsAreReplacedOtherFilesRefused) {

@@ -171,6 +171,29 @@ TEST(LinuxDispatchTest, SuspendedQueuesHoldNoThread) {
   EXPECT_TRUE(held_ran.WaitFor(kQueues));
 }
 
+// AsyncOrRun runs a task at once, on the caller's thread, as the queue's task, only when the
+// queue is idle; behind a suspension (or queued work) it waits its turn like Async.
+TEST(LinuxDispatchTest, AsyncOrRunRunsAtOnceOnlyOnAnIdleQueue) {
+  auto dispatcher = NewLinuxDispatcher({.threads = 2});
+  auto queue = dispatcher->CreateSerialQueue("q", QualityOfService::kUserInteractive);
+  std::vector<int> order;  // written by the queue's tasks only
+  bool current = false;
+  queue->AsyncOrRun([&] {
+    current = queue->IsCurrent();
+    order.push_back(1);
+  });
+  EXPECT_TRUE(current);
+  queue->Suspend();
+  queue->AsyncOrRun([&] { order.push_back(2); });
+  EXPECT_EQ(order.size(), 1u);
+  queue->AsyncOrRun([&] { order.push_back(3); });
+  Counter done;
+  queue->Async([&] { done.Add(); });
+  queue->Resume();
+  ASSERT_TRUE(done.WaitFor(1));
+  EXPECT_EQ(order, (std::vector<int>{1, 2, 3}));
+}
+
 // A queue with a long backlog runs a bounded batch per turn, so that another queue gets the
 // only thread before the backlog is done.
 TEST(LinuxDispatchTest, BusyQueueYieldsToOthersOnASingleThread) {
