@@ -137,14 +137,7 @@ class LinuxSerialQueue final : public SerialQueue,
     tls_current_queue = this;
     task();
     tls_current_queue = outer;
-    {
-      std::lock_guard lock(mu_);
-      if (suspended_ > 0 || tasks_.empty()) {
-        scheduled_ = false;
-        return;
-      }
-    }
-    Schedule();  // what arrived meanwhile runs on the pool
+    EndTurn();  // what arrived meanwhile runs on the pool
   }
 
   void AsyncAfter(Duration delay, Task task) override {
@@ -209,6 +202,11 @@ class LinuxSerialQueue final : public SerialQueue,
       task();
     }
     tls_current_queue = outer;
+    EndTurn();  // more work: go to the back of the pool's line
+  }
+
+  // Ends a turn: lets the queue go when it has nothing to run, else posts the next turn.
+  void EndTurn() {
     {
       std::lock_guard lock(mu_);
       if (suspended_ > 0 || tasks_.empty()) {
@@ -216,7 +214,7 @@ class LinuxSerialQueue final : public SerialQueue,
         return;
       }
     }
-    Schedule();  // more work: go to the back of the pool's line
+    Schedule();
   }
 
   const std::shared_ptr<Core> core_;
