@@ -64,8 +64,8 @@ class FakeOstrel final : public Ostrel {
     if (subscription == nullptr) return fail(EBADF);
     Dictionary samples;
     for (const auto& [key, entry] : subscribed) {
-      auto field = [&](const char* name) {
-        const Value* v = entry.as_dictionary() ? entry.as_dictionary()->Find(name) : nullptr;
+      auto field = [d = entry.as_dictionary()](const char* name) {
+        const Value* v = d ? d->Find(name) : nullptr;
         return v && v->as_string() ? *v->as_string() : std::string();
       };
       const std::string g = field("group"), s = field("subgroup");

@@ -133,7 +133,8 @@ class FakeNotify final : public Notify {
                          std::function<void(int token)> handler, int* token) override {
     std::lock_guard lock(mu_);
     if (fail_status_ != 0) return fail_status_;
-    auto r = std::make_shared<Registration>(name, std::move(queue), std::move(handler), next_++);
+    std::shared_ptr<Registration> r(
+        new Registration{name, std::move(queue), std::move(handler), next_++});
     registrations_[r->token] = r;
     if (token) *token = r->token;
     return 0;
