@@ -42,7 +42,11 @@ redis() {
   [ "$aof" = everysec ] && extra=(--appendonly yes --appendfsync everysec)
   redis-server --port 0 --unixsocket "$dir/sock" --save '' "${extra[@]}" --dir "$dir" \
     --daemonize yes --pidfile "$work/redis.pid" --logfile "$dir/log"
-  for _ in $(seq 100); do [ -S "$dir/sock" ] && break; sleep 0.05; done
+  # Ready once it answers (with AOF on it first loads its files and answers LOADING).
+  for _ in $(seq 200); do
+    [ -S "$dir/sock" ] && [ "$(redis-cli -s "$dir/sock" ping 2>/dev/null)" = PONG ] && break
+    sleep 0.05
+  done
   local pid; pid=$(cat "$work/redis.pid")
   local ticks; ticks=$(getconf CLK_TCK)
   local before; before=$(awk '{print $14+$15}' "/proc/$pid/stat")
