@@ -370,9 +370,12 @@ void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
   std::string messageID = messageIdForCategory(category, type);
 
   Counters& counters = *platform_->counters;
+  // A stopped session aggregates nothing: its payload's size is not worth measuring.
+  const auto array = aggregatedPayloadData();
   const AppendResult aggregated =
-      Append(aggregatedPayloadData(), Value(converted), Value(converted).ApproximateBytes(),
-             platform_->max_aggregated_bytes, platform_->max_aggregated_bytes_total);
+      array ? Append(array, Value(converted), Value(converted).ApproximateBytes(),
+                     platform_->max_aggregated_bytes, platform_->max_aggregated_bytes_total)
+            : AppendResult::kGone;
   if (aggregated == AppendResult::kAppended) {
     Append(nestedAggregatedPayloadData(), Value(Dictionary{{Value(messageID), Value(converted)}}));
   } else if (aggregated != AppendResult::kGone) {

@@ -23,27 +23,19 @@
 // Every fake is thread-safe.
 namespace qn::testing {
 
-// Records each event as sent; the payload provider runs at once, outside the lock (it may
-// send events itself); an empty provider gives a null payload.
-class FakeAnalytics final : public Analytics {
+// A thread-safe list of the events a recording fake has been handed.
+template <typename Event>
+class EventRecord {
  public:
-  struct Event {
-    std::string name;
-    Value payload;
-  };
-  void SendEventLazy(const std::string& name, PayloadProvider provider) override {
-    Value payload = provider ? provider() : Value();
-    std::lock_guard lock(mu_);
-    events_.push_back({name, std::move(payload)});
-  }
   std::vector<Event> Events() const {
     std::lock_guard lock(mu_);
     return events_;
   }
-  std::vector<Event> EventsNamed(const std::string& name) const {
-    auto events = Events();
-    std::erase_if(events, [&](const Event& e) { return e.name != name; });
-    return events;
+
+ protected:
+  void Record(Event event) {
+    std::lock_guard lock(mu_);
+    events_.push_back(std::move(event));
   }
 
  private:
@@ -51,27 +43,40 @@ class FakeAnalytics final : public Analytics {
   std::vector<Event> events_;
 };
 
-// Records every power-log event.
-class FakeEnerdex final : public Enerdex {
+struct AnalyticsEvent {
+  std::string name;
+  Value payload;
+};
+
+// Records each event as sent; the payload provider runs at once, outside the lock (it may
+// send events itself); an empty provider gives a null payload.
+class FakeAnalytics final : public Analytics, public EventRecord<AnalyticsEvent> {
  public:
-  struct Event {
-    std::int32_t subsystem = 0;
-    std::string name;
-    Value payload, options;
-  };
+  using Event = AnalyticsEvent;
+  void SendEventLazy(const std::string& name, PayloadProvider provider) override {
+    Record({name, provider ? provider() : Value()});
+  }
+  std::vector<Event> EventsNamed(const std::string& name) const {
+    auto events = Events();
+    std::erase_if(events, [&](const Event& e) { return e.name != name; });
+    return events;
+  }
+};
+
+struct PowerLogEvent {
+  std::int32_t subsystem = 0;
+  std::string name;
+  Value payload, options;
+};
+
+// Records every power-log event.
+class FakeEnerdex final : public Enerdex, public EventRecord<PowerLogEvent> {
+ public:
+  using Event = PowerLogEvent;
   void LogRegisteredEvent(std::int32_t subsystem, const std::string& name, Value payload,
                           Value options) override {
-    std::lock_guard lock(mu_);
-    events_.push_back({subsystem, name, std::move(payload), std::move(options)});
+    Record({subsystem, name, std::move(payload), std::move(options)});
   }
-  std::vector<Event> Events() const {
-    std::lock_guard lock(mu_);
-    return events_;
-  }
-
- private:
-  mutable std::mutex mu_;
-  std::vector<Event> events_;
 };
 
 // In-memory suites; OpenSuite takes a snapshot and reads values as the Linux suites do (the
