@@ -189,6 +189,12 @@ class Checkpointer {
     DbHandle db(raw);
     if (rc != SQLITE_OK) return nullptr;
     sqlite3_busy_timeout(db.get(), busy_timeout_ms);
+    // A connection learns that the database is in WAL mode when it first reads it; until
+    // then a checkpoint through it does nothing at all and the WAL grows without end.
+    if (sqlite3_exec(db.get(), "SELECT count(*) FROM sqlite_schema", nullptr, nullptr, nullptr) !=
+        SQLITE_OK) {
+      return nullptr;
+    }
     return std::unique_ptr<Checkpointer>(new Checkpointer(std::move(db)));
   }
 
@@ -198,7 +204,7 @@ class Checkpointer {
       std::lock_guard lock(mu_);
       stop_ = true;
     }
-    cv_.notify_one();
+    cv_.notify_all();
     thread_.join();
   }
 
@@ -208,7 +214,15 @@ class Checkpointer {
       std::lock_guard lock(mu_);
       due_ = true;
     }
-    cv_.notify_one();
+    cv_.notify_all();
+  }
+
+  // Waits for the checkpoint in progress, if any, and drops a due one: the caller is about
+  // to checkpoint through its own connection.
+  void Yield() {
+    std::unique_lock lock(mu_);
+    due_ = false;
+    cv_.wait(lock, [&] { return !running_; });
   }
 
  private:
@@ -220,23 +234,34 @@ class Checkpointer {
       cv_.wait(lock, [&] { return due_ || stop_; });
       if (stop_) return;
       due_ = false;
+      running_ = true;
       lock.unlock();
       // PASSIVE: copies what it can without waiting for the writer, which goes on.
       sqlite3_wal_checkpoint_v2(db_.get(), nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
       lock.lock();
+      running_ = false;
+      cv_.notify_all();
     }
   }
 
   DbHandle db_;
   std::mutex mu_;
   std::condition_variable cv_;
-  bool due_ = false;   // guarded by mu_
-  bool stop_ = false;  // guarded by mu_
+  bool due_ = false;      // guarded by mu_
+  bool stop_ = false;     // guarded by mu_
+  bool running_ = false;  // guarded by mu_
   std::thread thread_;
 };
 
 // WAL pages after which a checkpoint is due (SQLite's own default).
 constexpr int kCheckpointPages = 1000;
+// WAL pages after which the writer finishes the checkpoint itself between two transactions.
+// While records keep coming, the checkpointer never catches up with the last commit, and
+// SQLite starts the WAL over only once every frame in it has been copied: without this the
+// WAL of a long burst grows by every byte written. The writer copies only what the
+// checkpointer left (the last few commits), so the pause is short. 4096 pages of 16 KiB are
+// the 64 MiB the WAL is cut back to (journal_size_limit).
+constexpr int kWrapPages = 4096;
 
 class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreWriter> {
  public:
@@ -287,11 +312,13 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
       sqlite3_wal_autocheckpoint(db_.get(), 0);
       sqlite3_wal_hook(
           db_.get(),
-          [](void* checkpointer, sqlite3*, const char*, int pages) {
-            if (pages >= kCheckpointPages) static_cast<Checkpointer*>(checkpointer)->Wake();
+          [](void* writer, sqlite3*, const char*, int pages) {
+            auto* self = static_cast<ReportingStoreWriter*>(writer);
+            self->wal_pages_ = pages;
+            if (pages >= kCheckpointPages) self->checkpointer_->Wake();
             return SQLITE_OK;
           },
-          checkpointer_.get());
+          this);
     }
     return std::nullopt;
   }
@@ -397,6 +424,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
       }
       if (dropped > 0) LogQueueFull(dropped);
 
+      if (wal_pages_ >= kWrapPages) FinishCheckpoint();
       std::optional<Error> error = WriteBatch(batch);
       RunCallbacks(batch, error);
 
@@ -433,6 +461,17 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
       exited_ = true;
     }
     written_cv_.notify_all();
+  }
+
+  // Copies what is left of the WAL into the database, so that the next commit starts the
+  // WAL over. When a reader still holds old frames, the next batch tries again.
+  void FinishCheckpoint() {
+    checkpointer_->Yield();
+    int wal_frames = 0;
+    int copied = 0;
+    const int rc = sqlite3_wal_checkpoint_v2(db_.get(), nullptr, SQLITE_CHECKPOINT_PASSIVE,
+                                             &wal_frames, &copied);
+    if (rc == SQLITE_OK && copied == wal_frames) wal_pages_ = 0;
   }
 
   void CloseDatabase() {
@@ -648,6 +687,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   // Writer-thread state: the connection, its statements, the JSON buffers.
   DbHandle db_;
   std::unique_ptr<Checkpointer> checkpointer_;  // writer thread (set before it starts)
+  int wal_pages_ = 0;  // writer thread: frames in the WAL after the last commit
   Statement begin_, commit_, rollback_;
   Statement insert_session_, flush_session_, insert_message_, insert_single_;
   Statement insert_analytics_, insert_powerlog_;

@@ -8,6 +8,7 @@
 
 #include <atomic>
 #include <condition_variable>
+#include <filesystem>
 #include <fstream>
 #include <future>
 #include <mutex>
@@ -170,6 +171,19 @@ TEST_F(ReportingStoreTest, FullQueueDropsCountsAndLogsWithoutBlocking) {
   auto rows = ReadRows(db_path_);
   ASSERT_EQ(rows.size(), 10u);
   EXPECT_EQ(rows.back().payload, "9");
+}
+
+// The WAL is copied into the database while the writer goes on, and a long burst does not
+// grow it past the 64 MiB it is cut back to.
+TEST_F(ReportingStoreTest, ALongBurstKeepsTheWalBounded) {
+  auto store = OpenStore();
+  const std::string big(128 * 1024, 'x');
+  for (int batch = 0; batch < 100; ++batch) {  // 100 MiB, a batch at a time
+    for (int i = 0; i < 8; ++i) store->AddPowerLogEvent(1, "burst", Value(big));
+    store->Drain();
+  }
+  EXPECT_LT(std::filesystem::file_size(db_path_ + "-wal"), 80u << 20);
+  EXPECT_GT(std::filesystem::file_size(db_path_), 20u << 20);
 }
 
 TEST_F(ReportingStoreTest, AfterCloseRecordsAreRefusedCallbacksStillRun) {
