@@ -10,17 +10,23 @@
 
 namespace qn {
 
-void QNReportingStatlynBridge::handleEvent(const Platform& platform, const Dictionary* message,
+void QNReportingStatlynBridge::handleEvent(const Platform& platform,
+                                           const std::shared_ptr<const Dictionary>& message,
                                            std::uint32_t category, std::uint16_t type,
                                            const QNReportingSession* session) {
   if (!platform.analytics) return;
-  Dictionary payload = message ? *message : Dictionary();
   std::shared_ptr<const Dictionary> userInfo = session ? session->userInfo() : nullptr;
-  payload.Set("HostApplicationDisplayID", QNReportingHostApplicationName(userInfo));
-  const std::string name = StringWithFormat(
-      "com.norvel.quenta.%@.%@", QNReportingCategoryName(category), QNReportingTypeName(type));
-  auto shared = std::make_shared<const Dictionary>(std::move(payload));
-  platform.analytics->SendEventLazy(name, [shared] { return Value(shared); });
+  std::string host = QNReportingHostApplicationName(userInfo.get());
+  // "com.norvel.quenta.%@.%@" of the two names, once per message: plain concatenation.
+  std::string name = "com.norvel.quenta.";
+  name += QNReportingCategoryName(category);
+  name += '.';
+  name += QNReportingTypeName(type);
+  platform.analytics->SendEventLazy(name, [message, host = std::move(host)] {
+    Dictionary payload = message ? *message : Dictionary();
+    payload.Set("HostApplicationDisplayID", host);
+    return Value(std::move(payload));
+  });
 }
 
 }  // namespace qn

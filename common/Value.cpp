@@ -407,12 +407,22 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
 }
 
 const Value* Dictionary::Find(const Value& key) const {
+  if (const std::string* text = key.as_string(); text && index_.empty()) return Find(*text);
   if (!index_.empty()) {
     auto it = index_.find(key);
     return it == index_.end() ? nullptr : &entries_[it->second].second;
   }
   for (const auto& e : entries_) {
     if (e.first == key) return &e.second;
+  }
+  return nullptr;
+}
+
+// Keys are nearly always strings: a small dictionary compares them without making a Value.
+const Value* Dictionary::Find(std::string_view key) const {
+  if (!index_.empty()) return Find(Value(key));
+  for (const auto& e : entries_) {
+    if (const std::string* text = e.first.as_string(); text && *text == key) return &e.second;
   }
   return nullptr;
 }

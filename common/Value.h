@@ -149,9 +149,9 @@ class Dictionary {
 
   // The value stored under key, or nullptr.
   const Value* Find(const Value& key) const;
-  const Value* Find(std::string_view key) const { return Find(Value(key)); }
-  const Value* Find(const std::string& key) const { return Find(Value(key)); }
-  const Value* Find(const char* key) const { return Find(Value(key)); }
+  const Value* Find(std::string_view key) const;
+  const Value* Find(const std::string& key) const { return Find(std::string_view(key)); }
+  const Value* Find(const char* key) const { return Find(std::string_view(key)); }
   bool Contains(const Value& key) const { return Find(key) != nullptr; }
   bool Contains(std::string_view key) const { return Find(key) != nullptr; }
   bool Contains(const std::string& key) const { return Find(key) != nullptr; }

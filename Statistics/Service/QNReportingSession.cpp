@@ -129,8 +129,7 @@ QNReportingSession::QNReportingSession(Token, std::shared_ptr<const Platform> pl
       serviceName_(std::make_shared<const std::string>("unknown")),
       userInfo_(std::make_shared<const Dictionary>()),
       aggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>(platform_->counters)),
-      nestedAggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>()),
-      messageTypeCounts_(std::make_shared<const Dictionary>()) {}
+      nestedAggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>()) {}
 
 QNReportingSession::~QNReportingSession() {
   TracePoint(*platform_, kTraceSessionDestroyed);
@@ -323,17 +322,19 @@ void QNReportingSession::setServiceType(std::uint16_t serviceType) {
 }
 
 std::string QNReportingSession::messageIdForCategory(std::uint32_t category, std::uint16_t type) {
-  std::string key =
-      StringWithFormat("%@_%@", QNReportingCategoryName(category), QNReportingTypeName(type));
-  // Copy-on-write: readers on other threads keep the snapshot they fetched.
-  auto counts = std::make_shared<Dictionary>(*messageTypeCounts());
+  // Once per message: plain concatenation ("%@_%@" of the two names, then of the count).
+  std::string key = QNReportingCategoryName(category);
+  key += '_';
+  key += QNReportingTypeName(type);
   std::int64_t count = 1;
-  if (const Value* stored = counts->Find(key); stored && stored->is_number()) {
+  if (const Value* stored = messageTypeCounts_.Find(key); stored && stored->is_number()) {
     count = static_cast<std::int64_t>(stored->as_double().value_or(0)) + 1;
   }
-  counts->Set(Value(key), Value(count));
-  messageTypeCounts_.store(std::move(counts));
-  return StringWithFormat("%@_%@", key, count);
+  std::string id = key;
+  id += '_';
+  id += std::to_string(count);
+  messageTypeCounts_.Set(Value(std::move(key)), Value(count));
+  return id;
 }
 
 // ---------------------------------------------------------------------------------------

@@ -211,8 +211,8 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   void setNestedAggregatedPayloadData(std::shared_ptr<QNReportingPayloadArray> a) {
     nestedAggregatedPayloadData_.store(std::move(a));
   }
-  // "category_type" name -> count. Never null.
-  std::shared_ptr<const Dictionary> messageTypeCounts() const { return messageTypeCounts_.load(); }
+  // "category_type" name -> count. Read and written on the server queue only.
+  const Dictionary& messageTypeCounts() const { return messageTypeCounts_; }
   // "QNReportingService <reporterID>" while orientation callbacks are registered.
   std::optional<std::string> orientationCallbackID() const;
   // When the session last started while reporting orientation.
@@ -270,7 +270,7 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   session_detail::AtomicShared<const TransactionCompleteBlock> transactionCompleteBlock_;
   session_detail::AtomicShared<QNReportingPayloadArray> aggregatedPayloadData_;
   session_detail::AtomicShared<QNReportingPayloadArray> nestedAggregatedPayloadData_;
-  session_detail::AtomicShared<const Dictionary> messageTypeCounts_;
+  Dictionary messageTypeCounts_;  // server queue only, hence no lock
   session_detail::AtomicShared<const std::string> orientationCallbackID_;
   session_detail::AtomicShared<const std::chrono::system_clock::time_point> startDate_;
   session_detail::AtomicShared<LivoReportingSession> livoReportingSession_;

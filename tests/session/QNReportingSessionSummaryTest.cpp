@@ -82,7 +82,7 @@ TEST_F(SummaryTest, SummaryJoinsValuesPerKeyAndGoesOutBeforeTheFlush) {
   EXPECT_EQ(event.category, 0xFFFF);
   EXPECT_EQ(event.type, 0xFFFF);
   EXPECT_EQ(event.payload, Value(expected));
-  EXPECT_EQ(*session->messageTypeCounts()->Find("Undefined_Unknown"), Value(1));
+  EXPECT_EQ(*session->messageTypeCounts().Find("Undefined_Unknown"), Value(1));
 }
 
 TEST_F(SummaryTest, InternalBuildWritesPrettyJsonWithUserInfoFirstInsideItsFolder) {

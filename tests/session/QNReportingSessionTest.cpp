@@ -26,7 +26,7 @@ TEST_F(SessionTest, MessageIdentifiersCountPerPair) {
   EXPECT_EQ(session->messageIdForCategory(0x10000008, 4), "DSP_Error_Error_1");
   EXPECT_EQ(session->messageIdForCategory(0x00000005, 1), "Setup_Start_3");
   EXPECT_EQ(session->messageIdForCategory(0xFFFFFFFF, 0xFFFF), "Undefined_Unknown_1");
-  EXPECT_EQ(*session->messageTypeCounts(),
+  EXPECT_EQ(session->messageTypeCounts(),
             (Dictionary{{"Setup_Start", 3}, {"DSP_Error_Error", 1}, {"Undefined_Unknown", 1}}));
 }
 
@@ -190,7 +190,7 @@ TEST_F(SessionTest, MessageBeforeStartIsCountedDiscardedAndSentSingle) {
   session->start();
   EXPECT_TRUE(session->aggregatedPayloadData()->Snapshot().empty());
   EXPECT_TRUE(session->nestedAggregatedPayloadData()->Snapshot().empty());
-  EXPECT_EQ(*session->messageTypeCounts(), (Dictionary{{"_Setup_Start", 1}}));
+  EXPECT_EQ(session->messageTypeCounts(), (Dictionary{{"_Setup_Start", 1}}));
   t_.dispatcher->RunUntilIdle();
 
   EXPECT_TRUE(t_.livo->AllSessionMessages().empty());
