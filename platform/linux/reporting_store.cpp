@@ -179,6 +179,9 @@ const char* KindName(RecordKind kind) {
 // the writer's commits never wait for a checkpoint (which fsyncs the database and, after a
 // burst, copies tens of megabytes: long enough to stall every client the store holds back).
 // The writer turns its own automatic checkpoints off and wakes this one from its WAL hook.
+// WAL pages not yet copied after which a checkpoint is due (SQLite's own default).
+constexpr int kCheckpointPages = 1000;
+
 class Checkpointer {
  public:
   // Null when the second connection cannot be opened (the writer then checkpoints itself).
@@ -208,10 +211,16 @@ class Checkpointer {
     thread_.join();
   }
 
-  // Any thread: a checkpoint is due.
-  void Wake() {
+  // Writer thread, after each commit that left `wal_frames` in the WAL: wakes the thread
+  // once kCheckpointPages of them wait to be copied. (Waking it after every commit made it
+  // copy a commit or two and fsync the database over a hundred times a second.)
+  void Committed(int wal_frames) {
+    int copied = copied_.load(std::memory_order_relaxed);
+    if (wal_frames < copied) copied = 0;  // the WAL has started over
+    if (wal_frames - copied < kCheckpointPages) return;
     {
       std::lock_guard lock(mu_);
+      if (running_) return;  // it looks again when that checkpoint is done
       due_ = true;
     }
     cv_.notify_all();
@@ -237,7 +246,12 @@ class Checkpointer {
       running_ = true;
       lock.unlock();
       // PASSIVE: copies what it can without waiting for the writer, which goes on.
-      sqlite3_wal_checkpoint_v2(db_.get(), nullptr, SQLITE_CHECKPOINT_PASSIVE, nullptr, nullptr);
+      int wal_frames = 0;
+      int copied = 0;
+      if (sqlite3_wal_checkpoint_v2(db_.get(), nullptr, SQLITE_CHECKPOINT_PASSIVE, &wal_frames,
+                                    &copied) == SQLITE_OK) {
+        copied_.store(copied, std::memory_order_relaxed);
+      }
       lock.lock();
       running_ = false;
       cv_.notify_all();
@@ -247,14 +261,13 @@ class Checkpointer {
   DbHandle db_;
   std::mutex mu_;
   std::condition_variable cv_;
-  bool due_ = false;      // guarded by mu_
-  bool stop_ = false;     // guarded by mu_
-  bool running_ = false;  // guarded by mu_
+  bool due_ = false;            // guarded by mu_
+  bool stop_ = false;           // guarded by mu_
+  bool running_ = false;        // guarded by mu_
+  std::atomic<int> copied_{0};  // WAL frames the last checkpoint left copied
   std::thread thread_;
 };
 
-// WAL pages after which a checkpoint is due (SQLite's own default).
-constexpr int kCheckpointPages = 1000;
 // WAL pages after which the writer finishes the checkpoint itself between two transactions.
 // While records keep coming, the checkpointer never catches up with the last commit, and
 // SQLite starts the WAL over only once every frame in it has been copied: without this the
@@ -315,7 +328,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
           [](void* writer, sqlite3*, const char*, int pages) {
             auto* self = static_cast<ReportingStoreWriter*>(writer);
             self->wal_pages_ = pages;
-            if (pages >= kCheckpointPages) self->checkpointer_->Wake();
+            self->checkpointer_->Committed(pages);
             return SQLITE_OK;
           },
           this);
