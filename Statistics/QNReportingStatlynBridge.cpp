@@ -10,23 +10,24 @@
 
 namespace qn {
 
-void QNReportingStatlynBridge::handleEvent(const Platform& platform,
-                                           const std::shared_ptr<const Dictionary>& message,
+void QNReportingStatlynBridge::handleEvent(const Platform& platform, const Dictionary* message,
                                            std::uint32_t category, std::uint16_t type,
                                            const QNReportingSession* session) {
   if (!platform.analytics) return;
+  // Room for the host entry first: the copy assigned into it keeps that capacity, so adding
+  // the entry does not move every other one.
+  Dictionary payload;
+  payload.Reserve((message ? message->size() : 0) + 1);
+  if (message) payload = *message;
   std::shared_ptr<const Dictionary> userInfo = session ? session->userInfo() : nullptr;
-  std::string host = QNReportingHostApplicationName(userInfo.get());
+  payload.Set("HostApplicationDisplayID", QNReportingHostApplicationName(userInfo.get()));
   // "com.norvel.quenta.%@.%@" of the two names, once per message: plain concatenation.
   std::string name = "com.norvel.quenta.";
   name += QNReportingCategoryName(category);
   name += '.';
   name += QNReportingTypeName(type);
-  platform.analytics->SendEventLazy(name, [message, host = std::move(host)] {
-    Dictionary payload = message ? *message : Dictionary();
-    payload.Set("HostApplicationDisplayID", host);
-    return Value(std::move(payload));
-  });
+  auto shared = std::make_shared<const Dictionary>(std::move(payload));
+  platform.analytics->SendEventLazy(name, [shared] { return Value(shared); });
 }
 
 }  // namespace qn

@@ -1,7 +1,6 @@
 #pragma once
 
 #include <cstdint>
-#include <memory>
 
 #include "common/Value.h"
 #include "platform/platform.h"
@@ -17,13 +16,12 @@ class QNReportingStatlynBridge {
   // Sends the analytics event "com.norvel.quenta.<category name>.<type name>" whose payload
   // is a copy of `message` (null = empty) with "HostApplicationDisplayID" set to the host
   // application name of `session` (null session, or none in its user info: "Unknown").
-  // Every category and type is forwarded; nothing is logged. `message` is immutable, so the
-  // copy is made by the event's payload provider, when the sink wants the payload, and
-  // holds the message as it was at the call. Does nothing when the platform has no
-  // analytics sink.
-  static void handleEvent(const Platform& platform,
-                          const std::shared_ptr<const Dictionary>& message, std::uint32_t category,
-                          std::uint16_t type, const QNReportingSession* session);
+  // Every category and type is forwarded; nothing is logged. The copy is made before the
+  // call returns, so later changes to `message` do not reach the event. Does nothing when
+  // the platform has no analytics sink.
+  static void handleEvent(const Platform& platform, const Dictionary* message,
+                          std::uint32_t category, std::uint16_t type,
+                          const QNReportingSession* session);
 
   QNReportingStatlynBridge() = delete;
 };

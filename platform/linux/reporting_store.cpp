@@ -226,6 +226,12 @@ class Checkpointer {
     cv_.notify_all();
   }
 
+  // Whether no checkpoint runs or is due.
+  bool Idle() {
+    std::lock_guard lock(mu_);
+    return !running_ && !due_;
+  }
+
   // Waits for the checkpoint in progress, if any, and drops a due one: the caller is about
   // to checkpoint through its own connection.
   void Yield() {
@@ -477,8 +483,12 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   }
 
   // Copies what is left of the WAL into the database, so that the next commit starts the
-  // WAL over. When a reader still holds old frames, the next batch tries again.
+  // WAL over (the commits wait meanwhile, mostly for the fsyncs). While the checkpointer is
+  // at work the writer goes on and looks again at the next batch; only a WAL twice past
+  // kWrapPages (a disk slower than the writer) makes it wait for that checkpoint. When a
+  // reader still holds old frames, the next batch tries again.
   void FinishCheckpoint() {
+    if (wal_pages_ < 2 * kWrapPages && !checkpointer_->Idle()) return;
     checkpointer_->Yield();
     int wal_frames = 0;
     int copied = 0;
