@@ -278,8 +278,8 @@ class Checkpointer {
 // While records keep coming, the checkpointer never catches up with the last commit, and
 // SQLite starts the WAL over only once every frame in it has been copied: without this the
 // WAL of a long burst grows by every byte written. The writer copies only what the
-// checkpointer left (the last few commits), so the pause is short. 4096 pages of 16 KiB are
-// the 64 MiB the WAL is cut back to (journal_size_limit).
+// checkpointer left; its pause is mostly the fsync of the database. 4096 pages of 16 KiB
+// are the 64 MiB the WAL is cut back to (journal_size_limit).
 constexpr int kWrapPages = 4096;
 
 class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreWriter> {
