@@ -174,16 +174,17 @@ TEST_F(ReportingStoreTest, FullQueueDropsCountsAndLogsWithoutBlocking) {
 }
 
 // The WAL is copied into the database while the writer goes on, and a long burst does not
-// grow it past the 64 MiB it is cut back to.
+// grow it past twice the 64 MiB it is cut back to (the writer wraps it when the
+// checkpointer is idle, and at the latest there).
 TEST_F(ReportingStoreTest, ALongBurstKeepsTheWalBounded) {
   auto store = OpenStore();
   const std::string big(128 * 1024, 'x');
-  for (int batch = 0; batch < 100; ++batch) {  // 100 MiB, a batch at a time
+  for (int batch = 0; batch < 256; ++batch) {  // 256 MiB, a batch at a time
     for (int i = 0; i < 8; ++i) store->AddPowerLogEvent(1, "burst", Value(big));
     store->Drain();
   }
-  EXPECT_LT(std::filesystem::file_size(db_path_ + "-wal"), 80u << 20);
-  EXPECT_GT(std::filesystem::file_size(db_path_), 20u << 20);
+  EXPECT_LT(std::filesystem::file_size(db_path_ + "-wal"), 140u << 20);
+  EXPECT_GT(std::filesystem::file_size(db_path_), 100u << 20);
 }
 
 TEST_F(ReportingStoreTest, AfterCloseRecordsAreRefusedCallbacksStillRun) {
