@@ -407,11 +407,11 @@ Dictionary::Dictionary(std::initializer_list<Entry> entries) {
 }
 
 const Value* Dictionary::Find(const Value& key) const {
-  if (const std::string* text = key.as_string(); text && index_.empty()) return Find(*text);
   if (!index_.empty()) {
     auto it = index_.find(key);
     return it == index_.end() ? nullptr : &entries_[it->second].second;
   }
+  if (const std::string* text = key.as_string()) return Find(*text);
   for (const auto& e : entries_) {
     if (e.first == key) return &e.second;
   }

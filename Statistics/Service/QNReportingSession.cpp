@@ -373,10 +373,13 @@ void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
   Counters& counters = *platform_->counters;
   // A stopped session aggregates nothing: its payload's size is not worth measuring.
   const auto array = aggregatedPayloadData();
-  const AppendResult aggregated =
-      array ? Append(array, Value(converted), Value(converted).ApproximateBytes(),
-                     platform_->max_aggregated_bytes, platform_->max_aggregated_bytes_total)
-            : AppendResult::kGone;
+  AppendResult aggregated = AppendResult::kGone;
+  if (array) {
+    Value item(converted);
+    const std::size_t bytes = item.ApproximateBytes();
+    aggregated = Append(array, std::move(item), bytes, platform_->max_aggregated_bytes,
+                        platform_->max_aggregated_bytes_total);
+  }
   if (aggregated == AppendResult::kAppended) {
     Append(nestedAggregatedPayloadData(), Value(Dictionary{{Value(messageID), Value(converted)}}));
   } else if (aggregated != AppendResult::kGone) {

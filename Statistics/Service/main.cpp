@@ -340,8 +340,6 @@ int Run(const Options& options) {
   ipc_options.max_pending_requests = options.limits.max_pending_requests;
   ipc_options.max_pending_request_bytes = options.limits.max_pending_bytes;
   ipc_options.max_outgoing_bytes = options.limits.max_unread_reply_bytes;
-  ipc_options.pause_reply_bytes =
-      std::max<std::size_t>(1, options.limits.max_unread_reply_bytes / 8);
   // Messages waiting in the sessions' queues and in the store's queue: above the mark the
   // clients that send messages wait (they are not read), so a slow disk slows them down
   // instead of filling the daemon's memory.

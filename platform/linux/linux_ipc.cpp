@@ -285,7 +285,7 @@ class LinuxConnection final : public IpcConnection,
   void StartWriteLocked();  // REQUIRES: mu_ held
   void OnWrite(const asio::error_code& error);
   void OnOverflow();
-  void OnReplyTooLarge(std::uint32_t request_id, std::size_t bytes);
+  void OnReplyTooLarge(std::uint32_t request_id);
 
   // The listener is only reached while the connection is not ended (Finish, Forget); replies
   // may still arrive after it is gone, so they use the shared pieces below instead.
@@ -296,6 +296,7 @@ class LinuxConnection final : public IpcConnection,
   const std::shared_ptr<Counters> counters_;
   const LinuxIpcOptions& options_;  // the listener's; read on the io thread only
   const std::size_t max_outgoing_bytes_;
+  const std::size_t pause_reply_bytes_;  // an eighth of max_outgoing_bytes_
   const int error_flush_timeout_ms_;
   Socket socket_;
   const pid_t pid_;
@@ -511,6 +512,7 @@ LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_
       counters_(listener.counters()),
       options_(listener.options()),
       max_outgoing_bytes_(listener.options().max_outgoing_bytes),
+      pause_reply_bytes_(std::max<std::size_t>(1, max_outgoing_bytes_ / 8)),
       error_flush_timeout_ms_(listener.options().error_flush_timeout_ms),
       socket_(std::move(socket)),
       pid_(pid),
@@ -540,7 +542,7 @@ LinuxConnection::Hold LinuxConnection::WhyHeld() {
   }
   {
     std::lock_guard lock(mu_);
-    if (pending_.size() + writing_bytes_ >= options_.pause_reply_bytes) return Hold::kReplies;
+    if (pending_.size() + writing_bytes_ >= pause_reply_bytes_) return Hold::kReplies;
   }
   if (sends_messages_ && options_.message_intake_blocked && options_.message_intake_blocked()) {
     return Hold::kStore;
@@ -750,9 +752,8 @@ void LinuxConnection::SendErrorFrame() {
 void LinuxConnection::QueueReply(std::uint32_t request_id, Value result) {
   std::string frame;
   if (!AppendFrame(frame, Value(Array{Value(request_id), std::move(result)}))) {
-    asio::post(*io_, [self = shared_from_this(), request_id] {
-      self->OnReplyTooLarge(request_id, protocol::kMaxBodyBytes);
-    });
+    asio::post(*io_,
+               [self = shared_from_this(), request_id] { self->OnReplyTooLarge(request_id); });
     return;
   }
   std::lock_guard lock(mu_);
@@ -775,11 +776,11 @@ void LinuxConnection::QueueReply(std::uint32_t request_id, Value result) {
   }
 }
 
-void LinuxConnection::OnReplyTooLarge(std::uint32_t request_id, std::size_t limit) {
+void LinuxConnection::OnReplyTooLarge(std::uint32_t request_id) {
   Counters::Add(counters_->repliesTooLarge);
   Fail(protocol::ConnectionError::kReplyTooLarge,
        StringWithFormat("the reply to request %u does not fit in a frame (%zu bytes at most)",
-                        request_id, limit));
+                        request_id, protocol::kMaxBodyBytes));
 }
 
 void LinuxConnection::OnOverflow() {

@@ -26,9 +26,8 @@ struct LinuxIpcOptions {
   // AfterRequests), so the server queue holds a bounded number of any one client's requests.
   std::size_t max_pending_requests = 256;
   std::size_t max_pending_request_bytes = 1u << 20;
-  // A connection is not read while its peer leaves this many reply bytes unread...
-  std::size_t pause_reply_bytes = 1u << 20;
-  // ... and it is closed when the replies it has not read pass this many bytes.
+  // A connection is closed when the replies its peer has not read pass this many bytes; it
+  // is not read while they are an eighth of that or more.
   std::size_t max_outgoing_bytes = 8u << 20;
   // While this returns true, connections that have sent a message are not read (the store
   // is behind). Called on the IPC thread before each frame; may be empty.

@@ -32,12 +32,13 @@ struct LinuxLogOptions {
 // The platform log on Linux. Journal entries carry MESSAGE (the line), PRIORITY (default:
 // notice, info: info, debug: debug, error: err), CODE_FILE, CODE_LINE, CODE_FUNC,
 // QN_SCOPE (the scope's code, absent for the default log) and SYSLOG_IDENTIFIER. On the
-// stream each line is written as the line plus "\n" in one write() under a lock, so lines
-// of different threads never interleave. Writing never blocks: when the stream is full (a
-// pipe nobody reads) or gone (its reader left; SIGPIPE must be ignored), the line is
-// dropped and counted, and the next line that gets through says how many were lost. The `enabled`
-// and `flags` arguments of RegisterScope are kept in nothing: every scope writes, and only the
-// configured scopes write debug lines. Safe to call from any thread.
+// stream each line is the line plus "\n", and lines of different threads never interleave.
+// Writing never blocks: a line the stream does not take at once waits in a queue of at most
+// 4 MiB that a thread of the log writes out; beyond that, or when the stream is gone (its
+// reader left; SIGPIPE must be ignored), the line is dropped and counted, and the next line
+// that gets through says how many were lost. The `enabled` and `flags` arguments of
+// RegisterScope are kept in nothing: every scope writes, and only the configured scopes
+// write debug lines. Safe to call from any thread.
 std::shared_ptr<Log> NewLinuxLog(LinuxLogOptions options = {});
 
 // Whether `fd` is the stream that systemd connected to the journal: JOURNAL_STREAM

@@ -37,15 +37,14 @@ std::string LinuxStatsPublisher::StatusLine(const Dictionary& stats) {
          " paused, " + std::to_string(dropped) + " dropped";
 }
 
-bool LinuxStatsPublisher::Publish(const Dictionary& stats) {
+void LinuxStatsPublisher::Publish(const Dictionary& stats) {
   std::string text = ToJsonLenient(Value(stats), JsonStyle::kPretty);
-  if (text == last_) return true;
+  if (text == last_) return;
   text.push_back('\n');
   const bool written = !WriteFileAtomically(path_, text);
   text.pop_back();
   if (written) last_ = std::move(text);
   sd_notify(0, ("STATUS=" + StatusLine(stats)).c_str());
-  return written;
 }
 
 }  // namespace qn

@@ -15,15 +15,13 @@ class LinuxStatsPublisher {
   explicit LinuxStatsPublisher(std::string path) : path_(std::move(path)) {}
 
   // Writes `stats` (atomically: a reader never sees half a file) and its status line,
-  // unless they are what was published last. Returns false when the file could not be
-  // written (the status line is still sent).
-  bool Publish(const Dictionary& stats);
+  // unless they are what was published last. A file that cannot be written is tried again
+  // at the next call (the status line is still sent).
+  void Publish(const Dictionary& stats);
 
   // The status line of `stats`, e.g. "3 connections, 12 sessions, 1204 messages, store
   // lag 0, 2 paused, 0 dropped".
   static std::string StatusLine(const Dictionary& stats);
-
-  const std::string& path() const { return path_; }
 
  private:
   const std::string path_;

@@ -172,16 +172,14 @@ const char* KindName(RecordKind kind) {
 
 }  // namespace
 
-// The writer: owns the connection, the queue and the writer thread. The thread holds a
-// reference to it, so it outlives the ReportingStore when the store is closed from the
-// writer thread itself.
-// Copies the WAL into the database file on a thread and a connection of its own, so that
-// the writer's commits never wait for a checkpoint (which fsyncs the database and, after a
-// burst, copies tens of megabytes: long enough to stall every client the store holds back).
-// The writer turns its own automatic checkpoints off and wakes this one from its WAL hook.
 // WAL pages not yet copied after which a checkpoint is due (SQLite's own default).
 constexpr int kCheckpointPages = 1000;
 
+// Copies the WAL into the database file on a thread and a connection of its own, so that
+// the writer's commits never wait for a checkpoint (which fsyncs the database and, after a
+// burst, copies tens of megabytes: long enough to stall every client the store holds back).
+// The writer turns its own automatic checkpoints off and tells this one of each commit from
+// its WAL hook.
 class Checkpointer {
  public:
   // Null when the second connection cannot be opened (the writer then checkpoints itself).
@@ -282,6 +280,9 @@ class Checkpointer {
 // are the 64 MiB the WAL is cut back to (journal_size_limit).
 constexpr int kWrapPages = 4096;
 
+// The writer: owns the connection, the queue and the writer thread. The thread holds a
+// reference to it, so it outlives the ReportingStore when the store is closed from the
+// writer thread itself.
 class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreWriter> {
  public:
   ReportingStoreWriter(DbHandle db, std::shared_ptr<Log> log, ReportingStore::Options options,

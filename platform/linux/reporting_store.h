@@ -25,9 +25,9 @@ class ReportingStoreWriter;
 // waits for a disk. The writer takes everything queued, writes it in one transaction with
 // prepared statements and commits. While records keep coming it first gathers them for up
 // to 2 ms (or 512 records), as a commit costs about as much for a few records as for
-// hundreds; nobody waiting in Drain is ever kept waiting for that. What a row holds is fixed at hand-over (values are
-// immutable); only an analytics payload is produced later, by its provider, when the row
-// is written. All methods are safe to call from any thread.
+// hundreds; nobody waiting in Drain is ever kept waiting for that. What a row holds is
+// fixed at hand-over (values are immutable); only an analytics payload is produced later,
+// by its provider, when the row is written. All methods are safe to call from any thread.
 //
 // Durability: WAL journal with synchronous=NORMAL (commits are not fsynced; checkpoints
 // are). A commit reaches the operating system before Drain returns, so it survives the
@@ -37,7 +37,8 @@ class ReportingStoreWriter;
 //
 // The database uses 16 KiB pages (set when the file is created) and keeps its WAL file at
 // most 64 MiB after a checkpoint. Checkpoints run on a thread and connection of their own
-// (passive: they never hold the writer up), whenever the WAL has grown by 1,000 pages.
+// (passive: they never hold the writer up) once 1,000 WAL pages wait to be copied; once
+// the WAL holds 64 MiB, the writer copies the rest itself so that the WAL starts over.
 //
 // Failures: a batch whose transaction fails is tried once more, then record by record,
 // each in a transaction of its own, so that only a record that fails on its own (a
