@@ -185,9 +185,10 @@ std::string RatesUnder(const View& view, const std::string& prefix) {
 std::vector<std::string> ScreenLines(const View& view, double interval) {
   const Figures& f = view.figures;
   std::vector<std::string> lines;
-  lines.push_back("qnreport top: " +
-                  (view.problem.empty() ? "qnreportingd " + Whole(At(f, "pid")) : view.problem) +
-                  ", every " + Fixed(interval) + " s, " + Clock() + "; q quits");
+  lines.push_back(
+      "qnreport top: " +
+      (view.problem.empty() ? "qnreportingd pid " + Whole(At(f, "pid")) : view.problem) +
+      ", every " + Fixed(interval) + " s, " + Clock() + "; q quits");
   lines.push_back("");
   const double most =
       view.messages.empty() ? 0 : *std::max_element(view.messages.begin(), view.messages.end());
