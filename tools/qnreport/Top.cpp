@@ -379,6 +379,7 @@ int RunTop(const Paths& paths, const TopOptions& options, std::ostream& out, std
       out << PlainLine(view) << "\n" << std::flush;
     }
   };
+  view.figures = history.Latest();
   if (screen) draw();
 
   double next = SteadyNow() + options.interval;
