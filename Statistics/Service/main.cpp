@@ -115,6 +115,7 @@ struct Options {
   std::optional<std::string> driver_stats;
   std::string debug_scopes;
   Limits limits;
+  std::string metrics_file;  // the counters for Prometheus too, when set
 };
 
 // A CLI11 check that a value is not empty.
@@ -171,6 +172,11 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
       ->type_name("SCOPES")
       ->check(kNotEmpty)
       ->check(kDebugScopes);
+  app.add_option("--metrics-file", options.metrics_file,
+                 "Also write the counters to PATH for Prometheus (node_exporter's textfile "
+                 "collector)")
+      ->type_name("PATH")
+      ->check(kNotEmpty);
   Limits& limits = options.limits;
   const auto limit = [&app](const char* name, std::size_t& value, const char* what,
                             std::size_t most = SIZE_MAX) {
@@ -230,9 +236,11 @@ sigset_t HandledSignals() {
   return set;
 }
 
-// The counters and the store's figures, as the stats file shows them.
+// The counters and the store's figures, as the stats file shows them, with the daemon's
+// process ID (so that a reader can tell a file left by a daemon that has ended).
 Dictionary StatsOf(const Counters& counters, const ReportingStore& store) {
   Dictionary stats = counters.Snapshot();
+  stats.Set("pid", Value(static_cast<std::int64_t>(getpid())));
   const ReportingStore::Stats figures = store.stats();
   stats.Set("store", Value(Dictionary{{"committed", Value(figures.committed)},
                                       {"failed", Value(figures.failed)},
@@ -333,6 +341,17 @@ int Run(const Options& options) {
       platform, {.maxSessionsPerClient = options.limits.max_sessions_per_client,
                  .maxSessions = options.limits.max_sessions});
 
+  auto stats = std::make_shared<LinuxStatsPublisher>(paths.runtime_dir + "/" + kStatsFileName,
+                                                     options.metrics_file);
+  // Published once before the socket exists: the files are there as soon as a client can
+  // connect (and a metrics file that cannot be written is an error at start-up).
+  if (auto failure = stats->Publish(StatsOf(*counters, *store))) {
+    std::fprintf(stderr, "%s: cannot write the counters: %s\n", kProgram,
+                 failure->Description().c_str());
+    store->Drain();
+    return 1;
+  }
+
   LinuxIpcOptions ipc_options;
   ipc_options.socket_path = paths.socket_path;
   ipc_options.counters = counters;
@@ -365,7 +384,6 @@ int Run(const Options& options) {
 
   // The one thread that takes the handled signals (blocked everywhere else).
   std::shared_ptr<Notify> notify = platform->notify;
-  auto stats = std::make_shared<LinuxStatsPublisher>(paths.runtime_dir + "/" + kStatsFileName);
   std::thread signals([listener, notify, log, stats, counters, store] {
     const sigset_t set = HandledSignals();
     for (;;) {

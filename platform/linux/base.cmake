@@ -14,6 +14,7 @@ qn_library(qn_linux_base
     linux_defaults.cpp
     small_file.cpp
     linux_stats.cpp
+    linux_metrics.cpp
 )
 if(QN_SANITIZE STREQUAL "thread" AND TARGET qn_linux_base)
   # asio uses std::atomic_thread_fence, which GCC flags under TSan (-Wtsan); the fence is

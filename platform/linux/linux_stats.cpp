@@ -4,6 +4,7 @@
 
 #include "common/Files.h"
 #include "common/Json.h"
+#include "platform/linux/linux_metrics.h"
 
 namespace qn {
 namespace {
@@ -37,14 +38,18 @@ std::string LinuxStatsPublisher::StatusLine(const Dictionary& stats) {
          " paused, " + std::to_string(dropped) + " dropped";
 }
 
-void LinuxStatsPublisher::Publish(const Dictionary& stats) {
+std::optional<Error> LinuxStatsPublisher::Publish(const Dictionary& stats) {
   std::string text = ToJsonLenient(Value(stats), JsonStyle::kPretty);
-  if (text == last_) return;
+  if (text == last_) return std::nullopt;
   text.push_back('\n');
-  const bool written = !WriteFileAtomically(path_, text);
+  std::optional<Error> error = WriteFileAtomically(path_, text);
+  if (!error && !metrics_path_.empty()) {
+    error = WriteFileAtomically(metrics_path_, PrometheusText(stats));
+  }
   text.pop_back();
-  if (written) last_ = std::move(text);
+  if (!error) last_ = std::move(text);
   sd_notify(0, ("STATUS=" + StatusLine(stats)).c_str());
+  return error;
 }
 
 }  // namespace qn

@@ -2,7 +2,10 @@
 // events, session), the shell's line parser, and the shell against an in-process listener.
 #include <gtest/gtest.h>
 
+#include <unistd.h>
+
 #include <filesystem>
+#include <fstream>
 #include <sstream>
 
 #include "common/Json.h"
@@ -139,6 +142,35 @@ TEST_F(CommandLineTest, EventsAndSession) {
   EXPECT_EQ(story.find("stopped   not yet"), std::string::npos) << story;
   EXPECT_EQ(Run({"session", "2"}), 1);
   EXPECT_NE(err_.str().find("no session 2"), std::string::npos);
+}
+
+// stats: one line when no daemon runs (no file, or one left by a process that has ended);
+// a running daemon's file as it is, ended with a newline like every command's output.
+TEST_F(CommandLineTest, StatsOfARunningDaemonOrOneLineWhyNot) {
+  const std::string file = paths().runtime_dir + "/stats.json";
+  const std::string alive = "{\"pid\":" + std::to_string(getpid()) + ",\"messages\":3}";
+  const struct {
+    std::optional<std::string> text;
+    std::vector<std::string> args;
+    int status;
+    std::string out, err;
+  } cases[] = {
+      {std::nullopt, {"stats"}, 1, "", "qnreport: qnreportingd is not running (there is no "},
+      {R"({"pid":99999999})", {"stats"}, 1, "", "is from process 99999999, which has ended)\n"},
+      {"[1]", {"stats"}, 1, "", "is not a stats file\n"},
+      {alive, {"stats", "--json"}, 0, alive + "\n", ""},
+      {alive, {"stats"}, 0, "messages  3\nstatus: 0 connections", ""},
+  };
+  std::filesystem::create_directories(paths().runtime_dir);
+  for (const auto& c : cases) {
+    std::filesystem::remove(file);
+    if (c.text) std::ofstream(file) << *c.text;
+    EXPECT_EQ(Run(c.args), c.status) << c.text.value_or("no file");
+    const std::string out = out_.str(), err = err_.str();
+    EXPECT_NE(out.find(c.out), std::string::npos) << out;
+    EXPECT_NE(err.find(c.err), std::string::npos) << err;
+    EXPECT_EQ(std::count(err.begin(), err.end(), '\n'), c.status) << err;
+  }
 }
 
 TEST(QnreportParseTest, BadLinesAndTimes) {

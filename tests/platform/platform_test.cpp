@@ -1,6 +1,6 @@
-// The Linux platform code beside the dispatcher: the log, the device-information file, and
-// the notifications, defaults suites and driver counters, each with contract tests run
-// against the Linux code and its fake.
+// The Linux platform code beside the dispatcher: the log, the device-information file, the
+// metrics text, and the notifications, defaults suites and driver counters, each with contract
+// tests run against the Linux code and its fake.
 #include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
@@ -21,6 +21,7 @@
 #include "platform/linux/linux_device_info.h"
 #include "platform/linux/linux_dispatch.h"
 #include "platform/linux/linux_log.h"
+#include "platform/linux/linux_metrics.h"
 #include "platform/linux/linux_notify.h"
 #include "platform/linux/linux_ostrel.h"
 #include "tests/fakes/FakePlatform.h"
@@ -110,6 +111,27 @@ TEST(LinuxLogTest, LinesFromManyThreadsNeverInterleave) {
     ASSERT_EQ(line.find_first_not_of(line.at(0)), std::string::npos) << "two lines mixed in one";
   }
   EXPECT_EQ(lines, kThreads * kLines);
+}
+
+// Known figures get their Prometheus names and types, operations their short names and
+// label values their escapes; a figure nobody described (added later) is still exposed.
+TEST(PrometheusTextTest, KnownFiguresAreNamedAndOthersStillAppear) {
+  const std::string text =
+      PrometheusText(Dictionary{{"requests", Value(Dictionary{{"sendMessage:withCategory:", 3}})},
+                                {"refused", Value(Dictionary{{"a\"b\\c\n", 1}})},
+                                {"connections_open", 2},
+                                {"pid", 77},
+                                {"export", Value(Dictionary{{"lag_rows", 7}, {"state", "up"}})}});
+  for (const char* line :
+       {"# TYPE qnreportingd_requests_total counter\n",
+        "qnreportingd_requests_total{op=\"sendMessage\"} 3\n",
+        "qnreportingd_refused_total{limit=\"a\\\"b\\\\c\\n\"} 1\n",
+        "# TYPE qnreportingd_connections gauge\nqnreportingd_connections 2\n",
+        "# TYPE qnreportingd_export_lag_rows untyped\nqnreportingd_export_lag_rows 7\n"}) {
+    EXPECT_NE(text.find(line), std::string::npos) << line << " in\n" << text;
+  }
+  EXPECT_EQ(text.find("77"), std::string::npos) << text;
+  EXPECT_EQ(text.find("state"), std::string::npos) << text;
 }
 
 TEST(LinuxDeviceInfoTest, AnswersOverrideAndMalformedFiles) {

@@ -1,10 +1,12 @@
 #include "tools/qnreport/Admin.h"
 
 #include <poll.h>
+#include <signal.h>
 #include <sys/inotify.h>
 #include <unistd.h>
 
 #include <algorithm>
+#include <cerrno>
 #include <chrono>
 #include <cmath>
 #include <ctime>
@@ -344,31 +346,44 @@ void FlattenStats(const Dictionary& stats, const std::string& prefix,
 
 }  // namespace
 
-int RunStats(const Paths& paths, bool json, std::ostream& out, std::ostream& err) {
+std::variant<DaemonStats, std::string> ReadDaemonStats(const Paths& paths) {
   const std::string path = paths.runtime_dir + "/" + kStatsFileName;
-  std::string text;
-  if (auto error = ReadSmallFile(path, 1 << 20, text)) {
-    err << "qnreport: " << error->Description()
-        << " (qnreportingd writes it once a second while it runs)\n";
-    return 1;
+  DaemonStats read;
+  if (auto error = ReadSmallFile(path, 1 << 20, read.text)) {
+    if (error->code == ENOENT) return "qnreportingd is not running (there is no " + path + ")";
+    return error->Description();
   }
   Value stats;
-  if (ParseJson(text, stats) || !stats.as_dictionary()) {
-    err << "qnreport: " << path << " is not a stats file\n";
-    return 1;
+  if (ParseJson(read.text, stats) || !stats.as_dictionary()) return path + " is not a stats file";
+  read.stats = *stats.as_dictionary();
+  const Value* pid = read.stats.Find("pid");
+  const auto number = pid ? pid->as_int64() : std::nullopt;
+  if (number && *number > 0 && ::kill(static_cast<pid_t>(*number), 0) != 0 && errno == ESRCH) {
+    return "qnreportingd is not running (" + path + " is from process " + std::to_string(*number) +
+           ", which has ended)";
   }
+  return read;
+}
+
+int RunStats(const Paths& paths, bool json, std::ostream& out, std::ostream& err) {
+  auto read = ReadDaemonStats(paths);
+  if (const auto* problem = std::get_if<std::string>(&read)) {
+    err << "qnreport: " << *problem << "\n";
+    return kExitFailure;
+  }
+  const DaemonStats& stats = std::get<DaemonStats>(read);
   if (json) {
-    out << text;
+    out << stats.text;
     return 0;
   }
   std::vector<std::pair<std::string, std::string>> rows;
-  FlattenStats(*stats.as_dictionary(), "", rows);
+  FlattenStats(stats.stats, "", rows);
   std::size_t width = 0;
   for (const auto& row : rows) width = std::max(width, row.first.size());
   for (const auto& [name, value] : rows) {
     out << name << std::string(width + 2 - name.size(), ' ') << value << "\n";
   }
-  out << "status: " << LinuxStatsPublisher::StatusLine(*stats.as_dictionary()) << "\n";
+  out << "status: " << LinuxStatsPublisher::StatusLine(stats.stats) << "\n";
   return 0;
 }
 

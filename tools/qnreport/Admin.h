@@ -4,8 +4,10 @@
 #include <optional>
 #include <ostream>
 #include <string>
+#include <variant>
 
 #include "common/Paths.h"
+#include "common/Value.h"
 #include "platform/linux/reporting_store_reader.h"
 
 namespace qn::qnreport {
@@ -40,8 +42,19 @@ int RunEvents(const Paths& paths, const EventsOptions& options, std::ostream& ou
 // type, the summary event, the driver-statistics change and the summary file.
 int RunSession(const Paths& paths, std::int64_t session, std::ostream& out, std::ostream& err);
 
-// stats: the daemon's counters (the file it refreshes once a second in its runtime folder),
-// one "name value" line each and the status line, or the file's JSON as it is.
+// The daemon's stats file as it is now: its text and its dictionary.
+struct DaemonStats {
+  std::string text;
+  Dictionary stats;
+};
+// Reads the stats file the daemon writes at start-up and then once a second when its
+// counters change. Returns the one-line reason when there are no stats of a running
+// daemon: "qnreportingd is not running (...)" when the file is missing or was left by a
+// daemon that has ended (its "pid" is gone), or what is wrong with the file.
+std::variant<DaemonStats, std::string> ReadDaemonStats(const Paths& paths);
+
+// stats: the daemon's counters, one "name value" line each and the status line, or the
+// file's JSON as it is. Says in one line on `err` (status 1) when the daemon is not running.
 int RunStats(const Paths& paths, bool json, std::ostream& out, std::ostream& err);
 
 // A time given on the command line: "2026-11-21 13:05[:SS]", "2026-11-21", "13:05[:SS]"

@@ -1,5 +1,7 @@
 #include "tools/qnreport/Cli.h"
 
+#include <unistd.h>
+
 #include <CLI/CLI.hpp>
 
 #include <algorithm>
@@ -13,6 +15,7 @@
 #include "tools/qnreport/Admin.h"
 #include "tools/qnreport/Commands.h"
 #include "tools/qnreport/Shell.h"
+#include "tools/qnreport/Top.h"
 
 #ifndef QN_VERSION
 #define QN_VERSION "0.1.0"
@@ -126,15 +129,31 @@ double Now() {
   return std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
 }
 
-struct Connection {
-  std::unique_ptr<client::Client> client;
-  client::Timeout timeout;
+// Passes what a command writes on to `target` and remembers the last character, so that
+// every command's output can be made to end with a newline.
+class LastCharacter : public std::streambuf {
+ public:
+  explicit LastCharacter(std::ostream& target) : target_(target) {}
+  bool EndsLine() const { return last_ == '\n'; }
+
+ protected:
+  int_type overflow(int_type c) override {
+    if (traits_type::eq_int_type(c, traits_type::eof())) return traits_type::not_eof(c);
+    const char ch = traits_type::to_char_type(c);
+    return xsputn(&ch, 1) == 1 ? c : traits_type::eof();
+  }
+  std::streamsize xsputn(const char* text, std::streamsize n) override {
+    if (n > 0) last_ = text[n - 1];
+    return target_.write(text, n) ? n : 0;
+  }
+  int sync() override { return target_.flush() ? 0 : -1; }
+
+ private:
+  std::ostream& target_;
+  char last_ = '\n';  // nothing written: nothing to end
 };
 
-}  // namespace
-
-int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream& out,
-                   std::ostream& err) {
+int Run(std::vector<std::string> args, std::istream& in, std::ostream& out, std::ostream& err) {
   CLI::App app("Talks to the quenta reporting daemon (qnreportingd) and reads what it stored.",
                "qnreport");
   app.set_help_flag("-h,--help", "Show this text; `qnreport COMMAND --help` describes one");
@@ -246,6 +265,20 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
       "daemon refreshes them once a second in <runtime>/stats.json; systemctl status shows the\n"
       "status line.\n");
 
+  TopOptions top_options;
+  CLI::App* top = app.add_subcommand("top", "Watch the daemon's rates and gauges live");
+  top->add_option("--interval", top_options.interval, "Refresh every SECONDS (default 1)")
+      ->type_name("SECONDS")
+      ->check(CLI::Range(0.1, 3600.0));
+  top->add_option("--count", top_options.count, "Refresh N times, then end")
+      ->type_name("N")
+      ->check(CLI::PositiveNumber);
+  top->footer(
+      "\nFollows <runtime>/stats.json: requests, messages and store rows per second, the\n"
+      "gauges, pauses and refusals per second, and a sparkline of messages per second (one\n"
+      "column per refresh, the last minute at most). q or Ctrl-C ends it. When standard output\n"
+      "is not a terminal it prints one line per refresh instead.\n");
+
   std::reverse(args.begin(), args.end());
   try {
     app.parse(args);
@@ -266,6 +299,10 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
   if (notify->parsed()) return RunNotifyPost(resolved, notification, err);
   if (session->parsed()) return RunSession(resolved, session_number, out, err);
   if (stats->parsed()) return RunStats(resolved, stats_json, out, err);
+  if (top->parsed()) {
+    if (isatty(STDOUT_FILENO)) top_options.terminal = STDOUT_FILENO;
+    return RunTop(resolved, top_options, out, err);
+  }
   if (events->parsed()) {
     if (!sink.empty()) events_options.filter.sink = ParseReportingSink(sink);
     if (!since.empty()) events_options.filter.since = ParseTimeArgument(since, Now());
@@ -297,6 +334,19 @@ int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream
   Shell one(*client, out, timeout);
   one.RunLine(line, 1);
   return one.Finish();
+}
+
+}  // namespace
+
+int RunCommandLine(std::vector<std::string> args, std::istream& in, std::ostream& out,
+                   std::ostream& err) {
+  LastCharacter out_end(out), err_end(err);
+  std::ostream tracked_out(&out_end), tracked_err(&err_end);
+  const int status = Run(std::move(args), in, tracked_out, tracked_err);
+  if (!out_end.EndsLine()) tracked_out << "\n";
+  if (!err_end.EndsLine()) tracked_err << "\n";
+  tracked_out.flush();
+  return status;
 }
 
 }  // namespace qn::qnreport
