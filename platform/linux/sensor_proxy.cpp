@@ -65,13 +65,15 @@ class SensorProxy::Loop {
     std::uint64_t count = 0;
     while (::read(fd, &count, sizeof count) < 0 && errno == EINTR) {
     }
-    bool wanted = false, stopping = false;
+    bool wanted = false, stopping = false, asked = false;
     {
       std::lock_guard lock(self.owner_.mu_);
       wanted = self.owner_.wanted_;
       stopping = self.owner_.stopping_;
+      asked = self.owner_.asked_ != self.asked_;
+      self.asked_ = self.owner_.asked_;
     }
-    self.Reconcile(wanted && !stopping);
+    self.Reconcile(wanted && !stopping, asked && !stopping);
     if (stopping) sd_event_exit(self.event_, 0);
     return 0;
   }
@@ -86,7 +88,7 @@ class SensorProxy::Loop {
     self.owner_unique_ = after;
     if (*after == '\0') {
       if (was_claimed) self.Explain("iio-sensor-proxy left the system bus");
-    } else if (self.wanted_) {
+    } else if (self.wanted_ && self.Available()) {
       self.Claim();  // a new instance knows nothing of an earlier claim
     }
     return 0;
@@ -123,14 +125,17 @@ class SensorProxy::Loop {
     return found;
   }
 
-  void Reconcile(bool wanted) {
+  // Claims or releases as `wanted` says; `asked`: it was wanted since the last look.
+  void Reconcile(bool wanted, bool asked) {
     wanted_ = wanted;
     if (claimed_ && sd_bus_is_open(bus_) <= 0) Lost();  // the bus went away under the claim
-    if (!wanted) {
-      if (claimed_) Release();
-      return;
+    if (wanted) {
+      if (!claimed_ && Connect() && Available()) Claim();
+    } else if (claimed_) {
+      Release();
+    } else if (asked && Connect()) {
+      Available();  // a wish already over: only say why it could not have been met
     }
-    if (!claimed_ && Connect()) Claim();
   }
 
   // Opens the system bus and watches the service, unless that is done and still open.
@@ -163,27 +168,29 @@ class SensorProxy::Loop {
     }
   }
 
-  // Claims the accelerometer when the service is there and has one.
-  void Claim() {
+  // Whether the service is there and has an accelerometer; says why not.
+  bool Available() {
     BusError error;
     int has_accelerometer = 0;
-    int r = sd_bus_get_property_trivial(bus_, kService, kPath, kInterface, "HasAccelerometer",
-                                        &error.error, 'b', &has_accelerometer);
+    const int r = sd_bus_get_property_trivial(bus_, kService, kPath, kInterface, "HasAccelerometer",
+                                              &error.error, 'b', &has_accelerometer);
     if (r < 0) {
       Explain(sd_bus_error_has_names(&error.error, SD_BUS_ERROR_SERVICE_UNKNOWN,
                                      SD_BUS_ERROR_NAME_HAS_NO_OWNER)
                   ? std::string("iio-sensor-proxy is not on the system bus")
                   : "cannot ask iio-sensor-proxy for its accelerometer: " + error.Text(r));
-      return;
+      return false;
     }
-    if (!has_accelerometer) {
-      Explain("the device has no accelerometer");
-      return;
-    }
+    if (!has_accelerometer) Explain("the device has no accelerometer");
+    return has_accelerometer != 0;
+  }
+
+  void Claim() {
+    BusError error;
     // Its changes are taken only from the instance that was claimed.
     sd_bus_creds* creds = nullptr;
     const char* unique = nullptr;
-    r = sd_bus_get_name_creds(bus_, kService, SD_BUS_CREDS_UNIQUE_NAME, &creds);
+    int r = sd_bus_get_name_creds(bus_, kService, SD_BUS_CREDS_UNIQUE_NAME, &creds);
     if (r >= 0) r = sd_bus_creds_get_unique_name(creds, &unique);
     if (r >= 0) owner_unique_ = unique;
     sd_bus_creds_unref(creds);
@@ -231,6 +238,7 @@ class SensorProxy::Loop {
   sd_bus_slot* owner_match_ = nullptr;
   sd_bus_slot* properties_match_ = nullptr;
   bool wanted_ = false;
+  std::uint64_t asked_ = 0;  // the owner's asked_ when the thread last looked
   bool claimed_ = false;
   std::string owner_unique_;  // the service's connection name when it is on the bus
   std::string explained_;     // the last reason logged, until a claim succeeds
@@ -257,6 +265,7 @@ void SensorProxy::SetWanted(bool wanted) {
   {
     std::lock_guard lock(mu_);
     wanted_ = wanted;
+    if (wanted) ++asked_;
     if (wanted && !thread_.joinable() && !stopping_ && wake_fd_ >= 0) {
       thread_ = std::thread([this] {
         pthread_setname_np(pthread_self(), "qn-orientation");
