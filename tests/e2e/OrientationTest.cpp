@@ -39,8 +39,8 @@ class SystemBus {
         std::vector<std::string>{"--config-file=" + dir.File("bus.conf"), "--nofork",
                                  "--nopidfile"},
         dir.File("dbus"));
-    EXPECT_TRUE(Eventually([&] { return Connect(); })) << daemon_->Stderr();
     setenv("DBUS_SYSTEM_BUS_ADDRESS", address_.c_str(), 1);
+    EXPECT_TRUE(Eventually([&] { return sd_bus_open_system(&bus_) >= 0; })) << daemon_->Stderr();
   }
   ~SystemBus() {
     unsetenv("DBUS_SYSTEM_BUS_ADDRESS");
@@ -48,7 +48,7 @@ class SystemBus {
     sd_bus_flush_close_unref(bus_);
   }
 
-  // Starts the iio-sensor-proxy template and waits until it owns its name.
+  // Starts the iio-sensor-proxy template and waits until it answers.
   std::unique_ptr<ChildProcess> StartSensorProxy(const testing::TempDir& dir,
                                                  bool has_accelerometer) {
     std::filesystem::create_directories(dir.File("mock"));
@@ -59,12 +59,7 @@ class SystemBus {
             std::string("{\"has_accelerometer\": ") + (has_accelerometer ? "true" : "false") + "}"},
         dir.File("mock"));
     EXPECT_TRUE(Eventually([&] {
-      int has_owner = 0;
-      reply_ = sd_bus_message_unref(reply_);
-      return sd_bus_call_method(bus_, "org.freedesktop.DBus", "/org/freedesktop/DBus",
-                                "org.freedesktop.DBus", "NameHasOwner", nullptr, &reply_, "s",
-                                kSensorProxy) >= 0 &&
-             sd_bus_message_read(Reply(), "b", &has_owner) >= 0 && has_owner;
+      return Mock("GetInternalProperty", "s", "HasAccelerometer") >= 0;
     })) << mock->Stderr();
     return mock;
   }
@@ -77,32 +72,18 @@ class SystemBus {
 
   // The connections that hold the accelerometer, as the template records them.
   std::vector<std::string> Claims() {
-    char** names = nullptr;
+    std::vector<std::string> out;
     if (Mock("GetInternalProperty", "s", "AccelerometerOwners") < 0 ||
-        sd_bus_message_read_strv(Reply(), &names) < 0) {
+        sd_bus_message_enter_container(reply_, 'a', "s") < 0) {
       return {"(the template did not answer)"};
     }
-    std::vector<std::string> out;
-    for (char** name = names; name && *name; ++name) {
-      out.emplace_back(*name);
-      free(*name);
+    for (const char* name = nullptr; sd_bus_message_read(reply_, "s", &name) > 0;) {
+      out.emplace_back(name);
     }
-    free(names);
     return out;
   }
 
  private:
-  bool Connect() {
-    sd_bus* bus = nullptr;
-    if (sd_bus_new(&bus) < 0) return false;
-    if (sd_bus_set_address(bus, address_.c_str()) < 0 || sd_bus_set_bus_client(bus, 1) < 0 ||
-        sd_bus_start(bus) < 0) {
-      sd_bus_unref(bus);
-      return false;
-    }
-    bus_ = bus;
-    return true;
-  }
   template <typename... Args>
   int Mock(const char* method, const char* types, Args... args) {
     reply_ = sd_bus_message_unref(reply_);
@@ -110,7 +91,6 @@ class SystemBus {
                               "org.freedesktop.DBus.Mock", method, nullptr, &reply_, types,
                               args...);
   }
-  sd_bus_message* Reply() const { return reply_; }
 
   const std::string address_;
   std::unique_ptr<ChildProcess> daemon_;
