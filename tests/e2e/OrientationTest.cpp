@@ -127,7 +127,8 @@ std::vector<double> Numbers(const std::string& joined) {
 }
 
 // Two accelerometer changes and one posted UI orientation during a telephony session reach
-// its summary event in order, and the accelerometer is held only while the session runs.
+// its summary event in order (a UI orientation that is no orientation name does not), and
+// the accelerometer is held only while the session runs.
 TEST(OrientationTest, ChangesReachTheSummaryAndTheClaimEndsWithTheSession) {
   testing::TempDir dir, home;
   SystemBus bus(dir);
@@ -145,6 +146,9 @@ TEST(OrientationTest, ChangesReachTheSummaryAndTheClaimEndsWithTheSession) {
   std::this_thread::sleep_for(20ms);  // so that the two changes' times differ
   bus.SetOrientation("left-up");
   ASSERT_TRUE(Logged(*daemon, "mode=device orientation=\"left-up\""));
+  EXPECT_EQ(Qnreport(*daemon, {"orientation", "ui", "sideways"}), "exit 1");
+  std::ofstream(home.File("run/notify/com.norvel.quenta.orientation.ui")) << "sideways\n";
+  ASSERT_TRUE(Logged(*daemon, "ignored a UI orientation that is not"));
   EXPECT_EQ(Qnreport(*daemon, {"orientation", "ui", "right-up"}), "");
   ASSERT_TRUE(Logged(*daemon, "mode=ui orientation=\"right-up\""));
   EXPECT_EQ(Qnreport(*daemon, {"orientation"}), "device: left-up\nui: right-up\n");
