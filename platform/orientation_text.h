@@ -5,9 +5,10 @@
 
 namespace qn {
 
-// The text Orientation::OrientationToString gives, for every implementation: 1 "Portrait",
-// 2 "PortraitUpsideDown", 3 "LandscapeLeft", 4 "LandscapeRight", 5 "FaceUp", 6 "FaceDown",
-// anything else "Unknown". Thread-safe.
+// The audio framework's orientation texts: 1 "Portrait", 2 "PortraitUpsideDown",
+// 3 "LandscapeLeft", 4 "LandscapeRight", 5 "FaceUp", 6 "FaceDown", anything else "Unknown".
+// The test double's Orientation gives these; on Linux the values and texts are
+// iio-sensor-proxy's (LinuxOrientationText). Thread-safe.
 inline std::string OrientationText(std::int32_t orientation) {
   switch (orientation) {
     case 1:

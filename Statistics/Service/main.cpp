@@ -331,7 +331,12 @@ int Run(const Options& options) {
   platform->device_info = NewLinuxDeviceInfo(
       {.path = options.device_info, .internal_build = options.internal_build, .log = log});
   platform->livo_reporting = NewStoreLivoReporting(store);
-  platform->orientation = NewLinuxOrientation();
+  platform->orientation = NewLinuxOrientation(
+      {.runtime_dir = paths.runtime_dir,
+       .log = log,
+       .notify = platform->notify,
+       .queue = platform->dispatcher->CreateSerialQueue("com.norvel.quenta.reporting.orientation",
+                                                        QualityOfService::kBackground)});
   platform->ostrel =
       NewLinuxOstrel(options.driver_stats.value_or(paths.runtime_dir + "/driver-stats"));
   platform->enerdex = NewStoreEnerdex(store);

@@ -9,6 +9,7 @@ qn_library(qn_linux_base
     linux_process.cpp
     linux_device_info.cpp
     linux_orientation.cpp
+    sensor_proxy.cpp
     linux_ostrel.cpp
     linux_notify.cpp
     linux_defaults.cpp

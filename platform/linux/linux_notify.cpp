@@ -188,9 +188,13 @@ class LinuxNotify final : public Notify {
 
 }  // namespace
 
+std::string NotificationFile(const std::string& runtime_dir, const std::string& name) {
+  return NotifyDir(runtime_dir) + "/" + name;
+}
+
 std::uint32_t PostNotification(const std::string& runtime_dir, const std::string& name) {
   if (!ValidName(name)) return kNotifyStatusInvalidName;
-  const std::string path = NotifyDir(runtime_dir) + "/" + name;
+  const std::string path = NotificationFile(runtime_dir, name);
   // Non-blocking, so that a FIFO planted under the name cannot hang the poster.
   const int fd = ::open(path.c_str(),
                         O_WRONLY | O_CREAT | O_CLOEXEC | O_NOFOLLOW | O_NONBLOCK | O_NOCTTY, 0644);

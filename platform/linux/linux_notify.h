@@ -32,6 +32,9 @@ struct LinuxNotifyOptions {
 // Safe to call from any thread. The destructor stops and joins the watch thread.
 std::shared_ptr<Notify> NewLinuxNotify(LinuxNotifyOptions options);
 
+// The file that stands for the notification `name` under `runtime_dir`.
+std::string NotificationFile(const std::string& runtime_dir, const std::string& name);
+
 // Posts `name` under `runtime_dir` without a Notify object (for the command-line tool).
 // Returns 0 or a status above.
 std::uint32_t PostNotification(const std::string& runtime_dir, const std::string& name);

@@ -21,6 +21,7 @@
 #include "common/Json.h"
 #include "platform/linux/linux_defaults.h"
 #include "platform/linux/linux_notify.h"
+#include "platform/linux/linux_orientation.h"
 #include "platform/linux/linux_stats.h"
 #include "platform/linux/reporting_store_reader.h"
 #include "platform/linux/small_file.h"
@@ -255,6 +256,20 @@ int RunNotifyPost(const Paths& paths, const std::string& name, std::ostream& err
     err << "qnreport: posting " << name << " failed (status " << status << ")\n";
     return kExitFailure;
   }
+  return 0;
+}
+
+int RunOrientation(const Paths& paths, const std::optional<std::string>& ui, std::ostream& out,
+                   std::ostream& err) {
+  if (ui) {
+    if (auto error = PostUIOrientation(paths.runtime_dir, *ui)) {
+      return Failure(err, "posting the UI orientation", *error);
+    }
+    return 0;
+  }
+  const PostedOrientation posted = ReadPostedOrientation(paths.runtime_dir);
+  out << "device: " << posted.device.value_or("none") << "\nui: " << posted.ui.value_or("none")
+      << "\n";
   return 0;
 }
 

@@ -28,6 +28,12 @@ int RunDefaultsDelete(const Paths& paths, const std::string& key, std::ostream& 
 // notify post NAME: posts a system-wide notification to every process watching it.
 int RunNotifyPost(const Paths& paths, const std::string& name, std::ostream& err);
 
+// orientation ui VALUE: posts VALUE as the UI orientation. orientation (ui nullopt): prints
+// the device orientation the daemon follows and the UI orientation last posted ("none" for
+// either when there is none), one "device: ..." and one "ui: ..." line.
+int RunOrientation(const Paths& paths, const std::optional<std::string>& ui, std::ostream& out,
+                   std::ostream& err);
+
 struct EventsOptions {
   ReportingRowFilter filter;
   bool json = false;    // one JSON object per row instead of aligned columns

@@ -224,6 +224,18 @@ int Run(std::vector<std::string> args, std::istream& in, std::ostream& out, std:
       ->required()
       ->check(Check("needs a non-empty name", [](const std::string& t) { return !t.empty(); }));
 
+  CLI::App* orientation = app.add_subcommand(
+      "orientation", "Show the device and UI orientation, or post the UI orientation");
+  std::string ui_orientation;
+  CLI::App* post_ui = orientation->add_subcommand("ui", "Post VALUE as the UI orientation");
+  post_ui->add_option("VALUE", ui_orientation, "normal, bottom-up, left-up, right-up or undefined")
+      ->type_name("")
+      ->required();
+  orientation->footer(
+      "\nThe device orientation is what the daemon follows from iio-sensor-proxy while a session\n"
+      "reports orientation. The UI orientation is what the display side posts: a compositor\n"
+      "hook or a user service runs `qnreport orientation ui left-up` at each rotation.\n");
+
   EventsOptions events_options;
   std::string sink, since;
   CLI::App* events = app.add_subcommand("events", "Show what the reporting store holds");
@@ -302,6 +314,10 @@ int Run(std::vector<std::string> args, std::istream& in, std::ostream& out, std:
   if (top->parsed()) {
     if (isatty(STDOUT_FILENO)) top_options.terminal = STDOUT_FILENO;
     return RunTop(resolved, top_options, out, err);
+  }
+  if (orientation->parsed()) {
+    return RunOrientation(
+        resolved, post_ui->parsed() ? std::optional(ui_orientation) : std::nullopt, out, err);
   }
   if (events->parsed()) {
     if (!sink.empty()) events_options.filter.sink = ParseReportingSink(sink);
