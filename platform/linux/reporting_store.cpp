@@ -15,6 +15,8 @@
 #include <vector>
 
 #include "common/Json.h"
+#include "platform/linux/store/schema.h"
+#include "platform/linux/store/sqlite.h"
 
 // An error line to the store's log, when it has one.
 #define QN_STORE_ERROR(format, ...)                                                \
@@ -24,43 +26,6 @@
 
 namespace qn {
 namespace {
-
-// The schema this program writes. Version 1: the four tables below.
-constexpr int kSchemaVersion = 1;
-
-constexpr const char* kCreateSchema = R"sql(
-CREATE TABLE IF NOT EXISTS livo_sessions(
-  id INTEGER PRIMARY KEY,
-  session_info TEXT NOT NULL,
-  user_info TEXT NOT NULL,
-  created REAL NOT NULL,
-  flushed REAL
-);
-CREATE TABLE IF NOT EXISTS livo_messages(
-  id INTEGER PRIMARY KEY,
-  session INTEGER REFERENCES livo_sessions(id),
-  category INTEGER NOT NULL,
-  type INTEGER NOT NULL,
-  payload TEXT NOT NULL,
-  session_info TEXT,
-  user_info TEXT,
-  time REAL NOT NULL
-);
-CREATE TABLE IF NOT EXISTS analytics_events(
-  id INTEGER PRIMARY KEY,
-  name TEXT NOT NULL,
-  payload TEXT NOT NULL,
-  time REAL NOT NULL
-);
-CREATE TABLE IF NOT EXISTS powerlog_events(
-  id INTEGER PRIMARY KEY,
-  subsystem INTEGER NOT NULL,
-  name TEXT NOT NULL,
-  payload TEXT NOT NULL,
-  time REAL NOT NULL
-);
-PRAGMA user_version = 1;
-)sql";
 
 // A vector that grew beyond this many records for a burst is given back afterwards.
 constexpr std::size_t kKeptQueueCapacity = 1 << 18;
@@ -74,19 +39,12 @@ double WallNow() {
   return static_cast<double>(ts.tv_sec) + static_cast<double>(ts.tv_nsec) * 1e-9;
 }
 
-struct DbCloser {
-  void operator()(sqlite3* db) const { sqlite3_close_v2(db); }
-};
-struct StmtFinalizer {
-  void operator()(sqlite3_stmt* stmt) const { sqlite3_finalize(stmt); }
-};
-using DbHandle = std::unique_ptr<sqlite3, DbCloser>;
-using Statement = std::unique_ptr<sqlite3_stmt, StmtFinalizer>;
-
-Error SqliteError(sqlite3* db, int rc, const std::string& what) {
-  std::string message = db ? sqlite3_errmsg(db) : sqlite3_errstr(rc);
-  return Error{kReportingStoreErrorDomain, rc, what + ": " + message};
-}
+using store::DbHandle;
+using store::Exec;
+using store::QueryInt;
+using store::SqliteError;
+using store::Statement;
+using store::Step;
 
 // Runs `task` on a short-lived thread of its own: for callbacks that must not run on the
 // caller's stack when the writer thread is gone.
@@ -307,18 +265,19 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
         {&commit_, "COMMIT"},
         {&rollback_, "ROLLBACK"},
         {&insert_session_,
-         "INSERT INTO livo_sessions(id, session_info, user_info, created) VALUES(?1, ?2, ?3, ?4)"},
-        {&flush_session_, "UPDATE livo_sessions SET flushed = ?2 WHERE id = ?1"},
+         "INSERT INTO store_sessions(id, session_info, user_info, created) VALUES(?1, ?2, ?3, ?4)"},
+        {&flush_session_, "UPDATE store_sessions SET flushed = ?2 WHERE id = ?1"},
         {&insert_message_,
-         "INSERT INTO livo_messages(session, category, type, payload, time) "
+         "INSERT INTO store_messages(session, category, type, payload, time) "
          "VALUES(?1, ?2, ?3, ?4, ?5)"},
         {&insert_single_,
-         "INSERT INTO livo_messages(session, category, type, payload, session_info, user_info, "
+         "INSERT INTO store_messages(session, category, type, payload, session_info, user_info, "
          "time) VALUES(NULL, ?1, ?2, ?3, ?4, ?5, ?6)"},
         {&insert_analytics_,
-         "INSERT INTO analytics_events(name, payload, time) VALUES(?1, ?2, ?3)"},
+         "INSERT INTO store_analytics(name, message, host, payload, time) "
+         "VALUES(?1, ?2, ?3, ?4, ?5)"},
         {&insert_powerlog_,
-         "INSERT INTO powerlog_events(subsystem, name, payload, time) VALUES(?1, ?2, ?3, ?4)"},
+         "INSERT INTO store_powerlog(subsystem, name, payload, time) VALUES(?1, ?2, ?3, ?4)"},
     };
     for (auto& s : statements) {
       sqlite3_stmt* stmt = nullptr;
@@ -596,13 +555,6 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
     return failure.error;
   }
 
-  // Runs a statement that returns no rows and resets it. Returns SQLite's result code.
-  static int Step(sqlite3_stmt* stmt) {
-    int rc = sqlite3_step(stmt);
-    sqlite3_reset(stmt);
-    return rc;
-  }
-
   // Binds the JSON text of `value`, written into `buffer`, which must then stay untouched
   // until the statement has run.
   static void BindJson(sqlite3_stmt* stmt, int index, std::string& buffer, const Value& value) {
@@ -653,8 +605,10 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
         if (r.extra->provider) r.payload = CallProvider(r.extra->provider, r.extra->name);
         r.extra->provider = nullptr;
         BindText(stmt, 1, r.extra->name);
-        BindJson(stmt, 2, json_payload_, r.payload);
-        sqlite3_bind_double(stmt, 3, r.time);
+        sqlite3_bind_null(stmt, 2);
+        sqlite3_bind_null(stmt, 3);
+        BindJson(stmt, 4, json_payload_, r.payload);
+        sqlite3_bind_double(stmt, 5, r.time);
         break;
       }
       case RecordKind::kPowerLog:
@@ -765,36 +719,10 @@ void Register(const std::shared_ptr<ReportingStoreWriter>& writer) {
   registry.writers.push_back(writer);
 }
 
-// Runs one statement that returns no rows, outside the writer.
-std::optional<Error> Exec(sqlite3* db, const char* sql, const std::string& what) {
-  char* message = nullptr;
-  int rc = sqlite3_exec(db, sql, nullptr, nullptr, &message);
-  if (rc == SQLITE_OK) return std::nullopt;
-  Error error{kReportingStoreErrorDomain, rc,
-              what + ": " + (message ? message : sqlite3_errstr(rc))};
-  sqlite3_free(message);
-  return error;
-}
-
-// A single integer from `sql`, or the error.
-std::optional<Error> QueryInt(sqlite3* db, const char* sql, std::int64_t* out) {
-  sqlite3_stmt* raw = nullptr;
-  int rc = sqlite3_prepare_v2(db, sql, -1, &raw, nullptr);
-  Statement stmt(raw);
-  if (rc != SQLITE_OK) return SqliteError(db, rc, sql);
-  rc = sqlite3_step(stmt.get());
-  if (rc == SQLITE_ROW) {
-    *out = sqlite3_column_int64(stmt.get(), 0);
-    return std::nullopt;
-  }
-  if (rc == SQLITE_DONE) return std::nullopt;
-  return SqliteError(db, rc, sql);
-}
-
 // Opens the database, sets the journal and creates or checks the schema. Returns the
 // first free session id through *next_session_id.
 std::optional<Error> OpenDatabase(const std::string& path, const ReportingStore::Options& options,
-                                  DbHandle* out, std::int64_t* next_session_id) {
+                                  Log* log, DbHandle* out, std::int64_t* next_session_id) {
   sqlite3* raw = nullptr;
   int rc =
       sqlite3_open_v2(path.c_str(), &raw,
@@ -816,22 +744,15 @@ std::optional<Error> OpenDatabase(const std::string& path, const ReportingStore:
     return e;
   }
 
-  std::int64_t version = 0;
-  if (auto e = QueryInt(db.get(), "PRAGMA user_version", &version)) return e;
-  if (version > kSchemaVersion) {
-    return Error{kReportingStoreErrorDomain, SQLITE_ERROR,
-                 path + ": schema version " + std::to_string(version) +
-                     " is newer than this program's (" + std::to_string(kSchemaVersion) + ")"};
-  }
-  if (version < kSchemaVersion) {
-    std::string sql = std::string("BEGIN IMMEDIATE;") + kCreateSchema + "COMMIT;";
-    if (auto e = Exec(db.get(), sql.c_str(), "create schema in " + path)) {
-      Exec(db.get(), "ROLLBACK", "rollback");
-      return e;
-    }
-  }
+  if (auto e = store::MigrateSchema(db.get(), path, log)) return e;
+  // Session ids are ours (NewSessionId): above every id in the table and every id it
+  // ever had (AUTOINCREMENT's sequence), so that none is reused.
   std::int64_t max_id = 0;
-  if (auto e = QueryInt(db.get(), "SELECT IFNULL(MAX(id), 0) FROM livo_sessions", &max_id)) {
+  if (auto e = QueryInt(db.get(),
+                        "SELECT max(IFNULL((SELECT max(id) FROM store_sessions), 0), "
+                        "IFNULL((SELECT seq FROM sqlite_sequence WHERE name = "
+                        "'store_sessions'), 0))",
+                        &max_id)) {
     return e;
   }
   *next_session_id = max_id + 1;
@@ -853,7 +774,7 @@ std::shared_ptr<ReportingStore> ReportingStore::Open(const std::string& path,
                                                      std::optional<Error>* error) {
   DbHandle db;
   std::int64_t next_session_id = 1;
-  std::optional<Error> failure = OpenDatabase(path, options, &db, &next_session_id);
+  std::optional<Error> failure = OpenDatabase(path, options, log.get(), &db, &next_session_id);
   std::shared_ptr<ReportingStoreWriter> writer;
   if (!failure) {
     writer = std::make_shared<ReportingStoreWriter>(std::move(db), std::move(log), options,
