@@ -4,8 +4,10 @@ qn_library(qn_linux_store
   LINK qn_common PkgConfig::SQLITE3 Threads::Threads
   FILES
     reporting_store.cpp
+    store/checkpointer.cpp
     store/schema.cpp
     store/sqlite.cpp
+    store/writer.cpp
     reporting_store_reader.cpp
     store_sinks.cpp
 )
