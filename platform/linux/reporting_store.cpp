@@ -53,10 +53,12 @@ void Register(const std::shared_ptr<ReportingStoreWriter>& writer) {
   registry.writers.push_back(writer);
 }
 
-// Opens the database, sets the journal and creates or checks the schema. Returns the
-// first free session id through *next_session_id.
+// Opens the database, sets the journal and checks the schema's version (a newer one than
+// this program's is refused). Returns the first free session id through
+// *next_session_id and the version through *schema_version.
 std::optional<Error> OpenDatabase(const std::string& path, const ReportingStore::Options& options,
-                                  Log* log, DbHandle* out, std::int64_t* next_session_id) {
+                                  DbHandle* out, std::int64_t* next_session_id,
+                                  int* schema_version) {
   sqlite3* raw = nullptr;
   int rc =
       sqlite3_open_v2(path.c_str(), &raw,
@@ -78,17 +80,18 @@ std::optional<Error> OpenDatabase(const std::string& path, const ReportingStore:
     return e;
   }
 
-  if (auto e = store::MigrateSchema(db.get(), path, log)) return e;
+  int version = 0;
+  if (auto e = store::CheckSchemaVersion(db.get(), path, &version)) return e;
   // Session ids are ours (NewSessionId): above every id in the table and every id it
   // ever had (AUTOINCREMENT's sequence), so that none is reused.
+  const char* max_id_sql =
+      version >= 2   ? "SELECT max(IFNULL((SELECT max(id) FROM store_sessions), 0), "
+                       "IFNULL((SELECT seq FROM sqlite_sequence WHERE name = 'store_sessions'), 0))"
+      : version == 1 ? "SELECT IFNULL(max(id), 0) FROM livo_sessions"
+                     : "SELECT 0";
   std::int64_t max_id = 0;
-  if (auto e = QueryInt(db.get(),
-                        "SELECT max(IFNULL((SELECT max(id) FROM store_sessions), 0), "
-                        "IFNULL((SELECT seq FROM sqlite_sequence WHERE name = "
-                        "'store_sessions'), 0))",
-                        &max_id)) {
-    return e;
-  }
+  if (auto e = QueryInt(db.get(), max_id_sql, &max_id)) return e;
+  *schema_version = version;
   *next_session_id = max_id + 1;
   *out = std::move(db);
   return std::nullopt;
@@ -108,12 +111,15 @@ std::shared_ptr<ReportingStore> ReportingStore::Open(const std::string& path,
                                                      std::optional<Error>* error) {
   DbHandle db;
   std::int64_t next_session_id = 1;
-  std::optional<Error> failure = OpenDatabase(path, options, log.get(), &db, &next_session_id);
+  int version = 0;
+  std::optional<Error> failure = OpenDatabase(path, options, &db, &next_session_id, &version);
   std::shared_ptr<ReportingStoreWriter> writer;
   if (!failure) {
     writer = std::make_shared<ReportingStoreWriter>(std::move(db), std::move(log), options,
                                                     next_session_id);
-    failure = writer->Prepare();
+    // A new file gets its schema at once; an older one is migrated by the writer thread,
+    // which takes records meanwhile.
+    if (version == 0 || version == store::kSchemaVersion) failure = writer->Ready();
   }
   if (failure) {
     if (error) *error = std::move(failure);

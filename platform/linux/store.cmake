@@ -5,6 +5,7 @@ qn_library(qn_linux_store
   FILES
     reporting_store.cpp
     store/checkpointer.cpp
+    store/repeats.cpp
     store/schema.cpp
     store/sqlite.cpp
     store/writer.cpp

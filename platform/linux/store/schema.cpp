@@ -169,7 +169,6 @@ std::optional<Error> MigrateSchema(sqlite3* db, const std::string& path, Log* lo
   if (auto e = Exec(db, "BEGIN IMMEDIATE", "begin the migration of " + path)) return e;
   // Another process may have migrated it meanwhile; the version read inside counts.
   std::optional<Error> failure = CheckSchemaVersion(db, path, &version);
-  const int from = version;
   for (; !failure && version < kSchemaVersion; ++version) {
     std::string done;
     failure = kSteps[version](db, &done);
@@ -187,23 +186,25 @@ std::optional<Error> MigrateSchema(sqlite3* db, const std::string& path, Log* lo
     Exec(db, "ROLLBACK", "roll back");
     return failure;
   }
-  std::int64_t auto_vacuum = 0;
-  QueryInt(db, "PRAGMA auto_vacuum", &auto_vacuum);
-  if (auto_vacuum != 2 && from > 0) {
-    // Switching a file with tables to incremental auto-vacuum takes a VACUUM (a copy of
-    // the whole file); once done, retention can give pages back to the file system.
-    auto e = Exec(db, "PRAGMA auto_vacuum=INCREMENTAL", "set auto-vacuum");
-    if (!e) e = Exec(db, "VACUUM", "vacuum " + path);
-    if (e && log) {
-      QN_LOG(*log, nullptr, LogLevel::kError,
-             "%s:%d:%s: reporting store: %s; removed rows leave free pages in the file",
-             e->description);
-    } else if (!e) {
-      Note(log, "%s:%d:%s: reporting store %s: schema version %d to %d: %s", path, from,
-           kSchemaVersion, "vacuumed the file for incremental auto-vacuum");
-    }
-  }
   return std::nullopt;
+}
+
+void EnsureIncrementalVacuum(sqlite3* db, const std::string& path, Log* log) {
+  std::int64_t auto_vacuum = 0;
+  if (QueryInt(db, "PRAGMA auto_vacuum", &auto_vacuum) || auto_vacuum == 2) return;
+  // Switching a file with tables to incremental auto-vacuum takes a VACUUM (a copy of the
+  // whole file); once done, retention can give pages back to the file system.
+  auto e = Exec(db, "PRAGMA auto_vacuum=INCREMENTAL", "set auto-vacuum");
+  if (!e) e = Exec(db, "VACUUM", "vacuum " + path);
+  if (!log) return;
+  if (e) {
+    QN_LOG(*log, nullptr, LogLevel::kError,
+           "%s:%d:%s: reporting store: %s; removed rows leave free pages in the file",
+           e->description);
+  } else {
+    QN_LOG(*log, nullptr, LogLevel::kDefault,
+           "%s:%d:%s: reporting store %s: vacuumed the file, so that it can shrink", path);
+  }
 }
 
 }  // namespace qn::store

@@ -34,10 +34,15 @@ std::optional<Error> CheckSchemaVersion(sqlite3* db, const std::string& path, in
 
 // Brings `db` to kSchemaVersion: every step from its version on, one function per step, in
 // one transaction that also writes the version, so that the file is either as it was or
-// fully migrated. A new (empty) file gets incremental auto-vacuum first; a migrated one
-// that lacks it is vacuumed once afterwards (outside the transaction; a failure there is
-// logged, not returned). Each step's work is logged at the default level through `log`
-// (may be null). Returns the error of a failed step (the transaction is rolled back).
+// fully migrated. A new (empty) file gets incremental auto-vacuum first. Each step's work
+// is logged at the default level through `log` (may be null). Returns the error of a
+// failed step (the transaction is rolled back).
 std::optional<Error> MigrateSchema(sqlite3* db, const std::string& path, Log* log);
+
+// Turns incremental auto-vacuum on for a file made without it (one VACUUM, a copy of the
+// file, logged); does nothing when it is on. A failure (a reader in the way, no room for
+// the copy) is logged at error level: the file then keeps its free pages, and the next
+// start tries again.
+void EnsureIncrementalVacuum(sqlite3* db, const std::string& path, Log* log);
 
 }  // namespace qn::store

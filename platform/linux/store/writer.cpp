@@ -93,6 +93,16 @@ ReportingStoreWriter::~ReportingStoreWriter() {
   if (thread_.joinable()) thread_.detach();
 }
 
+std::optional<Error> ReportingStoreWriter::Ready() {
+  if (ready_) return std::nullopt;
+  const std::string path = sqlite3_db_filename(db_.get(), "main");
+  if (auto e = store::MigrateSchema(db_.get(), path, log_.get())) return e;
+  store::EnsureIncrementalVacuum(db_.get(), path, log_.get());
+  if (auto e = Prepare()) return e;
+  ready_ = true;
+  return std::nullopt;
+}
+
 std::optional<Error> ReportingStoreWriter::Prepare() {
   struct {
     Statement* stmt;
@@ -207,6 +217,11 @@ bool ReportingStoreWriter::open() const {
 }
 
 void ReportingStoreWriter::Run() {
+  if (auto e = Ready()) {
+    failing_rc_ = static_cast<int>(e->code);
+    QN_STORE_ERROR("%s:%d:%s: reporting store: %s; records are lost until it works",
+                   e->description);
+  }
   std::vector<Record> batch;
   for (;;) {
     std::uint64_t dropped = 0;
@@ -302,6 +317,7 @@ void ReportingStoreWriter::CloseDatabase() {
 
 std::optional<Error> ReportingStoreWriter::WriteBatch(std::vector<Record>& batch) {
   const auto all = std::span<Record>(batch);
+  if (auto e = Ready()) return LoseAll(all, Failure{static_cast<int>(e->code), e->description, *e});
   std::optional<Failure> failure = WriteTransaction(all);
   if (failure) failure = WriteTransaction(all);
   if (!failure) return std::nullopt;
@@ -323,12 +339,25 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
     std::span<Record> records) {
   int rc = Step(begin_.get());
   if (rc != SQLITE_DONE) return Fail(rc, "begin");
-  for (Record& record : records) {
-    rc = WriteRecord(record);
-    if (rc != SQLITE_DONE) return Fail(rc, "insert");
+  const std::size_t remembered = recent_messages_.Mark();
+  // Analytics events after the rest: one that repeats a message of the same batch (handed
+  // over before it, as the message waits for its session's queue) then finds its row. Ids
+  // still follow hand-over within each table.
+  for (const bool analytics : {false, true}) {
+    for (Record& record : records) {
+      if ((record.kind == RecordKind::kAnalytics) != analytics) continue;
+      rc = WriteRecord(record);
+      if (rc != SQLITE_DONE) {
+        recent_messages_.Forget(remembered);
+        return Fail(rc, "insert");
+      }
+    }
   }
   rc = Step(commit_.get());
-  if (rc != SQLITE_DONE) return Fail(rc, "commit");
+  if (rc != SQLITE_DONE) {
+    recent_messages_.Forget(remembered);
+    return Fail(rc, "commit");
+  }
   if (failing_rc_ != 0) {
     if (log_) {
       QN_LOG(*log_, nullptr, LogLevel::kDefault,
@@ -413,9 +442,16 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
       if (r.extra->provider) r.payload = CallProvider(r.extra->provider, r.extra->name);
       r.extra->provider = nullptr;
       BindText(stmt, 1, r.extra->name);
-      sqlite3_bind_null(stmt, 2);
-      sqlite3_bind_null(stmt, 3);
-      BindJson(stmt, 4, json_payload_, r.payload);
+      if (auto repeat = recent_messages_.Find(r.payload)) {
+        sqlite3_bind_int64(stmt, 2, repeat->message);
+        sqlite3_bind_text(stmt, 3, repeat->host.data(), static_cast<int>(repeat->host.size()),
+                          SQLITE_TRANSIENT);
+        sqlite3_bind_null(stmt, 4);
+      } else {
+        sqlite3_bind_null(stmt, 2);
+        sqlite3_bind_null(stmt, 3);
+        BindJson(stmt, 4, json_payload_, r.payload);
+      }
       sqlite3_bind_double(stmt, 5, r.time);
       break;
     }
@@ -439,7 +475,12 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
     case RecordKind::kTask:
       return SQLITE_DONE;
   }
-  return Step(stmt);
+  const int rc = Step(stmt);
+  if (rc == SQLITE_DONE &&
+      (r.kind == RecordKind::kSessionMessage || r.kind == RecordKind::kSingleMessage)) {
+    recent_messages_.Add(sqlite3_last_insert_rowid(db_.get()), r.payload);
+  }
+  return rc;
 }
 
 Value ReportingStoreWriter::CallProvider(const std::function<Value()>& provider,

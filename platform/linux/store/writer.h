@@ -18,6 +18,7 @@
 #include "common/Value.h"
 #include "platform/linux/reporting_store.h"
 #include "platform/linux/store/checkpointer.h"
+#include "platform/linux/store/repeats.h"
 #include "platform/linux/store/sqlite.h"
 #include "platform/log.h"
 
@@ -71,8 +72,11 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
 
   ~ReportingStoreWriter();
 
-  // Prepares the statements. On failure returns the error and the writer must not start.
-  std::optional<Error> Prepare();
+  // Brings the schema to this program's version (platform/linux/store/schema.h), prepares
+  // the statements and starts the checkpointer, once; returns the error otherwise. Called
+  // by Open for a new or current file, else by the writer thread before its first batch
+  // (and again before each batch while it fails, whose records are then lost).
+  std::optional<Error> Ready();
 
   void Start();
 
@@ -98,6 +102,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   bool open() const;
 
  private:
+  std::optional<Error> Prepare();
   void Run();
 
   // Copies what is left of the WAL into the database, so that the next commit starts the
@@ -151,11 +156,13 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   // Writer-thread state: the connection, its statements, the JSON buffers.
   DbHandle db_;
   std::unique_ptr<store::Checkpointer> checkpointer_;  // writer thread (set before it starts)
-  int wal_pages_ = 0;  // writer thread: frames in the WAL after the last commit
+  bool ready_ = false;  // writer thread once started: Ready succeeded
+  int wal_pages_ = 0;   // writer thread: frames in the WAL after the last commit
   Statement begin_, commit_, rollback_;
   Statement insert_session_, flush_session_, insert_message_, insert_single_;
   Statement insert_analytics_, insert_powerlog_;
   std::string json_payload_, json_session_info_, json_user_info_;
+  store::RecentMessages recent_messages_;  // for analytics events that repeat a message
   int failing_rc_ = 0;  // the error of the database as a whole while writes fail, else 0
   std::uint64_t lost_while_failing_ = 0;
 
