@@ -6,6 +6,7 @@ qn_library(qn_linux_store
     reporting_store.cpp
     store/checkpointer.cpp
     store/repeats.cpp
+    store/retention.cpp
     store/schema.cpp
     store/sqlite.cpp
     store/writer.cpp

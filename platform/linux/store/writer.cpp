@@ -26,6 +26,8 @@ constexpr std::size_t kKeptQueueCapacity = 1 << 18;
 // How long and up to how many records the writer gathers before a transaction.
 constexpr auto kGatherTime = std::chrono::milliseconds(2);
 constexpr std::size_t kGatherRecords = 512;
+// How often an idle writer lets retention look at the limits.
+constexpr auto kRetentionInterval = std::chrono::seconds(1);
 
 // Whether a failure with SQLite result code `rc` is the database's as a whole (no room,
 // no permission, a lock, an I/O error) rather than one record's: every other record would
@@ -132,6 +134,14 @@ std::optional<Error> ReportingStoreWriter::Prepare() {
     if (rc != SQLITE_OK) return SqliteError(db_.get(), rc, std::string("prepare ") + s.sql);
     s.stmt->reset(stmt);
   }
+  const std::string path = sqlite3_db_filename(db_.get(), "main");
+  store::RetentionLimits limits;
+  limits.max_bytes = options_.max_bytes.value_or(
+      store::DefaultMaxBytes(path.substr(0, path.find_last_of('/') + 1) + "."));
+  limits.max_age_seconds = options_.max_age_seconds;
+  auto retention = std::make_unique<store::Retention>(db_.get(), log_, limits);
+  if (auto e = retention->Prepare()) return e;
+  retention_ = std::move(retention);
   checkpointer_ =
       Checkpointer::Start(sqlite3_db_filename(db_.get(), "main"), options_.busy_timeout_ms);
   if (checkpointer_) {
@@ -222,15 +232,29 @@ void ReportingStoreWriter::Run() {
     QN_STORE_ERROR("%s:%d:%s: reporting store: %s; records are lost until it works",
                    e->description);
   }
+  RunRetention();
   std::vector<Record> batch;
   for (;;) {
     std::uint64_t dropped = 0;
     std::uint64_t batch_end = 0;
     {
       std::unique_lock lock(mu_);
+      // While idle, retention goes on (step by step) when it has more to do, and looks
+      // again once a second.
       while (queue_.empty() && !closing_) {
+        if (retention_busy_) {
+          lock.unlock();
+          RunRetention();
+          lock.lock();
+          continue;
+        }
         writer_idle_ = true;
-        wake_.wait(lock);
+        if (wake_.wait_for(lock, kRetentionInterval) == std::cv_status::timeout) {
+          writer_idle_ = false;
+          lock.unlock();
+          RunRetention();
+          lock.lock();
+        }
       }
       writer_idle_ = false;
       if (queue_.empty()) break;  // closing and nothing left
@@ -272,6 +296,7 @@ void ReportingStoreWriter::Run() {
     }
     if (after_batch) after_batch();
     written_cv_.notify_all();
+    RunRetention();
   }
   std::uint64_t dropped = 0;
   {
@@ -285,6 +310,19 @@ void ReportingStoreWriter::Run() {
     exited_ = true;
   }
   written_cv_.notify_all();
+}
+
+void ReportingStoreWriter::RunRetention() {
+  if (!retention_) return;  // not ready
+  const double now =
+      std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count();
+  retention_busy_ = retention_->Run(now);
+  const store::RetentionStats& figures = retention_->stats();
+  std::lock_guard lock(mu_);
+  stats_.retention_removed = figures.removed;
+  stats_.retention_lost = figures.lost;
+  stats_.bytes_on_disk = figures.bytes_on_disk;
+  stats_.oldest_row_time = figures.oldest_time;
 }
 
 void ReportingStoreWriter::FinishCheckpoint() {

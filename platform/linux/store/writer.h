@@ -19,6 +19,7 @@
 #include "platform/linux/reporting_store.h"
 #include "platform/linux/store/checkpointer.h"
 #include "platform/linux/store/repeats.h"
+#include "platform/linux/store/retention.h"
 #include "platform/linux/store/sqlite.h"
 #include "platform/log.h"
 
@@ -104,6 +105,8 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
  private:
   std::optional<Error> Prepare();
   void Run();
+  // Lets retention remove a step of rows when a limit is passed; updates its stats.
+  void RunRetention();
 
   // Copies what is left of the WAL into the database, so that the next commit starts the
   // WAL over (the commits wait meanwhile, mostly for the fsyncs). While the checkpointer is
@@ -162,7 +165,9 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   Statement insert_session_, flush_session_, insert_message_, insert_single_;
   Statement insert_analytics_, insert_powerlog_;
   std::string json_payload_, json_session_info_, json_user_info_;
-  store::RecentMessages recent_messages_;  // for analytics events that repeat a message
+  std::unique_ptr<store::Retention> retention_;  // set by Prepare
+  bool retention_busy_ = false;                  // it has more to remove
+  store::RecentMessages recent_messages_;        // for analytics events that repeat a message
   int failing_rc_ = 0;  // the error of the database as a whole while writes fail, else 0
   std::uint64_t lost_while_failing_ = 0;
 
