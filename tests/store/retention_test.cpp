@@ -86,6 +86,7 @@ TEST_F(RetentionTest, TheFileShrinksOldestFirstAndUnshippedRowsGoLast) {
     EXPECT_EQ(store->stats().retention_lost, 0u);
   }
   EXPECT_LE(std::filesystem::file_size(db_path_), 3 * kMiB);
+  EXPECT_TRUE(log_->Matching("fail").empty());  // closing included
   EXPECT_EQ(Ids(db_path_, ReportingStoreRow::Table::kPowerLogEvent).size(), 5000u);
   const auto messages = Ids(db_path_, ReportingStoreRow::Table::kLivoMessage);
   EXPECT_TRUE(!messages.empty() && messages.size() < 10000 && NewestOf(messages, 10000));

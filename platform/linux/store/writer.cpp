@@ -344,6 +344,7 @@ void ReportingStoreWriter::CloseDatabase() {
                        &insert_message_, &insert_single_, &insert_analytics_, &insert_powerlog_}) {
     s->reset();
   }
+  retention_.reset();  // its statements
   int rc = sqlite3_close(db_.get());
   if (rc != SQLITE_OK) {
     QN_STORE_ERROR("%s:%d:%s: reporting store: closing the database failed: %s (%d)",
