@@ -378,7 +378,6 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
     std::span<Record> records) {
   int rc = Step(begin_.get());
   if (rc != SQLITE_DONE) return Fail(rc, "begin");
-  const std::size_t remembered = recent_messages_.Mark();
   // Analytics events after the rest: one that repeats a message of the same batch (handed
   // over before it, as the message waits for its session's queue) then finds its row. Ids
   // still follow hand-over within each table.
@@ -387,16 +386,17 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
       if ((record.kind == RecordKind::kAnalytics) != analytics) continue;
       rc = WriteRecord(record);
       if (rc != SQLITE_DONE) {
-        recent_messages_.Forget(remembered);
+        recent_messages_.RolledBack();
         return Fail(rc, "insert");
       }
     }
   }
   rc = Step(commit_.get());
   if (rc != SQLITE_DONE) {
-    recent_messages_.Forget(remembered);
+    recent_messages_.RolledBack();
     return Fail(rc, "commit");
   }
+  recent_messages_.Committed();
   if (failing_rc_ != 0) {
     if (log_) {
       QN_LOG(*log_, nullptr, LogLevel::kDefault,
