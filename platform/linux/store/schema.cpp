@@ -66,7 +66,8 @@ CREATE TABLE store_sessions(
   session_info TEXT NOT NULL,
   user_info TEXT NOT NULL,
   created REAL NOT NULL,
-  flushed REAL
+  flushed REAL,
+  last_message INTEGER
 );
 CREATE TABLE store_messages(
   id INTEGER PRIMARY KEY AUTOINCREMENT,
@@ -78,7 +79,6 @@ CREATE TABLE store_messages(
   user_info TEXT,
   time REAL NOT NULL
 );
-CREATE INDEX store_messages_session ON store_messages(session) WHERE session IS NOT NULL;
 CREATE TABLE store_analytics(
   id INTEGER PRIMARY KEY AUTOINCREMENT,
   name TEXT NOT NULL,
@@ -106,6 +106,10 @@ INSERT INTO store_sessions(id, session_info, user_info, created, flushed)
 INSERT INTO store_messages(id, session, category, type, payload, session_info, user_info, time)
   SELECT id, session, category, type, payload, session_info, user_info, time
   FROM livo_messages ORDER BY id;
+UPDATE store_sessions SET last_message = m.last
+  FROM (SELECT session, max(id) AS last FROM store_messages WHERE session IS NOT NULL
+        GROUP BY session) AS m
+  WHERE m.session = store_sessions.id;
 INSERT INTO store_analytics(id, name, payload, time)
   SELECT id, name, payload, time FROM analytics_events ORDER BY id;
 INSERT INTO store_powerlog(id, subsystem, name, payload, time)

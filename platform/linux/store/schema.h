@@ -11,7 +11,9 @@
 // The store's schema: its versions and the steps from each to the next.
 //
 // Version 2 (this program's) keeps one row per delivered message:
-//   store_sessions(id, session_info, user_info, created, flushed)
+//   store_sessions(id, session_info, user_info, created, flushed, last_message)
+//       last_message: the newest message row of the session (NULL: none yet), written
+//       once per transaction; retention keeps the session while that row remains.
 //   store_messages(id, session NULL, category, type, payload, session_info NULL,
 //                  user_info NULL, time)
 //   store_analytics(id, name, message NULL, host NULL, payload NULL, time)

@@ -116,6 +116,7 @@ std::optional<Error> ReportingStoreWriter::Prepare() {
       {&insert_session_,
        "INSERT INTO store_sessions(id, session_info, user_info, created) VALUES(?1, ?2, ?3, ?4)"},
       {&flush_session_, "UPDATE store_sessions SET flushed = ?2 WHERE id = ?1"},
+      {&set_last_message_, "UPDATE store_sessions SET last_message = ?2 WHERE id = ?1"},
       {&insert_message_,
        "INSERT INTO store_messages(session, category, type, payload, time) "
        "VALUES(?1, ?2, ?3, ?4, ?5)"},
@@ -340,8 +341,9 @@ void ReportingStoreWriter::CloseDatabase() {
   // everything and removes the WAL file.
   sqlite3_wal_hook(db_.get(), nullptr, nullptr);
   checkpointer_.reset();
-  for (Statement* s : {&begin_, &commit_, &rollback_, &insert_session_, &flush_session_,
-                       &insert_message_, &insert_single_, &insert_analytics_, &insert_powerlog_}) {
+  for (Statement* s :
+       {&begin_, &commit_, &rollback_, &insert_session_, &flush_session_, &set_last_message_,
+        &insert_message_, &insert_single_, &insert_analytics_, &insert_powerlog_}) {
     s->reset();
   }
   retention_.reset();  // its statements
@@ -378,6 +380,7 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
     std::span<Record> records) {
   int rc = Step(begin_.get());
   if (rc != SQLITE_DONE) return Fail(rc, "begin");
+  session_last_message_.clear();
   // Analytics events after the rest: one that repeats a message of the same batch (handed
   // over before it, as the message waits for its session's queue) then finds its row. Ids
   // still follow hand-over within each table.
@@ -391,6 +394,16 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
       }
     }
   }
+  for (const auto& [session, last] : session_last_message_) {
+    sqlite3_bind_int64(set_last_message_.get(), 1, session);
+    sqlite3_bind_int64(set_last_message_.get(), 2, last);
+    rc = Step(set_last_message_.get());
+    if (rc != SQLITE_DONE) {
+      recent_messages_.RolledBack();
+      return Fail(rc, "update");
+    }
+  }
+  session_last_message_.clear();
   rc = Step(commit_.get());
   if (rc != SQLITE_DONE) {
     recent_messages_.RolledBack();
@@ -517,7 +530,9 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
   const int rc = Step(stmt);
   if (rc == SQLITE_DONE &&
       (r.kind == RecordKind::kSessionMessage || r.kind == RecordKind::kSingleMessage)) {
-    recent_messages_.Add(sqlite3_last_insert_rowid(db_.get()), r.payload);
+    const std::int64_t id = sqlite3_last_insert_rowid(db_.get());
+    recent_messages_.Add(id, r.payload);
+    if (r.kind == RecordKind::kSessionMessage) session_last_message_[r.id] = id;
   }
   return rc;
 }
