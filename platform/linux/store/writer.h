@@ -104,6 +104,12 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   bool open() const;
 
  private:
+  // The tables whose rows the writer gives ids (sessions get theirs from NewSessionId).
+  enum Table { kSessions, kMessages, kAnalytics, kPowerLog, kTables };
+  // The next id of `table`'s sequence, noted as written in this transaction. Ids taken by a
+  // transaction that is rolled back are skipped, never reused.
+  std::int64_t TakeId(Table table);
+
   std::optional<Error> Prepare();
   void Run();
   // Lets retention remove a step of rows when a limit is passed; updates its stats.
@@ -164,7 +170,9 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   int wal_pages_ = 0;   // writer thread: frames in the WAL after the last commit
   Statement begin_, commit_, rollback_;
   Statement insert_session_, flush_session_, set_last_message_, insert_message_, insert_single_;
-  Statement insert_analytics_, insert_powerlog_;
+  Statement insert_analytics_, insert_powerlog_, raise_sequence_;
+  std::int64_t next_ids_[kTables] = {};     // writer thread: the next id of each table
+  std::int64_t written_ids_[kTables] = {};  // writer thread: this transaction's highest
   std::string json_payload_, json_session_info_, json_user_info_;
   std::unique_ptr<store::Retention> retention_;  // set by Prepare
   bool retention_busy_ = false;                  // it has more to remove
