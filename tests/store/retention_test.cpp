@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "platform/linux/store/retention.h"
+#include "platform/linux/store_sinks.h"
 #include "tests/store/store_test_util.h"
 
 namespace qn {
@@ -142,6 +143,50 @@ TEST_F(RetentionTest, TheAgeLimitRemovesShippedRowsAndKeepsSessionsWithMessages)
       std::chrono::duration<double>(std::chrono::system_clock::now().time_since_epoch()).count() -
           *oldest,
       86000);
+}
+
+// An analytics event that refers to a message goes with it; what is left reads back whole.
+TEST_F(RetentionTest, EventsThatReferToAMessageGoWithIt) {
+  {
+    auto store = OpenWithLimits(0);
+    auto analytics = NewStoreAnalytics(store);
+    const std::int64_t session = store->NewSessionId();
+    store->AddSession(session, Value(Dictionary{}), Value(Dictionary{}));
+    testing::WriterGate gate;  // one transaction: every event finds its message
+    gate.Close(*store);
+    for (int i = 0; i < 2000; ++i) {
+      const Dictionary message{{"n", i}};
+      Dictionary event = message;
+      event.Set("HostApplicationDisplayID", "App");
+      analytics->SendEventLazy("e", [event] { return Value(event); });
+      store->AddSessionMessage(session, 1, 1, Value(message));
+    }
+    gate.Release();
+    store->Drain();
+  }
+  // A day old and shipped: events 1 to 1200. They go; their messages stay.
+  Exec(db_path_,
+       "UPDATE store_analytics SET time = time - 86400 WHERE id <= 1200;"
+       "INSERT INTO export_cursors VALUES('x', 'analytics', 1500)");
+  {
+    auto store = OpenWithLimits(0, 3600);
+    ASSERT_TRUE(WaitFor(*store, [](auto& s) { return s.retention_removed >= 1200; }));
+  }
+  EXPECT_EQ(Ids(db_path_, ReportingStoreRow::Table::kLivoMessage).size(), 2000u);
+  auto events = ReadRows(db_path_, ReportingSink::kAnalytics);
+  ASSERT_EQ(events.size(), 800u);
+  EXPECT_EQ(events.front().payload, R"({"n":1200,"HostApplicationDisplayID":"App"})");
+
+  // Now the messages are a day old and every event is shipped: the messages go, and the
+  // (recent) events that refer to them with them.
+  Exec(db_path_,
+       "UPDATE store_messages SET time = time - 86400;"
+       "UPDATE export_cursors SET last_id = 2000");
+  auto store = OpenWithLimits(0, 3600);
+  ASSERT_TRUE(WaitFor(*store, [](auto& s) { return s.retention_removed >= 2800; }));
+  EXPECT_TRUE(Ids(db_path_, ReportingStoreRow::Table::kLivoMessage).empty());
+  EXPECT_TRUE(ReadRows(db_path_, ReportingSink::kAnalytics).empty());
+  EXPECT_EQ(store->stats().retention_lost, 0u);
 }
 
 TEST(RetentionLimitsTest, SizesAndDurationsParse) {

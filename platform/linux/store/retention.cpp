@@ -31,8 +31,7 @@ constexpr KindSql kKindSql[] = {
     {"sessions", "store_sessions", "created",
      "(t.last_message IS NULL OR t.last_message < "
      "(SELECT IFNULL(min(id), 9223372036854775807) FROM store_messages))"},
-    {"messages", "store_messages", "time",
-     "NOT EXISTS (SELECT 1 FROM store_analytics a WHERE a.message = t.id AND a.id > ?3)"},
+    {"messages", "store_messages", "time", "1"},
     {"analytics", "store_analytics", "time", "1"},
     {"powerlog", "store_powerlog", "time", "1"},
 };
@@ -131,7 +130,19 @@ std::optional<Error> Retention::Prepare() {
       if (auto e = store::Prepare(db_, sql->c_str(), stmt)) return e;
     }
   }
-  return store::Prepare(db_, "DELETE FROM store_analytics WHERE message = ?1", &delete_refs_);
+  if (auto e = store::Prepare(db_,
+                              "SELECT rowid, first_message, last_message, first_event, last_event "
+                              "FROM store_links ORDER BY rowid",
+                              &links_)) {
+    return e;
+  }
+  if (auto e = store::Prepare(db_, "DELETE FROM store_links WHERE rowid = ?1", &delete_link_)) {
+    return e;
+  }
+  return store::Prepare(db_,
+                        "DELETE FROM store_analytics WHERE id BETWEEN ?1 AND ?2 AND "
+                        "message BETWEEN ?3 AND ?4",
+                        &delete_refs_);
 }
 
 void Retention::RefreshSize() {
@@ -175,6 +186,10 @@ std::uint64_t Retention::Step(double before, bool shipped_only) {
     }
     sqlite3_reset(stmt);
   }
+  // A message stays while an analytics event that refers to it is not shipped.
+  if (shipped_only && shipped_[kAnalytics] != kAll) {
+    shipped_[kMessages] = std::min(shipped_[kMessages], LinkedCut(shipped_[kAnalytics]));
+  }
   // The kind whose oldest removable row is the oldest of all, up to the next kind's oldest.
   std::optional<double> times[kKinds];
   int kind = -1;
@@ -199,19 +214,19 @@ std::uint64_t Retention::Step(double before, bool shipped_only) {
   }
   std::uint64_t removed = 0;
   std::uint64_t lost = 0;
+  if (kind == kMessages && !ids.empty()) {
+    // The events that refer to these messages go with them.
+    const std::uint64_t events = RemoveReferringEvents(ids.front(), ids.back());
+    removed += events;
+    if (!shipped_only && shipped_[kAnalytics] != kAll) lost += events;
+  }
   for (std::int64_t id : ids) {
-    if (kind == kMessages) {
-      sqlite3_bind_int64(delete_refs_.get(), 1, id);
-      if (store::Step(delete_refs_.get()) != SQLITE_DONE) break;
-      const auto events = static_cast<std::uint64_t>(sqlite3_changes(db_));
-      removed += events;
-      if (!shipped_only && shipped_[kAnalytics] != kAll) lost += events;
-    }
     sqlite3_bind_int64(delete_[kind].get(), 1, id);
     if (store::Step(delete_[kind].get()) != SQLITE_DONE) break;
     ++removed;
     if (id > shipped_[kind]) ++lost;
   }
+  if (kind == kMessages && !ids.empty()) PruneLinks();
   if (Exec(db_, "COMMIT", "retention")) {
     Exec(db_, "ROLLBACK", "retention");
     return 0;
@@ -220,6 +235,69 @@ std::uint64_t Retention::Step(double before, bool shipped_only) {
   stats_.lost += lost;
   lost_unlogged_ += lost;
   return removed;
+}
+
+std::vector<Retention::LinkRow> Retention::LinkRows(std::int64_t through_message) {
+  // Link rows are in transaction order and an event refers to a message of its own
+  // transaction or the one before, so once two rows in a row start past
+  // `through_message`, every later row does too.
+  std::vector<LinkRow> rows;
+  int beyond = 0;
+  sqlite3_stmt* stmt = links_.get();
+  while (beyond < 2 && sqlite3_step(stmt) == SQLITE_ROW) {
+    LinkRow row{sqlite3_column_int64(stmt, 0), sqlite3_column_int64(stmt, 1),
+                sqlite3_column_int64(stmt, 2), sqlite3_column_int64(stmt, 3),
+                sqlite3_column_int64(stmt, 4)};
+    beyond = row.first_message > through_message ? beyond + 1 : 0;
+    rows.push_back(row);
+  }
+  sqlite3_reset(stmt);
+  return rows;
+}
+
+std::int64_t Retention::LinkedCut(std::int64_t events_shipped) {
+  // A step looks at most at the oldest kStepRows messages: the links up to them will do.
+  std::int64_t horizon = kAll - 1;
+  const std::string sql =
+      "SELECT id FROM store_messages ORDER BY id LIMIT 1 OFFSET " + std::to_string(kStepRows - 1);
+  QueryInt(db_, sql.c_str(), &horizon);
+  // The first row with an unshipped event, or the one after it, holds the lowest message
+  // such an event refers to (see LinkRows).
+  std::optional<std::int64_t> lowest;
+  for (const LinkRow& row : LinkRows(horizon)) {
+    if (lowest) {
+      lowest = std::min(*lowest, row.first_message);
+      break;
+    }
+    if (row.last_event > events_shipped) lowest = row.first_message;
+  }
+  return lowest ? *lowest - 1 : kAll;
+}
+
+std::uint64_t Retention::RemoveReferringEvents(std::int64_t first, std::int64_t last) {
+  std::uint64_t removed = 0;
+  for (const LinkRow& row : LinkRows(last)) {
+    if (row.first_message > last || row.last_message < first) continue;
+    sqlite3_stmt* stmt = delete_refs_.get();
+    sqlite3_bind_int64(stmt, 1, row.first_event);
+    sqlite3_bind_int64(stmt, 2, row.last_event);
+    sqlite3_bind_int64(stmt, 3, first);
+    sqlite3_bind_int64(stmt, 4, last);
+    if (store::Step(stmt) == SQLITE_DONE) {
+      removed += static_cast<std::uint64_t>(sqlite3_changes(db_));
+    }
+  }
+  return removed;
+}
+
+void Retention::PruneLinks() {
+  std::int64_t oldest = kAll;
+  QueryInt(db_, "SELECT IFNULL(min(id), 9223372036854775807) FROM store_messages", &oldest);
+  for (const LinkRow& row : LinkRows(oldest)) {
+    if (row.last_message >= oldest) break;  // it still has messages
+    sqlite3_bind_int64(delete_link_.get(), 1, row.rowid);
+    store::Step(delete_link_.get());
+  }
 }
 
 void Retention::Note(const char* what, double now) {

@@ -7,6 +7,7 @@
 #include <optional>
 #include <string>
 #include <string_view>
+#include <vector>
 
 #include "common/Error.h"
 #include "platform/linux/store/sqlite.h"
@@ -72,6 +73,19 @@ class Retention {
   // `shipped_only` is false, unshipped rows too. Returns the rows removed.
   std::uint64_t Step(double before, bool shipped_only);
   std::optional<double> OldestTime(Kind kind, bool shipped_only);
+  // store_links rows (schema.h), oldest first, up to those past `through_message`.
+  struct LinkRow {
+    std::int64_t rowid, first_message, last_message, first_event, last_event;
+  };
+  std::vector<LinkRow> LinkRows(std::int64_t through_message);
+  // The highest message id that no unshipped event (id above `events_shipped`) refers to
+  // or comes before; kAll when there is none.
+  std::int64_t LinkedCut(std::int64_t events_shipped);
+  // Removes the events that refer to messages `first` to `last` (which are removed with
+  // them). Returns the events removed.
+  std::uint64_t RemoveReferringEvents(std::int64_t first, std::int64_t last);
+  // Removes the link rows whose messages are all gone.
+  void PruneLinks();
   void RefreshSize();
   void RefreshOldest();
   void Note(const char* what, double now);
@@ -83,7 +97,9 @@ class Retention {
   Statement oldest_[kKinds];  // the oldest removable row's time
   Statement select_[kKinds];  // up to ?4 removable ids, oldest first
   Statement delete_[kKinds];  // one row by id
-  Statement delete_refs_;     // analytics events that refer to message ?1
+  Statement delete_refs_;     // events ?1..?2 that refer to messages ?3..?4
+  Statement links_;           // store_links, oldest first
+  Statement delete_link_;     // one store_links row
   Statement first_time_[kKinds];
   std::int64_t shipped_[kKinds] = {};  // this step's cut: ids up to it are shipped
   bool over_bytes_ = false;

@@ -87,7 +87,12 @@ CREATE TABLE store_analytics(
   payload TEXT,
   time REAL NOT NULL
 );
-CREATE INDEX store_analytics_message ON store_analytics(message) WHERE message IS NOT NULL;
+CREATE TABLE store_links(
+  first_message INTEGER NOT NULL,
+  last_message INTEGER NOT NULL,
+  first_event INTEGER NOT NULL,
+  last_event INTEGER NOT NULL
+);
 CREATE TABLE store_powerlog(
   id INTEGER PRIMARY KEY,
   subsystem INTEGER NOT NULL,

@@ -19,6 +19,11 @@
 //   store_analytics(id, name, message NULL, host NULL, payload NULL, time)
 //       an event that repeats a message refers to its row (`message`) and keeps only the
 //       HostApplicationDisplayID it adds (`host`); any other event keeps its `payload`.
+//   store_links(first_message, last_message, first_event, last_event): one row per
+//       transaction whose analytics events refer to messages: the range of message ids
+//       they refer to and the range of their own ids. An event refers to a message of
+//       its own transaction or the one before, so retention finds the events of a range
+//       of messages by id ranges, without an index on `message`.
 //   store_powerlog(id, subsystem, name, payload, time)
 //   export_cursors(exporter, kind, last_id): how far each exporter got per kind
 //       ('sessions', 'messages', 'analytics', 'powerlog'), written by the exporter.

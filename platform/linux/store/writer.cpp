@@ -133,6 +133,9 @@ std::optional<Error> ReportingStoreWriter::Prepare() {
       {&insert_powerlog_,
        "INSERT INTO store_powerlog(subsystem, name, payload, time, id) "
        "VALUES(?1, ?2, ?3, ?4, ?5)"},
+      {&insert_link_,
+       "INSERT INTO store_links(first_message, last_message, first_event, last_event) "
+       "VALUES(?1, ?2, ?3, ?4)"},
       {&raise_sequence_,
        "UPDATE store_sequences SET last_id = ?2 WHERE name = ?1 AND last_id < ?2"},
   };
@@ -357,8 +360,8 @@ void ReportingStoreWriter::CloseDatabase() {
   sqlite3_wal_hook(db_.get(), nullptr, nullptr);
   checkpointer_.reset();
   for (Statement* s : {&begin_, &commit_, &rollback_, &insert_session_, &flush_session_,
-                       &set_last_message_, &raise_sequence_, &insert_message_, &insert_single_,
-                       &insert_analytics_, &insert_powerlog_}) {
+                       &set_last_message_, &raise_sequence_, &insert_link_, &insert_message_,
+                       &insert_single_, &insert_analytics_, &insert_powerlog_}) {
     s->reset();
   }
   retention_.reset();  // its statements
@@ -396,6 +399,7 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
   int rc = Step(begin_.get());
   if (rc != SQLITE_DONE) return Fail(rc, "begin");
   session_last_message_.clear();
+  link_ = Link{};
   std::fill(std::begin(written_ids_), std::end(written_ids_), 0);
   // Analytics events after the rest: one that repeats a message of the same batch (handed
   // over before it, as the message waits for its session's queue) then finds its row. Ids
@@ -420,6 +424,18 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
     }
   }
   session_last_message_.clear();
+  if (link_.first_message != 0) {
+    sqlite3_stmt* insert = insert_link_.get();
+    sqlite3_bind_int64(insert, 1, link_.first_message);
+    sqlite3_bind_int64(insert, 2, link_.last_message);
+    sqlite3_bind_int64(insert, 3, link_.first_event);
+    sqlite3_bind_int64(insert, 4, link_.last_event);
+    rc = Step(insert);
+    if (rc != SQLITE_DONE) {
+      recent_messages_.RolledBack();
+      return Fail(rc, "insert");
+    }
+  }
   for (int table = 0; table < kTables; ++table) {
     if (written_ids_[table] == 0) continue;
     sqlite3_bind_text(raise_sequence_.get(), 1, kTableNames[table], -1, SQLITE_STATIC);
@@ -529,7 +545,9 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
       if (r.extra->provider) r.payload = CallProvider(r.extra->provider, r.extra->name);
       r.extra->provider = nullptr;
       BindText(stmt, 1, r.extra->name);
+      const std::int64_t event = TakeId(kAnalytics);
       if (auto repeat = recent_messages_.Find(r.payload)) {
+        link_.Add(repeat->message, event);
         sqlite3_bind_int64(stmt, 2, repeat->message);
         sqlite3_bind_text(stmt, 3, repeat->host.data(), static_cast<int>(repeat->host.size()),
                           SQLITE_TRANSIENT);
@@ -540,7 +558,7 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
         BindJson(stmt, 4, json_payload_, r.payload);
       }
       sqlite3_bind_double(stmt, 5, r.time);
-      sqlite3_bind_int64(stmt, 6, TakeId(kAnalytics));
+      sqlite3_bind_int64(stmt, 6, event);
       break;
     }
     case RecordKind::kPowerLog:

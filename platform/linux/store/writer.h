@@ -2,6 +2,7 @@
 
 #include <sqlite3.h>
 
+#include <algorithm>
 #include <atomic>
 #include <condition_variable>
 #include <cstdint>
@@ -170,7 +171,17 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   int wal_pages_ = 0;   // writer thread: frames in the WAL after the last commit
   Statement begin_, commit_, rollback_;
   Statement insert_session_, flush_session_, set_last_message_, insert_message_, insert_single_;
-  Statement insert_analytics_, insert_powerlog_, raise_sequence_;
+  Statement insert_analytics_, insert_powerlog_, raise_sequence_, insert_link_;
+  // This transaction's references from analytics events to messages (a store_links row).
+  struct Link {
+    std::int64_t first_message = 0, last_message = 0, first_event = 0, last_event = 0;
+    void Add(std::int64_t message, std::int64_t event) {
+      if (first_message == 0 || message < first_message) first_message = message;
+      last_message = std::max(last_message, message);
+      if (first_event == 0) first_event = event;
+      last_event = event;
+    }
+  } link_;
   std::int64_t next_ids_[kTables] = {};     // writer thread: the next id of each table
   std::int64_t written_ids_[kTables] = {};  // writer thread: this transaction's highest
   std::string json_payload_, json_session_info_, json_user_info_;
