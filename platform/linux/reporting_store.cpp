@@ -149,6 +149,16 @@ bool ReportingStore::AddSession(std::int64_t id, Value session_info, Value user_
   return writer_->Push(std::move(r), false);
 }
 
+std::int64_t ReportingStore::AddNewSession(Value session_info, Value user_info) {
+  Record r = MakeRecord(RecordKind::kSession);
+  r.extra = std::make_unique<RecordExtra>();
+  r.extra->session_info = std::move(session_info);
+  r.extra->user_info = std::move(user_info);
+  std::int64_t id = 0;
+  writer_->Push(std::move(r), false, &id);
+  return id;
+}
+
 void ReportingStore::MarkSessionFlushed(std::int64_t id,
                                         std::function<void(std::optional<Error>)> done) {
   Record r = MakeRecord(RecordKind::kFlush);

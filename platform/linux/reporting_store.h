@@ -120,6 +120,12 @@ class ReportingStore {
   // when the store is closed, `done` runs on a thread of its own with an error.
   void MarkSessionFlushed(std::int64_t id, std::function<void(std::optional<Error>)> done);
 
+  // A new livo_sessions row, as AddSession with an id from NewSessionId, except that the id
+  // is taken in queue order: session ids then grow in the order rows are committed, so a
+  // reader that follows the ids misses none. Returns the id (also when the row was
+  // dropped).
+  std::int64_t AddNewSession(Value session_info, Value user_info);
+
   // A livo_messages row of session `session` (an id from NewSessionId).
   bool AddSessionMessage(std::int64_t session, std::uint16_t category, std::uint16_t type,
                          Value payload);

@@ -187,8 +187,11 @@ void ReportingStoreWriter::Start() {
 // Hands `record` to the writer. A control record (flush, task) is taken even when the
 // queue is full. Returns false when the record was not taken; a control record's
 // callback is then the caller's to run.
-bool ReportingStoreWriter::Push(Record&& record, bool control) {
+bool ReportingStoreWriter::Push(Record&& record, bool control, std::int64_t* new_session_id) {
   std::unique_lock lock(mu_);
+  // Taken under the lock: session ids then follow the queue's order, which is the
+  // commit order.
+  if (new_session_id) record.id = *new_session_id = NewSessionId();
   if (closing_) return false;
   if (!control && queue_.size() >= options_.max_queued_records) {
     ++dropped_queue_full_;

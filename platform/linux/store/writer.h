@@ -88,7 +88,9 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   // Hands `record` to the writer. A control record (flush, task) is taken even when the
   // queue is full. Returns false when the record was not taken; a control record's
   // callback is then the caller's to run.
-  bool Push(Record&& record, bool control);
+  // With `new_session_id`, the record (a session row) gets its id from NewSessionId here,
+  // in queue order, also when it is not taken; the id is stored there too.
+  bool Push(Record&& record, bool control, std::int64_t* new_session_id = nullptr);
 
   void Drain();
 
