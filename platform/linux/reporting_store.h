@@ -17,8 +17,14 @@ class ReportingStoreWriter;
 
 // The embedded reporting store: an SQLite database (WAL journal) that keeps what the
 // framework sinks are handed (framework sessions and their messages, single messages,
-// analytics events, power-log events). Its schema is documented in
-// reporting_store_reader.h.
+// analytics events, power-log events). What readers see is documented in
+// reporting_store_reader.h; the layout behind it, its versions and their migration in
+// platform/linux/store/schema.h. An older file is migrated by the writer thread before
+// its first batch (records queue meanwhile); a newer one makes Open fail.
+//
+// Retention: past Options::max_bytes or Options::max_age_seconds the writer removes the
+// oldest rows between its transactions, in small steps, and the file shrinks (see
+// platform/linux/store/retention.h for what it keeps; Stats has its figures).
 //
 // Threads: one writer thread of the store owns the database connection. Every Add* call
 // only hands a record over through an in-memory queue and returns at once; it never
@@ -58,6 +64,11 @@ class ReportingStore {
     std::size_t max_queued_records = 1'000'000;
     // How long a write waits for a lock held by another connection before it fails.
     int busy_timeout_ms = 2000;
+    // Retention (see Retention): the database file's size limit in bytes; nullopt: 10% of
+    // its file system, at most 4 GiB; 0: none.
+    std::optional<std::uint64_t> max_bytes;
+    // Rows older than this many seconds are removed; 0: no age limit.
+    double max_age_seconds = 0;
   };
 
   // What the store has done so far.
@@ -66,7 +77,11 @@ class ReportingStore {
     std::uint64_t committed = 0;    // records in committed transactions
     std::uint64_t failed = 0;       // records that could not be written (see Failures)
     std::uint64_t dropped_queue_full = 0;
-    std::uint64_t batches = 0;  // transactions attempted
+    std::uint64_t batches = 0;              // transactions attempted
+    std::uint64_t retention_removed = 0;    // rows removed by retention
+    std::uint64_t retention_lost = 0;       // of them, rows no exporter had shipped yet
+    std::uint64_t bytes_on_disk = 0;        // of the database file, as of the last look
+    std::optional<double> oldest_row_time;  // wall-clock seconds; nullopt: no row
   };
 
   // Opens (creating when missing) the database at `path`, creates or checks its schema
@@ -104,6 +119,12 @@ class ReportingStore {
   // committed, with the error when it failed. A flush is never dropped for a full queue;
   // when the store is closed, `done` runs on a thread of its own with an error.
   void MarkSessionFlushed(std::int64_t id, std::function<void(std::optional<Error>)> done);
+
+  // A new livo_sessions row, as AddSession with an id from NewSessionId, except that the id
+  // is taken in queue order: session ids then grow in the order rows are committed, so a
+  // reader that follows the ids misses none. Returns the id (also when the row was
+  // dropped).
+  std::int64_t AddNewSession(Value session_info, Value user_info);
 
   // A livo_messages row of session `session` (an id from NewSessionId).
   bool AddSessionMessage(std::int64_t session, std::uint16_t category, std::uint16_t type,

@@ -67,8 +67,8 @@ class StoreLivoReporting final : public LivoReporting {
 
   std::shared_ptr<LivoReportingSession> CreateSession(Dictionary session_info, Dictionary user_info,
                                                       Array /*frameworks_to_check*/) override {
-    const std::int64_t id = store_->NewSessionId();
-    store_->AddSession(id, Value(std::move(session_info)), Value(std::move(user_info)));
+    const std::int64_t id =
+        store_->AddNewSession(Value(std::move(session_info)), Value(std::move(user_info)));
     return std::make_shared<StoreLivoReportingSession>(store_, id, options_.backends);
   }
 
