@@ -50,6 +50,11 @@ struct QNReportingServerContext {
   static constexpr std::size_t kMostMaxSessions = 100000;
   std::size_t maxSessions = kDefaultMaxSessions;
 
+  // Whether a client's lookups across clients (start, send, service type, valid,
+  // getAllReporters:) see the sessions of every client. Off: only those of clients with
+  // the caller's uid, or all for a root caller.
+  bool sharedSessions = false;
+
   // The sessions made by every server instance. Never null.
   std::shared_ptr<QNReportingSessionRegistry> sessions =
       std::make_shared<QNReportingSessionRegistry>();

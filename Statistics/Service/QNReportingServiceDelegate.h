@@ -69,6 +69,8 @@ class QNReportingServiceDelegate final
     std::size_t maxSessionsPerClient = QNReportingServerContext::kDefaultMaxSessionsPerClient;
     // The most sessions all clients together may hold.
     std::size_t maxSessions = QNReportingServerContext::kDefaultMaxSessions;
+    // Whether lookups across clients see every client's sessions (see the context).
+    bool sharedSessions = false;
   };
   static std::shared_ptr<QNReportingServiceDelegate> Create(
       std::shared_ptr<const Platform> platform, Options options);
@@ -94,7 +96,8 @@ class QNReportingServiceDelegate final
   std::shared_ptr<const Dictionary> getDefaults() const override { return defaults_.load(); }
   const ClientList& getAllClients() const override { return clients_; }
   bool isReportingEnabled() const override { return reportingEnabled_.load(); }
-  std::shared_ptr<QNReportingSession> findReportingSessionForID(std::int64_t reporterID) override;
+  std::shared_ptr<QNReportingSession> findReportingSessionForID(
+      std::int64_t reporterID, std::optional<uid_t> scope) override;
   Dictionary getSnapShot() override;
   std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
       const Dictionary* snapshot) override;

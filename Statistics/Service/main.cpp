@@ -115,6 +115,7 @@ struct Options {
   std::optional<std::string> driver_stats;
   std::string debug_scopes;
   Limits limits;
+  bool shared_sessions = false;
 };
 
 // A CLI11 check that a value is not empty.
@@ -171,6 +172,9 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
       ->type_name("SCOPES")
       ->check(kNotEmpty)
       ->check(kDebugScopes);
+  app.add_flag("--shared-sessions", options.shared_sessions,
+               "Let every client reach every other client's sessions, whatever its user")
+      ->disable_flag_override();
   Limits& limits = options.limits;
   const auto limit = [&app](const char* name, std::size_t& value, const char* what,
                             std::size_t most = SIZE_MAX) {
@@ -331,7 +335,8 @@ int Run(const Options& options) {
 
   std::shared_ptr<QNReportingServiceDelegate> delegate = QNReportingServiceDelegate::Create(
       platform, {.maxSessionsPerClient = options.limits.max_sessions_per_client,
-                 .maxSessions = options.limits.max_sessions});
+                 .maxSessions = options.limits.max_sessions,
+                 .sharedSessions = options.shared_sessions});
 
   LinuxIpcOptions ipc_options;
   ipc_options.socket_path = paths.socket_path;

@@ -655,6 +655,13 @@ bool LinuxConnection::HandleFrames() {
       return false;
     }
     const auto header = std::get<protocol::RequestHeader>(checked);
+    if (protocol::IsPrivileged(header.op) && uid_ != 0 && uid_ != options_.privileged_uid) {
+      Fail(protocol::ConnectionError::kNotPermitted,
+           StringWithFormat("%s is allowed only to root and uid %u, not to uid %u (request %u)",
+                            protocol::OpName(header.op), options_.privileged_uid, uid_,
+                            header.request_id));
+      return false;
+    }
     const Array& items = *request.as_array();
     Array args(items.begin() + 2, items.end());
     if (!object_) {

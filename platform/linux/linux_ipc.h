@@ -1,5 +1,7 @@
 #pragma once
 
+#include <unistd.h>
+
 #include <cstddef>
 #include <functional>
 #include <memory>
@@ -34,6 +36,10 @@ struct LinuxIpcOptions {
   std::function<bool()> message_intake_blocked;
   // Where the IPC layer counts requests, bad frames, pauses and refusals; may be null.
   std::shared_ptr<Counters> counters;
+  // Besides root, the one uid whose peers may make privileged requests (protocol::
+  // IsPrivileged); from any other peer such a request gets the error frame, code 10, and
+  // the connection closes. The daemon's own uid.
+  uid_t privileged_uid = ::geteuid();
   // How long a connection closed for bad input waits for its error frame to be written.
   int error_flush_timeout_ms = 1000;
 };

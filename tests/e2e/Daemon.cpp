@@ -1,9 +1,11 @@
 #include "tests/e2e/Daemon.h"
 
 #include <fcntl.h>
+#include <grp.h>
 #include <poll.h>
 #include <signal.h>
 #include <spawn.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -156,6 +158,33 @@ std::unique_ptr<client::Client> Daemon::Connect() {
   auto client = client::Client::Connect(socket_path(), &error);
   if (!client) ADD_FAILURE() << "connect: " << error;
   return client;
+}
+
+std::unique_ptr<RawConnection> Daemon::ConnectAs(uid_t uid) {
+  ::chmod(home().c_str(), 0750);  // mkdtemp's 0700 would keep the child out
+  int pair[2];
+  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) return nullptr;
+  const pid_t child = ::fork();
+  if (child == 0) {
+    RawConnection raw("");
+    const bool dropped = ::setgroups(0, nullptr) == 0 && ::setgid(0) == 0 && ::setuid(uid) == 0;
+    if (!dropped || !raw.Connect(socket_path()) || !testing::SendFd(pair[1], raw.fd())) _exit(1);
+    _exit(0);
+  }
+  ::close(pair[1]);
+  const int fd = testing::ReceiveFd(pair[0]);
+  ::close(pair[0]);
+  int status = 0;
+  ::waitpid(child, &status, 0);
+  if (fd < 0) ADD_FAILURE() << "no connection as uid " << uid;
+  return fd < 0 ? nullptr : std::make_unique<RawConnection>(RawConnection::Adopt{fd});
+}
+
+std::size_t Daemon::PeakRss() const {
+  const std::string status =
+      testing::ReadFileText("/proc/" + std::to_string(process_->pid()) + "/status");
+  const auto at = status.find("VmHWM:");
+  return at == std::string::npos ? 0 : std::stoull(status.substr(at + 6)) * 1024;
 }
 
 std::optional<ExitStatus> Daemon::Stop(int signal) {

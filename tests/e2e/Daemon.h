@@ -19,6 +19,8 @@
 
 namespace qn::e2e {
 
+using testing::RawConnection;
+
 using namespace std::chrono_literals;
 
 // Generous bounds for things that happen in milliseconds; they only end a hung test.
@@ -47,6 +49,7 @@ class ChildProcess {
   ~ChildProcess();
 
   bool running();
+  pid_t pid() const { return pid_; }
   void Signal(int signal) const;
   // Waits for the process to end, at most `timeout`; nullopt when it did not.
   std::optional<ExitStatus> Wait(std::chrono::milliseconds timeout = kPatience);
@@ -81,6 +84,12 @@ class Daemon {
 
   // A new connection (null with a test failure when it cannot connect).
   std::unique_ptr<client::Client> Connect();
+  // A raw connection made by a forked child running as `uid` (group root, so that it may
+  // reach the socket), handed back to this process: the daemon sees `uid` as its peer.
+  // REQUIRES: the test runs as root.
+  std::unique_ptr<RawConnection> ConnectAs(uid_t uid);
+  // The daemon's peak resident memory so far (VmHWM), in bytes; 0 when unreadable.
+  std::size_t PeakRss() const;
 
   // Sends `signal` and waits for the daemon to end.
   std::optional<ExitStatus> Stop(int signal = SIGTERM);
@@ -126,7 +135,5 @@ Value Json(const std::string& text);
 // The analytics rows named `name`.
 std::vector<ReportingStoreRow> AnalyticsNamed(const std::vector<ReportingStoreRow>& rows,
                                               const std::string& name);
-
-using testing::RawConnection;
 
 }  // namespace qn::e2e

@@ -290,7 +290,7 @@ TEST_F(ServiceTest, DisabledReportingRefusesSendsHidesOthers) {
   EXPECT_TRUE(livo_.SingleMessages().empty());
 
   // Cross-client lookups find nothing, even for the caller's own ID; own lookups still work.
-  EXPECT_FALSE(h_.delegate->findReportingSessionForID(42));
+  EXPECT_FALSE(h_.delegate->findReportingSessionForID(42, std::nullopt));
   Replies<Dictionary> valid;
   b_->reporterIDValid(42, valid.Callback());
   a_->reporterIDValid(42, valid.Callback());
