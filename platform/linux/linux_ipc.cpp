@@ -663,6 +663,14 @@ bool LinuxConnection::HandleFrames() {
       return false;
     }
     const Array& items = *request.as_array();
+    if (const Array* ids = header.op == protocol::Op::kSendMessage ? items[5].as_array() : nullptr;
+        ids && ids->size() > options_.max_reporter_ids) {
+      Fail(protocol::ConnectionError::kBadArguments,
+           StringWithFormat("the reporter ID list of request %u holds %zu IDs, more than the %zu "
+                            "allowed",
+                            header.request_id, ids->size(), options_.max_reporter_ids));
+      return false;
+    }
     Array args(items.begin() + 2, items.end());
     if (!object_) {
       QN_LOG(*log_, scope_.get(), LogLevel::kError,

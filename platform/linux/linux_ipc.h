@@ -36,6 +36,9 @@ struct LinuxIpcOptions {
   std::function<bool()> message_intake_blocked;
   // Where the IPC layer counts requests, bad frames, pauses and refusals; may be null.
   std::shared_ptr<Counters> counters;
+  // The most reporter IDs a request's ID list may hold; a longer list gets the error frame,
+  // code 6, and the connection closes. It bounds what one message can make the daemon do.
+  std::size_t max_reporter_ids = 256;
   // Besides root, the one uid whose peers may make privileged requests (protocol::
   // IsPrivileged); from any other peer such a request gets the error frame, code 10, and
   // the connection closes. The daemon's own uid.
