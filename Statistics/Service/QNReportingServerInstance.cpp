@@ -167,11 +167,18 @@ void QNReportingServerInstance::createReportingSession(std::int64_t reporterID, 
     Counters& counters = *ctx.platform->counters;
     const bool isNew = !self.sessions_.Contains(reporterID);
     const auto open = static_cast<std::size_t>(Counters::Get(counters.sessionsOpen));
-    if (isNew && self.sessions_.size() >= ctx.maxSessionsPerClient) {
+    std::size_t ofUid = 0;  // the sessions of the clients of this client's uid
+    if (auto delegate = isNew ? self.delegate_.lock() : nullptr) {
+      for (const auto& client : delegate->getAllClients()) {
+        if (client->peerUid_ == self.peerUid_) ofUid += client->sessions_.size();
+      }
+    }
+    if (isNew && ofUid >= ctx.maxSessionsPerUid) {
       Counters::Add(counters.sessionsRefused);
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kError,
-             "%s:%d:%s: client %i already holds %lu sessions, no session for reporter %lli",
-             self.processIdentifier_, self.sessions_.size(), reporterID);
+             "%s:%d:%s: uid %u already holds %lu sessions, no session for reporter %lli of client "
+             "%i",
+             self.peerUid_, ofUid, reporterID, self.processIdentifier_);
     } else if (isNew && open >= ctx.maxSessions) {
       Counters::Add(counters.sessionsRefused);
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kError,

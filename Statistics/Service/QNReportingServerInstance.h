@@ -125,7 +125,8 @@ class QNReportingServerInstance final
   void reporterIDValid(std::int64_t reporterID, DictionaryReply reply) override;
   void getAllReporters(ReporterIDsReply reply) override;
   // Logs "DESTROYING SERVICE" and ends the process with status 2 on the calling thread;
-  // the reply is never invoked.
+  // the reply is never invoked. The IPC layer passes it on only from root and the daemon's
+  // own uid.
   void killService(BoolReply reply) override;
 
   // The connection was interrupted or invalidated: queues on the server queue the stop of

@@ -58,7 +58,7 @@ QNReportingServiceDelegate::QNReportingServiceDelegate(Token,
                                                        std::shared_ptr<const Platform> platform,
                                                        Options options) {
   context_.platform = std::move(platform);
-  context_.maxSessionsPerClient = options.maxSessionsPerClient;
+  context_.maxSessionsPerUid = options.maxSessionsPerUid;
   context_.maxSessions = options.maxSessions;
   context_.sharedSessions = options.sharedSessions;
   const Platform& p = *context_.platform;

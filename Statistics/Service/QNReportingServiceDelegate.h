@@ -65,8 +65,8 @@ class QNReportingServiceDelegate final
   // REQUIRES: `platform` has every service set (log, trace, dispatcher, notify, defaults,
   // process, analytics, enerdex, livo_reporting, ostrel, device_info, orientation).
   struct Options {
-    // The most sessions one client may hold (see QNReportingServerContext).
-    std::size_t maxSessionsPerClient = QNReportingServerContext::kDefaultMaxSessionsPerClient;
+    // The most sessions the clients of one uid may hold (see QNReportingServerContext).
+    std::size_t maxSessionsPerUid = QNReportingServerContext::kDefaultMaxSessionsPerUid;
     // The most sessions all clients together may hold.
     std::size_t maxSessions = QNReportingServerContext::kDefaultMaxSessions;
     // Whether lookups across clients see every client's sessions (see the context).

@@ -124,6 +124,7 @@ struct Record {
   bool failed = false;  // set by the writer when the record could not be written
   double time = 0;
   Value payload;
+  std::size_t bytes = 0;  // the payload's approximate size, counted in backlog_bytes_
   std::unique_ptr<RecordExtra> extra;
 };
 
@@ -355,6 +356,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   // queue is full. Returns false when the record was not taken; a control record's
   // callback is then the caller's to run.
   bool Push(Record&& record, bool control) {
+    record.bytes = record.payload.ApproximateBytes();
     std::unique_lock lock(mu_);
     if (closing_) return false;
     if (!control && queue_.size() >= options_.max_queued_records) {
@@ -365,6 +367,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
     queue_.push_back(std::move(record));
     ++stats_.handed_over;
     backlog_.fetch_add(1, std::memory_order_relaxed);
+    backlog_bytes_.fetch_add(queue_.back().bytes, std::memory_order_relaxed);
     const bool wake = writer_idle_ || (gathering_ && queue_.size() == kGatherRecords);
     writer_idle_ = false;
     lock.unlock();
@@ -405,6 +408,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   }
 
   std::uint64_t backlog() const { return backlog_.load(std::memory_order_relaxed); }
+  std::uint64_t backlog_bytes() const { return backlog_bytes_.load(std::memory_order_relaxed); }
 
   void SetAfterBatch(std::function<void()> callback) {
     std::lock_guard lock(mu_);
@@ -451,6 +455,8 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
       const std::uint64_t count = batch.size();
       const auto failed = static_cast<std::uint64_t>(
           std::count_if(batch.begin(), batch.end(), [](const Record& r) { return r.failed; }));
+      std::uint64_t bytes = 0;
+      for (const Record& r : batch) bytes += r.bytes;
       batch.clear();
       if (batch.capacity() > kKeptQueueCapacity) batch.shrink_to_fit();
       {
@@ -461,6 +467,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
         written_ = batch_end;
       }
       backlog_.fetch_sub(count, std::memory_order_relaxed);
+      backlog_bytes_.fetch_sub(bytes, std::memory_order_relaxed);
       std::function<void()> after_batch;
       {
         std::lock_guard lock(mu_);
@@ -738,6 +745,9 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   int drains_waiting_ = 0;                 // GUARDED_BY(mu_): Drain calls waiting
   std::atomic<std::uint64_t> backlog_{0};  // records handed over and not yet written
 
+  // The approximate bytes of the payloads handed over and not yet written.
+  std::atomic<std::uint64_t> backlog_bytes_{0};
+
   std::mutex thread_mu_;  // serialises join/detach of thread_
   std::thread thread_;
   std::thread::id writer_id_;  // set by Start before the store is published
@@ -968,6 +978,7 @@ std::function<void()> ReportingStore::DrainHook() const {
 ReportingStore::Stats ReportingStore::stats() const { return writer_->stats(); }
 
 std::uint64_t ReportingStore::Backlog() const { return writer_->backlog(); }
+std::uint64_t ReportingStore::BacklogBytes() const { return writer_->backlog_bytes(); }
 
 bool ReportingStore::IsOpen() const { return writer_->open(); }
 

@@ -162,22 +162,16 @@ std::unique_ptr<client::Client> Daemon::Connect() {
 
 std::unique_ptr<RawConnection> Daemon::ConnectAs(uid_t uid) {
   ::chmod(home().c_str(), 0750);  // mkdtemp's 0700 would keep the child out
-  int pair[2];
-  if (::socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, pair) != 0) return nullptr;
+  auto raw = std::make_unique<RawConnection>("");
   const pid_t child = ::fork();
-  if (child == 0) {
-    RawConnection raw("");
-    const bool dropped = ::setgroups(0, nullptr) == 0 && ::setgid(0) == 0 && ::setuid(uid) == 0;
-    if (!dropped || !raw.Connect(socket_path()) || !testing::SendFd(pair[1], raw.fd())) _exit(1);
-    _exit(0);
+  if (child == 0) {  // connects the socket it shares with the parent, as `uid` of group root
+    _exit(::setgroups(0, nullptr) == 0 && ::setuid(uid) == 0 && raw->Connect(socket_path()) ? 0
+                                                                                            : 1);
   }
-  ::close(pair[1]);
-  const int fd = testing::ReceiveFd(pair[0]);
-  ::close(pair[0]);
-  int status = 0;
+  int status = -1;
   ::waitpid(child, &status, 0);
-  if (fd < 0) ADD_FAILURE() << "no connection as uid " << uid;
-  return fd < 0 ? nullptr : std::make_unique<RawConnection>(RawConnection::Adopt{fd});
+  if (status != 0) ADD_FAILURE() << "no connection as uid " << uid;
+  return status == 0 ? std::move(raw) : nullptr;
 }
 
 std::size_t Daemon::PeakRss() const {

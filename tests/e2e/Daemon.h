@@ -84,8 +84,8 @@ class Daemon {
 
   // A new connection (null with a test failure when it cannot connect).
   std::unique_ptr<client::Client> Connect();
-  // A raw connection made by a forked child running as `uid` (group root, so that it may
-  // reach the socket), handed back to this process: the daemon sees `uid` as its peer.
+  // A raw connection that a forked child running as `uid` (group root, so that it may reach
+  // the socket) connected: the daemon sees `uid` as its peer.
   // REQUIRES: the test runs as root.
   std::unique_ptr<RawConnection> ConnectAs(uid_t uid);
   // The daemon's peak resident memory so far (VmHWM), in bytes; 0 when unreadable.

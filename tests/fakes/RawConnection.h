@@ -30,11 +30,6 @@ class RawConnection {
     }
     if (!socket_path.empty()) Connect(socket_path);
   }
-  // Takes over a connected socket.
-  struct Adopt {
-    int fd;
-  };
-  explicit RawConnection(Adopt adopt) : fd_(adopt.fd), connected_(true) {}
   ~RawConnection() { ::close(fd_); }
   RawConnection(const RawConnection&) = delete;
   RawConnection& operator=(const RawConnection&) = delete;
@@ -121,40 +116,5 @@ class RawConnection {
   FrameDecoder decoder_;
   std::deque<Value> pending_;  // decoded, not yet returned
 };
-
-// Passes `fd` over the Unix socket `channel` (SCM_RIGHTS); whether it went.
-inline bool SendFd(int channel, int fd) {
-  char byte = 0;
-  iovec io{&byte, 1};
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  message.msg_control = control;
-  message.msg_controllen = sizeof control;
-  cmsghdr* header = CMSG_FIRSTHDR(&message);
-  header->cmsg_level = SOL_SOCKET;
-  header->cmsg_type = SCM_RIGHTS;
-  header->cmsg_len = CMSG_LEN(sizeof(int));
-  std::memcpy(CMSG_DATA(header), &fd, sizeof fd);
-  return ::sendmsg(channel, &message, 0) == 1;
-}
-// The descriptor SendFd passed on `channel`, or -1.
-inline int ReceiveFd(int channel) {
-  char byte = 0;
-  iovec io{&byte, 1};
-  alignas(cmsghdr) char control[CMSG_SPACE(sizeof(int))] = {};
-  msghdr message{};
-  message.msg_iov = &io;
-  message.msg_iovlen = 1;
-  message.msg_control = control;
-  message.msg_controllen = sizeof control;
-  if (::recvmsg(channel, &message, MSG_CMSG_CLOEXEC) != 1) return -1;
-  cmsghdr* header = CMSG_FIRSTHDR(&message);
-  if (!header || header->cmsg_type != SCM_RIGHTS) return -1;
-  int fd = -1;
-  std::memcpy(&fd, CMSG_DATA(header), sizeof fd);
-  return fd;
-}
 
 }  // namespace qn::testing
