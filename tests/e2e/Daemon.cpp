@@ -160,9 +160,9 @@ std::unique_ptr<client::Client> Daemon::Connect() {
   return client;
 }
 
-std::unique_ptr<RawConnection> Daemon::ConnectAs(uid_t uid) {
+std::unique_ptr<testing::RawConnection> Daemon::ConnectAs(uid_t uid) {
   ::chmod(home().c_str(), 0750);  // mkdtemp's 0700 would keep the child out
-  auto raw = std::make_unique<RawConnection>("");
+  auto raw = std::make_unique<testing::RawConnection>("");
   const pid_t child = ::fork();
   if (child == 0) {  // connects the socket it shares with the parent, as `uid` of group root
     _exit(::setgroups(0, nullptr) == 0 && ::setuid(uid) == 0 && raw->Connect(socket_path()) ? 0
@@ -203,7 +203,7 @@ bool Daemon::WaitForRows(
   return Eventually([&] { return condition(Rows()); });
 }
 
-bool Daemon::WaitForStat(std::initializer_list<const char*> path, std::int64_t least) {
+bool Daemon::WaitForStat(const std::vector<const char*>& path, std::int64_t least) {
   return Eventually([&] {
     Value stats = Json(testing::ReadFileText(home() + "/run/stats.json"));
     const Value* at = &stats;

@@ -19,8 +19,6 @@
 
 namespace qn::e2e {
 
-using testing::RawConnection;
-
 using namespace std::chrono_literals;
 
 // Generous bounds for things that happen in milliseconds; they only end a hung test.
@@ -87,7 +85,7 @@ class Daemon {
   // A raw connection that a forked child running as `uid` (group root, so that it may reach
   // the socket) connected: the daemon sees `uid` as its peer.
   // REQUIRES: the test runs as root.
-  std::unique_ptr<RawConnection> ConnectAs(uid_t uid);
+  std::unique_ptr<testing::RawConnection> ConnectAs(uid_t uid);
   // The daemon's peak resident memory so far (VmHWM), in bytes; 0 when unreadable.
   std::size_t PeakRss() const;
 
@@ -101,7 +99,7 @@ class Daemon {
   bool WaitForRows(const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition);
   // Waits, at most kPatience, until the stats file the daemon refreshes each second holds
   // at least `least` at `path` (e.g. {"paused", "replies"}).
-  bool WaitForStat(std::initializer_list<const char*> path, std::int64_t least);
+  bool WaitForStat(const std::vector<const char*>& path, std::int64_t least);
 
  private:
   testing::TempDir home_;
@@ -135,5 +133,7 @@ Value Json(const std::string& text);
 // The analytics rows named `name`.
 std::vector<ReportingStoreRow> AnalyticsNamed(const std::vector<ReportingStoreRow>& rows,
                                               const std::string& name);
+
+using testing::RawConnection;
 
 }  // namespace qn::e2e

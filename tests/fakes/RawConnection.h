@@ -31,8 +31,6 @@ class RawConnection {
     if (!socket_path.empty()) Connect(socket_path);
   }
   ~RawConnection() { ::close(fd_); }
-  RawConnection(const RawConnection&) = delete;
-  RawConnection& operator=(const RawConnection&) = delete;
   int fd() const { return fd_; }
   bool Connect(const std::string& socket_path) {
     sockaddr_un address{};

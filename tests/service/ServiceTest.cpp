@@ -180,11 +180,10 @@ TEST(SessionLimitTest, CreatesBeyondEitherLimitMakeNoSession) {
   const struct {
     std::size_t perUid, total;
     const char* line;
-  } rows[] = {
-      {3, 100, ": uid 1000 already holds 3 sessions, no session for reporter 4 of client 100"},
-      {100, 3,
-       ": the clients hold 3 sessions, the most allowed; no session for reporter 4 of "
-       "client 100"}};
+  } rows[] = {{3, 100, ": uid 1000 already holds 3 sessions, no session for reporter 4 of "},
+              {100, 3,
+               ": the clients hold 3 sessions, the most allowed; no session for reporter 4 of "
+               "client 100"}};
   for (const auto& row : rows) {
     SCOPED_TRACE(row.line);
     ServiceHarness h(nullptr, {.maxSessionsPerUid = row.perUid, .maxSessions = row.total});
