@@ -175,8 +175,7 @@ std::unique_ptr<testing::RawConnection> Daemon::ConnectAs(uid_t uid) {
 }
 
 std::size_t Daemon::PeakRss() const {
-  const std::string status =
-      testing::ReadFileText("/proc/" + std::to_string(process_->pid()) + "/status");
+  const auto status = testing::ReadFileText("/proc/" + std::to_string(process_->pid()) + "/status");
   const auto at = status.find("VmHWM:");
   return at == std::string::npos ? 0 : std::stoull(status.substr(at + 6)) * 1024;
 }
