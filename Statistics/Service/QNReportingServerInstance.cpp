@@ -296,13 +296,17 @@ void QNReportingServerInstance::sendMessage(MessagePayload message, std::uint32_
       return;
     }
 
+    // The analytics events of this message share their payloads (a repeated ID, or
+    // sessions of one host application, cost no copy each).
+    QNReportingStatlynBridge::SharedPayload analytics;
     if (reporterIDs) {
       // Listed sessions: the bridges first, then the session.
       for (std::int64_t reporterID : *reporterIDs) {
         if (reporterID == 0) continue;
         auto session = self.findReportingSessionForID(reporterID, true);
         if (!session) continue;
-        QNReportingStatlynBridge::handleEvent(platform, message, category, type, session.get());
+        QNReportingStatlynBridge::handleEvent(platform, message.get(), category, type,
+                                              session.get(), &analytics);
         QNReportingEnerdexUtility::handleEvent(platform, message.get(), category, type,
                                                session.get());
         session->sendMessage(message, category, type, nullptr);
@@ -330,7 +334,8 @@ void QNReportingServerInstance::sendMessage(MessagePayload message, std::uint32_
       // Here the session goes first, then the bridges.
       for (const auto& session : active) {
         session->sendMessage(message, category, type, nullptr);
-        QNReportingStatlynBridge::handleEvent(platform, message, category, type, session.get());
+        QNReportingStatlynBridge::handleEvent(platform, message.get(), category, type,
+                                              session.get(), &analytics);
         QNReportingEnerdexUtility::handleEvent(platform, message.get(), category, type,
                                                session.get());
       }
@@ -367,8 +372,9 @@ void QNReportingServerInstance::stopReportingSessionForID(std::int64_t reporterI
       if (stats) {
         auto shared = std::make_shared<const Dictionary>(std::move(*stats));
         session->sendMessage(shared, kDriverStatisticsCategory, kDriverStatisticsType, nullptr);
-        QNReportingStatlynBridge::handleEvent(*ctx.platform, shared, kDriverStatisticsCategory,
-                                              kDriverStatisticsType, session.get());
+        QNReportingStatlynBridge::handleEvent(*ctx.platform, shared.get(),
+                                              kDriverStatisticsCategory, kDriverStatisticsType,
+                                              session.get());
         QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault, "%s:%d:%s: fetching driver logs %@",
                Value(shared));
       } else {
