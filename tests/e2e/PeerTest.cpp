@@ -133,7 +133,7 @@ std::string Requests(std::uint32_t count, const std::function<Array(std::uint32_
 TEST(PeerTest, ByteBudgetsBoundWhatAUserCanMakeTheDaemonHold) {
   if (::geteuid() != 0) GTEST_SKIP() << "needs root, to fork clients of another uid";
   const Value blob50k(Dictionary{{"blob", std::string(50'000, 'x')}});
-  ExpectPeakWithin("8 sends of 50 KB to one ID listed 256 times", 160u << 20, 2, 1,
+  ExpectPeakWithin("8 sends of 50 KB to one ID listed 256 times", 32u << 20, 2, 1,
                    Requests(8,
                             [&](std::uint32_t id) {
                               return Array{6, id, blob50k, 1, 1, Value(Array(256, Value(1)))};
