@@ -12,22 +12,30 @@ namespace qn {
 
 void QNReportingStatlynBridge::handleEvent(const Platform& platform, const Dictionary* message,
                                            std::uint32_t category, std::uint16_t type,
-                                           const QNReportingSession* session) {
+                                           const QNReportingSession* session,
+                                           SharedPayload* shared) {
   if (!platform.analytics) return;
-  // Room for the host entry first: the copy assigned into it keeps that capacity, so adding
-  // the entry does not move every other one.
-  Dictionary payload;
-  payload.Reserve((message ? message->size() : 0) + 1);
-  if (message) payload = *message;
   std::shared_ptr<const Dictionary> userInfo = session ? session->userInfo() : nullptr;
-  payload.Set("HostApplicationDisplayID", QNReportingHostApplicationName(userInfo.get()));
+  std::string host = QNReportingHostApplicationName(userInfo.get());
+  std::shared_ptr<const Dictionary> payload;
+  if (shared && shared->payload && shared->host == host) {
+    payload = shared->payload;
+  } else {
+    // Room for the host entry first: the copy assigned into it keeps that capacity, so
+    // adding the entry does not move every other one.
+    Dictionary copy;
+    copy.Reserve((message ? message->size() : 0) + 1);
+    if (message) copy = *message;
+    copy.Set("HostApplicationDisplayID", host);
+    payload = std::make_shared<const Dictionary>(std::move(copy));
+    if (shared) *shared = SharedPayload{std::move(host), payload};
+  }
   // "com.norvel.quenta.%@.%@" of the two names, once per message: plain concatenation.
   std::string name = "com.norvel.quenta.";
   name += QNReportingCategoryName(category);
   name += '.';
   name += QNReportingTypeName(type);
-  auto shared = std::make_shared<const Dictionary>(std::move(payload));
-  platform.analytics->SendEventLazy(name, [shared] { return Value(shared); });
+  platform.analytics->SendEventLazy(name, [payload] { return Value(payload); });
 }
 
 }  // namespace qn

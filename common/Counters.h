@@ -29,13 +29,18 @@ struct Counters {
   Counter pausedForRequests{0};
   Counter pausedForReplies{0};
   Counter pausedForStore{0};
+  // Times a connection stopped being read because its uid, or all uids, held a byte budget
+  // of the IPC layer (index: platform/linux/linux_ipc.h's IpcBudget: request, frame, reply).
+  std::array<Counter, 3> pausedForBudget{};
 
   // Limits: what was refused and why.
-  Counter connectionsRefused{0};  // over the connection limit
-  Counter sessionsRefused{0};     // over the per-client or the total session limit
-  Counter aggregationCapped{0};   // payloads delivered but not aggregated (session over its cap)
-  Counter repliesTooLarge{0};     // replies that did not fit a frame (connection closed)
-  Counter repliesUnread{0};       // connections closed for leaving too many replies unread
+  Counter connectionsRefused{0};   // over the connection limit
+  Counter sessionsRefused{0};      // over the per-client or the total session limit
+  Counter aggregationCapped{0};    // payloads delivered but not aggregated (session over its cap)
+  Counter repliesTooLarge{0};      // replies that did not fit a frame (connection closed)
+  Counter repliesUnread{0};        // connections closed for leaving too many replies unread
+  Counter partialFrames{0};        // connections closed for holding a partial frame too long
+  Counter configurationCapped{0};  // configurations held but not merged (session over its cap)
 
   // Drops: there should be none but the store's on a full disk.
   Counter logLinesDropped{0};  // the log's stream was full or gone
@@ -43,8 +48,10 @@ struct Counters {
   // Gauges.
   Gauge connectionsOpen{0};
   Gauge sessionsOpen{0};
-  Gauge deliveriesQueued{0};  // messages handed to sessions, not yet handed to the store
-  Gauge aggregatedBytes{0};   // payload bytes the sessions hold for their summaries
+  Gauge deliveriesQueued{0};    // messages handed to sessions, not yet handed to the store
+  Gauge aggregatedBytes{0};     // payload bytes the sessions hold for their summaries
+  Gauge configurationBytes{0};  // configuration bytes the sessions hold
+  Gauge parkedBytes{0};         // payload bytes of single messages waiting in delay timers
 
   // Increments a counter; `n` may be any amount.
   static void Add(Counter& counter, std::uint64_t n = 1) {

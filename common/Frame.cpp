@@ -35,10 +35,11 @@ void FrameDecoder::Feed(std::string_view bytes) {
 std::optional<std::string_view> FrameDecoder::Next() {
   if (error_) return std::nullopt;
   if (consumed_ == buffer_.size()) {
-    // Everything returned: release the storage of large frames, keep small buffers.
+    // Everything returned: release the storage of large frames, keep small buffers (an
+    // idle connection holds at most this much).
     buffer_.clear();
     consumed_ = 0;
-    if (buffer_.capacity() > 2 * protocol::kMaxBodyBytes) buffer_.shrink_to_fit();
+    if (buffer_.capacity() > 16 * 1024) std::string().swap(buffer_);
     return std::nullopt;
   }
   if (buffered() < kFrameHeaderBytes) return std::nullopt;

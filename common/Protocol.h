@@ -63,8 +63,12 @@ enum class ConnectionError : std::int64_t {
   kTooMuchQueued = 7,       // the peer does not read its replies
   kTooManyConnections = 8,  // the daemon already serves as many connections as it may
   kReplyTooLarge = 9,       // a reply does not fit in a frame
+  kNotPermitted = 10,       // the peer's uid may not make this request
 };
-inline constexpr std::int64_t kLastConnectionError = 9;
+inline constexpr std::int64_t kLastConnectionError = 10;
+
+// Whether only root and the daemon's own uid may make requests of `op` (killService:).
+inline bool IsPrivileged(Op op) { return op == Op::kKillService; }
 
 // Checks a decoded request against the operation table. On success returns the op and
 // request id and leaves the arguments (args[2..]) as they are; on failure returns the

@@ -38,17 +38,23 @@ struct QNReportingServerContext {
   std::shared_ptr<SerialQueue> serverQueue;
   // The "qnrs" scope; null means the platform's default log.
   std::shared_ptr<const LogScope> logScope;
-  // The most sessions one client may hold at once. A create request for a new reporter ID
-  // beyond it makes no session (its reply is still YES), so one client cannot exhaust the
-  // daemon's memory. Replacing an existing ID is always allowed.
-  static constexpr std::size_t kDefaultMaxSessionsPerClient = 16384;
-  std::size_t maxSessionsPerClient = kDefaultMaxSessionsPerClient;
+  // The most sessions the clients of one uid may hold at once. A create request for a new
+  // reporter ID beyond it makes no session (its reply is still YES), so one user cannot
+  // exhaust the daemon's memory or the others' sessions. Replacing an existing ID is always
+  // allowed.
+  static constexpr std::size_t kDefaultMaxSessionsPerUid = 16384;
+  std::size_t maxSessionsPerUid = kDefaultMaxSessionsPerUid;
   // The most sessions all clients together may hold, counted in platform->counters
   // (sessionsOpen); beyond it a create makes no session either. It keeps the
   // getAllReporters: reply within a frame: each reporter ID takes at most 9 bytes.
   static constexpr std::size_t kDefaultMaxSessions = 65536;
   static constexpr std::size_t kMostMaxSessions = 100000;
   std::size_t maxSessions = kDefaultMaxSessions;
+
+  // Whether a client's lookups across clients (start, send, service type, valid,
+  // getAllReporters:) see the sessions of every client. Off: only those of clients with
+  // the caller's uid, or all for a root caller.
+  bool sharedSessions = false;
 
   // The sessions made by every server instance. Never null.
   std::shared_ptr<QNReportingSessionRegistry> sessions =

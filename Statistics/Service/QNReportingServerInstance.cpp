@@ -89,18 +89,26 @@ std::vector<std::shared_ptr<QNReportingSession>> QNReportingSessionRegistry::Ali
 // QNReportingServerInstance
 
 std::shared_ptr<QNReportingServerInstance> QNReportingServerInstance::initWithPID(
-    pid_t pid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
+    pid_t pid, uid_t uid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
     QNReportingServerContext context) {
   QN_LOG(context.log(), context.scope(), LogLevel::kDefault, "%s:%d:%s: new client with pid %lu",
          static_cast<unsigned long>(pid));
-  return std::make_shared<QNReportingServerInstance>(Token{}, pid, std::move(delegate),
+  return std::make_shared<QNReportingServerInstance>(Token{}, pid, uid, std::move(delegate),
                                                      std::move(context));
 }
 
 QNReportingServerInstance::QNReportingServerInstance(
-    Token, pid_t pid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
+    Token, pid_t pid, uid_t uid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
     QNReportingServerContext context)
-    : context_(std::move(context)), delegate_(std::move(delegate)), processIdentifier_(pid) {}
+    : context_(std::move(context)),
+      delegate_(std::move(delegate)),
+      processIdentifier_(pid),
+      peerUid_(uid) {}
+
+std::optional<uid_t> QNReportingServerInstance::sessionScope() const {
+  if (context_.sharedSessions || peerUid_ == 0) return std::nullopt;
+  return peerUid_;
+}
 
 QNReportingServerInstance::~QNReportingServerInstance() {
   Counters::Add(context_.platform->counters->sessionsOpen,
@@ -134,7 +142,7 @@ std::shared_ptr<QNReportingSession> QNReportingServerInstance::findReportingSess
   if (auto own = sessions_.Find(reporterID)) return own;
   if (!acrossAllClients) return nullptr;
   auto delegate = delegate_.lock();
-  return delegate ? delegate->findReportingSessionForID(reporterID) : nullptr;
+  return delegate ? delegate->findReportingSessionForID(reporterID, sessionScope()) : nullptr;
 }
 
 template <typename Work>
@@ -159,11 +167,18 @@ void QNReportingServerInstance::createReportingSession(std::int64_t reporterID, 
     Counters& counters = *ctx.platform->counters;
     const bool isNew = !self.sessions_.Contains(reporterID);
     const auto open = static_cast<std::size_t>(Counters::Get(counters.sessionsOpen));
-    if (isNew && self.sessions_.size() >= ctx.maxSessionsPerClient) {
+    std::size_t ofUid = 0;  // the sessions of the clients of this client's uid
+    if (auto delegate = isNew ? self.delegate_.lock() : nullptr) {
+      for (const auto& client : delegate->getAllClients()) {
+        if (client->peerUid_ == self.peerUid_) ofUid += client->sessions_.size();
+      }
+    }
+    if (isNew && ofUid >= ctx.maxSessionsPerUid) {
       Counters::Add(counters.sessionsRefused);
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kError,
-             "%s:%d:%s: client %i already holds %lu sessions, no session for reporter %lli",
-             self.processIdentifier_, self.sessions_.size(), reporterID);
+             "%s:%d:%s: uid %u already holds %lu sessions, no session for reporter %lli of client "
+             "%i",
+             self.peerUid_, ofUid, reporterID, self.processIdentifier_);
     } else if (isNew && open >= ctx.maxSessions) {
       Counters::Add(counters.sessionsRefused);
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kError,
@@ -281,6 +296,9 @@ void QNReportingServerInstance::sendMessage(MessagePayload message, std::uint32_
       return;
     }
 
+    // The analytics events of this message share their payloads (a repeated ID, or
+    // sessions of one host application, cost no copy each).
+    QNReportingStatlynBridge::SharedPayload analytics;
     if (reporterIDs) {
       // Listed sessions: the bridges first, then the session.
       for (std::int64_t reporterID : *reporterIDs) {
@@ -288,7 +306,7 @@ void QNReportingServerInstance::sendMessage(MessagePayload message, std::uint32_
         auto session = self.findReportingSessionForID(reporterID, true);
         if (!session) continue;
         QNReportingStatlynBridge::handleEvent(platform, message.get(), category, type,
-                                              session.get());
+                                              session.get(), &analytics);
         QNReportingEnerdexUtility::handleEvent(platform, message.get(), category, type,
                                                session.get());
         session->sendMessage(message, category, type, nullptr);
@@ -297,9 +315,11 @@ void QNReportingServerInstance::sendMessage(MessagePayload message, std::uint32_
       return;
     }
 
-    // Broadcast: every started session of every client, in client order.
+    // Broadcast: every started session of every client in scope, in client order.
     std::vector<std::shared_ptr<QNReportingSession>> active;
+    const std::optional<uid_t> scope = self.sessionScope();
     for (const auto& client : delegate->getAllClients()) {
+      if (!client->inScope(scope)) continue;
       std::vector<std::shared_ptr<QNReportingSession>> all;
       for (const auto& entry : client->clientReportingSessionMap()) all.push_back(entry.second);
       QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault, "%s:%d:%s: sessions for client %i : %@",
@@ -315,7 +335,7 @@ void QNReportingServerInstance::sendMessage(MessagePayload message, std::uint32_
       for (const auto& session : active) {
         session->sendMessage(message, category, type, nullptr);
         QNReportingStatlynBridge::handleEvent(platform, message.get(), category, type,
-                                              session.get());
+                                              session.get(), &analytics);
         QNReportingEnerdexUtility::handleEvent(platform, message.get(), category, type,
                                                session.get());
       }
@@ -425,7 +445,9 @@ void QNReportingServerInstance::getAllReporters(ReporterIDsReply reply) {
   OnServerQueue([reply = std::move(reply)](QNReportingServerInstance& self) {
     std::vector<std::int64_t> ids;
     if (auto delegate = self.delegate_.lock()) {
+      const std::optional<uid_t> scope = self.sessionScope();
       for (const auto& client : delegate->getAllClients()) {
+        if (!client->inScope(scope)) continue;
         for (const auto& entry : client->clientReportingSessionMap()) ids.push_back(entry.first);
       }
     }

@@ -71,10 +71,10 @@ class QNReportingServerInstance final
   static constexpr std::uint16_t kStandaloneServiceType = 5;
   static constexpr std::uint16_t kUnknownServiceType = 65535;
 
-  // Makes the instance for peer `pid` (logs "new client with pid"), with an empty session
-  // map. `context` supplies the platform, the server queue and the log scope.
+  // Makes the instance for peer `pid` of user `uid` (logs "new client with pid"), with an
+  // empty session map. `context` supplies the platform, the server queue and the log scope.
   static std::shared_ptr<QNReportingServerInstance> initWithPID(
-      pid_t pid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
+      pid_t pid, uid_t uid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
       QNReportingServerContext context);
 
   // Logs "dealloc <pid> from the server client list"; the sessions go with the map.
@@ -85,6 +85,12 @@ class QNReportingServerInstance final
 
   // Properties. The start date and process name are set once the connection is listed.
   pid_t processIdentifier() const { return processIdentifier_; }
+  uid_t peerUid() const { return peerUid_; }
+  // Whose sessions this client's lookups across clients see: the clients of this uid, or
+  // every client (nullopt) for a root peer and when the context shares sessions.
+  std::optional<uid_t> sessionScope() const;
+  // Whether this client is among those `scope` sees.
+  bool inScope(std::optional<uid_t> scope) const { return !scope || *scope == peerUid_; }
   std::optional<Date> clientStartDate() const;
   void setClientStartDate(std::optional<Date> date);
   std::optional<std::string> clientProcessName() const;
@@ -93,8 +99,8 @@ class QNReportingServerInstance final
   const QNReportingSessionMap& clientReportingSessionMap() const { return sessions_; }
 
   // The session under `reporterID` in this client's map; when there is none and
-  // `acrossAllClients`, the delegate's cross-client search (none for ID 0 or while
-  // reporting is disabled). Takes no lock of its own. REQUIRES: on the server queue.
+  // `acrossAllClients`, the delegate's search of the clients in sessionScope() (none for
+  // ID 0 or while reporting is disabled). Takes no lock of its own. REQUIRES: on the server queue.
   std::shared_ptr<QNReportingSession> findReportingSessionForID(std::int64_t reporterID,
                                                                 bool acrossAllClients) const;
 
@@ -119,7 +125,8 @@ class QNReportingServerInstance final
   void reporterIDValid(std::int64_t reporterID, DictionaryReply reply) override;
   void getAllReporters(ReporterIDsReply reply) override;
   // Logs "DESTROYING SERVICE" and ends the process with status 2 on the calling thread;
-  // the reply is never invoked.
+  // the reply is never invoked. The IPC layer passes it on only from root and the daemon's
+  // own uid.
   void killService(BoolReply reply) override;
 
   // The connection was interrupted or invalidated: queues on the server queue the stop of
@@ -132,7 +139,7 @@ class QNReportingServerInstance final
 
  public:
   // Use initWithPID.
-  QNReportingServerInstance(Token, pid_t pid,
+  QNReportingServerInstance(Token, pid_t pid, uid_t uid,
                             std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
                             QNReportingServerContext context);
 
@@ -144,6 +151,7 @@ class QNReportingServerInstance final
   const QNReportingServerContext context_;
   const std::weak_ptr<QNReportingServiceDelegateProtocol> delegate_;
   const pid_t processIdentifier_;
+  const uid_t peerUid_;
 
   mutable std::mutex propertyLock_;               // guards the two properties below only
   std::optional<Date> clientStartDate_;           // GUARDED_BY(propertyLock_)

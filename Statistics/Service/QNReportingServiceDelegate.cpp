@@ -58,8 +58,9 @@ QNReportingServiceDelegate::QNReportingServiceDelegate(Token,
                                                        std::shared_ptr<const Platform> platform,
                                                        Options options) {
   context_.platform = std::move(platform);
-  context_.maxSessionsPerClient = options.maxSessionsPerClient;
+  context_.maxSessionsPerUid = options.maxSessionsPerUid;
   context_.maxSessions = options.maxSessions;
+  context_.sharedSessions = options.sharedSessions;
   const Platform& p = *context_.platform;
   context_.logScope =
       p.log->RegisterScope(true, kLogScopeCode, "qnrs", "com.norvel.quenta", kLogScopeName, 31);
@@ -83,7 +84,8 @@ bool QNReportingServiceDelegate::ShouldAcceptNewConnection(
   // The instance logs its creation, and the connection guards itself, so both happen
   // outside the monitor, which is never held while another lock is taken.
   std::weak_ptr<QNReportingServiceDelegateProtocol> weakSelf = shared_from_this();
-  auto instance = QNReportingServerInstance::initWithPID(pid, weakSelf, context_);
+  auto instance =
+      QNReportingServerInstance::initWithPID(pid, connection->PeerUid(), weakSelf, context_);
   std::shared_ptr<IpcExportedObject> exported;
   {
     std::lock_guard monitor(lock_);
@@ -176,13 +178,14 @@ void QNReportingServiceDelegate::removeClient(const QNReportingServerInstance* i
 }
 
 std::shared_ptr<QNReportingSession> QNReportingServiceDelegate::findReportingSessionForID(
-    std::int64_t reporterID) {
+    std::int64_t reporterID, std::optional<uid_t> scope) {
   std::shared_ptr<QNReportingSession> found;
   pid_t owner = 0;
   {
     std::lock_guard monitor(lock_);
     if (reporterID == 0 || !reportingEnabled_.load()) return nullptr;
     for (const auto& client : clients_) {
+      if (!client->inScope(scope)) continue;
       if (auto session = client->clientReportingSessionMap().Find(reporterID)) {
         found = std::move(session);
         owner = client->processIdentifier();

@@ -65,10 +65,12 @@ class QNReportingServiceDelegate final
   // REQUIRES: `platform` has every service set (log, trace, dispatcher, notify, defaults,
   // process, analytics, enerdex, livo_reporting, ostrel, device_info, orientation).
   struct Options {
-    // The most sessions one client may hold (see QNReportingServerContext).
-    std::size_t maxSessionsPerClient = QNReportingServerContext::kDefaultMaxSessionsPerClient;
+    // The most sessions the clients of one uid may hold (see QNReportingServerContext).
+    std::size_t maxSessionsPerUid = QNReportingServerContext::kDefaultMaxSessionsPerUid;
     // The most sessions all clients together may hold.
     std::size_t maxSessions = QNReportingServerContext::kDefaultMaxSessions;
+    // Whether lookups across clients see every client's sessions (see the context).
+    bool sharedSessions = false;
   };
   static std::shared_ptr<QNReportingServiceDelegate> Create(
       std::shared_ptr<const Platform> platform, Options options);
@@ -94,7 +96,8 @@ class QNReportingServiceDelegate final
   std::shared_ptr<const Dictionary> getDefaults() const override { return defaults_.load(); }
   const ClientList& getAllClients() const override { return clients_; }
   bool isReportingEnabled() const override { return reportingEnabled_.load(); }
-  std::shared_ptr<QNReportingSession> findReportingSessionForID(std::int64_t reporterID) override;
+  std::shared_ptr<QNReportingSession> findReportingSessionForID(
+      std::int64_t reporterID, std::optional<uid_t> scope) override;
   Dictionary getSnapShot() override;
   std::optional<Dictionary> getDriverStatisticsRelativeToSnapShot(
       const Dictionary* snapshot) override;

@@ -1,5 +1,7 @@
 #pragma once
 
+#include <sys/types.h>
+
 #include <cstdint>
 #include <memory>
 #include <optional>
@@ -31,10 +33,11 @@ class QNReportingServiceDelegateProtocol {
   // The reporting switch: true unless the defaults disable reporting.
   virtual bool isReportingEnabled() const = 0;
 
-  // The session under `reporterID` of the first listed client that holds one; null for
-  // ID 0, whenever reporting is disabled, and when no client holds the ID.
+  // The session under `reporterID` of the first listed client in `scope` (the clients of
+  // that uid; nullopt: every client) that holds one; null for ID 0, whenever reporting is
+  // disabled, and when no such client holds the ID.
   virtual std::shared_ptr<QNReportingSession> findReportingSessionForID(
-      std::int64_t reporterID) = 0;
+      std::int64_t reporterID, std::optional<uid_t> scope) = 0;
 
   // A snapshot of every subscribed driver counter (never absent; empty without drivers).
   virtual Dictionary getSnapShot() = 0;

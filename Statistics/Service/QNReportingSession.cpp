@@ -132,18 +132,47 @@ QNReportingSession::QNReportingSession(Token, std::shared_ptr<const Platform> pl
       nestedAggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>()) {}
 
 QNReportingSession::~QNReportingSession() {
+  Counters::Add(platform_->counters->configurationBytes,
+                -static_cast<std::int64_t>(userInfoBytes_));
   TracePoint(*platform_, kTraceSessionDestroyed);
   SESSION_LOG(LogLevel::kInfo, "%s:%d:%s: deallocing this session %lli", reporterID());
 }
 
-void QNReportingSession::setConfiguration(const Dictionary* configuration) {
-  if (!configuration) return;
+void QNReportingSession::MergeUserInfo(const Dictionary* entries, bool capped) {
+  if (!entries) return;
   auto merged = std::make_shared<Dictionary>(*userInfo());
-  merged->Merge(*configuration);
+  merged->Merge(*entries);
+  const std::size_t bytes = Value(std::shared_ptr<const Dictionary>(merged)).ApproximateBytes();
+  Counters& counters = *platform_->counters;
+  if (capped && bytes > userInfoBytes_) {
+    const auto total = static_cast<std::size_t>(
+        std::max<std::int64_t>(0, Counters::Get(counters.configurationBytes)));
+    const bool sessionFull = bytes > platform_->max_configuration_bytes;
+    if (sessionFull ||
+        total + (bytes - userInfoBytes_) > platform_->max_configuration_bytes_total) {
+      Counters::Add(counters.configurationCapped);
+      if (!std::exchange(configurationCapped_, true)) {
+        if (sessionFull) {
+          SESSION_LOG(LogLevel::kError,
+                      "%s:%d:%s: session %lli would hold more than %zu bytes of configuration, the "
+                      "most it keeps; later configurations are acknowledged but not merged",
+                      reporterID(), platform_->max_configuration_bytes);
+        } else {
+          SESSION_LOG(LogLevel::kError,
+                      "%s:%d:%s: the sessions hold %zu bytes of configuration in all, the most "
+                      "they keep; later configurations of session %lli are acknowledged but not "
+                      "merged",
+                      platform_->max_configuration_bytes_total, reporterID());
+        }
+      }
+      return;
+    }
+  }
+  Counters::Add(counters.configurationBytes,
+                static_cast<std::int64_t>(bytes) - static_cast<std::int64_t>(userInfoBytes_));
+  userInfoBytes_ = bytes;
   userInfo_.store(std::move(merged));
 }
-
-void QNReportingSession::updateDefaults(const Dictionary* defaults) { setConfiguration(defaults); }
 
 void QNReportingSession::setUserInfo(std::shared_ptr<const Dictionary> info) {
   userInfo_.store(info ? std::move(info) : std::make_shared<const Dictionary>());
@@ -458,10 +487,16 @@ void QNReportingSession::sendSingleMessage(const std::shared_ptr<const Platform>
          "%s:%d:%s: sending single message after delta %lli for service %i",
          static_cast<long long>(delay), static_cast<int>(serviceType));
 
+  // A delayed message is counted while it waits, so that the daemon stops reading senders
+  // while too many bytes wait (docs/daemon.md, "max-parked-bytes").
+  const std::int64_t parked =
+      delay > 0 && payload ? static_cast<std::int64_t>(Value(payload).ApproximateBytes()) : 0;
+  Counters::Add(platform->counters->parkedBytes, parked);
   platform->dispatcher->AsyncGlobal(
       QualityOfService::kBackground, std::chrono::seconds(delay),
-      [platform, scope, payload = std::move(payload), category, type, serviceType,
+      [platform, scope, payload = std::move(payload), category, type, serviceType, parked,
        reply = std::move(reply)] {
+        Counters::Add(platform->counters->parkedBytes, -parked);
         TracePoint(*platform, kTraceMessage);
         QN_LOG(*platform->log, scope.get(), LogLevel::kDebug, "%s:%d:%s: sending single message");
         Dictionary sessionInfo{{kLivoReportingSessionInfoClientType, kClientType},

@@ -106,9 +106,13 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
 
   // Merges every entry of `configuration` into userInfo (later values replace earlier ones
   // under the same key); null changes nothing. Works in any state. userInfo is replaced by
-  // a merged copy, so snapshots taken earlier stay as they were. The two are identical.
-  void setConfiguration(const Dictionary* configuration);
-  void updateDefaults(const Dictionary* defaults);
+  // a merged copy, so snapshots taken earlier stay as they were. A configuration that would
+  // take userInfo past the platform's max_configuration_bytes, or all sessions' user info
+  // past max_configuration_bytes_total, is not merged (counted; logged once per session).
+  // updateDefaults merges the same way, without the caps (the defaults are the daemon's).
+  // REQUIRES: on the request handler's thread.
+  void setConfiguration(const Dictionary* configuration) { MergeUserInfo(configuration, true); }
+  void updateDefaults(const Dictionary* defaults) { MergeUserInfo(defaults, false); }
   void setConfiguration(const std::shared_ptr<const Dictionary>& configuration) {
     setConfiguration(configuration.get());
   }
@@ -247,6 +251,7 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
                std::uint16_t type, bool wasStarted);
   void RegisterOrientationCallbacks(const std::string& callbackID);
   void HandleOrientation(bool device, std::int32_t orientation);
+  void MergeUserInfo(const Dictionary* entries, bool capped);
   // Appends `item` of `bytes` unless that would take the array past `cap` bytes, or every
   // counted array together past `totalCap`.
   enum class AppendResult { kAppended, kGone, kSessionFull, kAllFull };
@@ -265,6 +270,8 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   std::atomic<bool> started_{false};
   std::atomic<bool> livoReportingSessionStarted_{false};
   std::atomic<bool> aggregationCapped_{false};  // the cap was reached since the last start
+  bool configurationCapped_ = false;  // request handler only: a configuration was not merged
+  std::size_t userInfoBytes_ = 0;     // request handler only: counted in configurationBytes
   session_detail::AtomicShared<const Dictionary> userInfo_;
   session_detail::AtomicShared<const Dictionary> driverSnapShot_;
   session_detail::AtomicShared<const TransactionCompleteBlock> transactionCompleteBlock_;

@@ -12,6 +12,7 @@
 #include <unistd.h>
 
 #include <algorithm>
+#include <array>
 #include <cerrno>
 #include <chrono>
 #include <cstdio>
@@ -99,7 +100,7 @@ request ends the daemon with status 2. See qnreportingd(8).
 // What one client may hold and how far the daemon reads ahead (docs/daemon.md, "Limits").
 struct Limits {
   std::size_t max_connections = LinuxIpcOptions{}.max_connections;
-  std::size_t max_sessions_per_client = QNReportingServerContext::kDefaultMaxSessionsPerClient;
+  std::size_t max_sessions_per_uid = QNReportingServerContext::kDefaultMaxSessionsPerUid;
   std::size_t max_sessions = QNReportingServerContext::kDefaultMaxSessions;
   std::size_t max_aggregated_bytes = Platform::kDefaultMaxAggregatedBytes;
   std::size_t max_aggregated_bytes_total = Platform::kDefaultMaxAggregatedBytesTotal;
@@ -107,6 +108,15 @@ struct Limits {
   std::size_t max_pending_bytes = LinuxIpcOptions{}.max_pending_request_bytes;
   std::size_t max_unread_reply_bytes = LinuxIpcOptions{}.max_outgoing_bytes;
   std::size_t store_high_water = 4096;
+  // Per uid and byte budgets (docs/daemon.md, "Who may do what").
+  std::size_t max_reporter_ids = LinuxIpcOptions{}.max_reporter_ids;
+  std::size_t max_connections_per_uid = LinuxIpcOptions{}.max_connections_per_uid;
+  std::array<IpcByteBudget, kIpcBudgetCount> ipc_budgets = LinuxIpcOptions{}.budgets;
+  std::size_t partial_frame_timeout_s = LinuxIpcOptions{}.partial_frame_timeout_ms / 1000;
+  std::size_t store_high_water_bytes = 16u << 20;
+  std::size_t max_parked_bytes = 8u << 20;
+  std::size_t max_configuration_bytes = Platform{}.max_configuration_bytes;
+  std::size_t max_configuration_bytes_total = Platform{}.max_configuration_bytes_total;
 };
 
 struct Options {
@@ -118,6 +128,7 @@ struct Options {
   Limits limits;
   std::string metrics_file;  // the counters for Prometheus too, when set
   ReportingStore::Options store;  // its retention: --store-max-bytes, --store-max-age
+  bool shared_sessions = false;
 };
 
 // A CLI11 check that a value is not empty.
@@ -179,6 +190,9 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
                  "collector)")
       ->type_name("PATH")
       ->check(kNotEmpty);
+  app.add_flag("--shared-sessions", options.shared_sessions,
+               "Let every client reach every other client's sessions, whatever its user")
+      ->disable_flag_override();
   Limits& limits = options.limits;
   const auto limit = [&app](const char* name, std::size_t& value, const char* what,
                             std::size_t most = SIZE_MAX) {
@@ -202,8 +216,8 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
   };
   limit("--max-connections", limits.max_connections,
         "Connections open at once (one more is refused)");
-  limit("--max-sessions-per-client", limits.max_sessions_per_client,
-        "Sessions one client may hold");
+  limit("--max-sessions-per-uid", limits.max_sessions_per_uid,
+        "Sessions the clients of one user may hold");
   limit("--max-sessions", limits.max_sessions, "Sessions all clients may hold (at most 100000)",
         QNReportingServerContext::kMostMaxSessions);
   limit("--max-aggregated-bytes", limits.max_aggregated_bytes,
@@ -248,6 +262,31 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
       ->default_str("off")
       ->check(duration)
       ->group("Limits");
+  limit("--max-reporter-ids", limits.max_reporter_ids, "Reporter IDs in one request's list");
+  limit("--max-connections-per-uid", limits.max_connections_per_uid,
+        "Connections one user may hold open");
+  limit("--max-request-bytes-per-uid", limits.ipc_budgets[kIpcRequestBytes].per_uid,
+        "Bytes of requests in the service, one user's");
+  limit("--max-request-bytes-total", limits.ipc_budgets[kIpcRequestBytes].total,
+        "The same for all users");
+  limit("--max-frame-bytes-per-uid", limits.ipc_budgets[kIpcFrameBytes].per_uid,
+        "Bytes read but not yet handed over (partial frames), one user's");
+  limit("--max-frame-bytes-total", limits.ipc_budgets[kIpcFrameBytes].total,
+        "The same for all users");
+  limit("--max-reply-bytes-per-uid", limits.ipc_budgets[kIpcReplyBytes].per_uid,
+        "Reply bytes not yet read, one user's");
+  limit("--max-reply-bytes-total", limits.ipc_budgets[kIpcReplyBytes].total,
+        "The same for all users");
+  limit("--partial-frame-timeout", limits.partial_frame_timeout_s,
+        "Seconds a connection may hold a partial frame (at most 86400)", 86400);
+  limit("--store-high-water-bytes", limits.store_high_water_bytes,
+        "Payload bytes waiting for the store before senders are held back");
+  limit("--max-parked-bytes", limits.max_parked_bytes,
+        "Payload bytes of delayed single messages before senders are held back");
+  limit("--max-configuration-bytes", limits.max_configuration_bytes,
+        "Configuration bytes a session keeps");
+  limit("--max-configuration-bytes-total", limits.max_configuration_bytes_total,
+        "The same for all sessions together");
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -279,6 +318,7 @@ Dictionary StatsOf(const Counters& counters, const ReportingStore& store) {
                          {"failed", Value(figures.failed)},
                          {"dropped_queue_full", Value(figures.dropped_queue_full)},
                          {"lag", Value(store.Backlog())},
+                         {"lag_bytes", Value(store.BacklogBytes())},
                          {"batches", Value(figures.batches)},
                          {"removed", Value(figures.retention_removed)},
                          {"lost", Value(figures.retention_lost)},
@@ -350,6 +390,8 @@ int Run(const Options& options) {
   platform->counters = counters;
   platform->max_aggregated_bytes = options.limits.max_aggregated_bytes;
   platform->max_aggregated_bytes_total = options.limits.max_aggregated_bytes_total;
+  platform->max_configuration_bytes = options.limits.max_configuration_bytes;
+  platform->max_configuration_bytes_total = options.limits.max_configuration_bytes_total;
   platform->log = log;
   platform->trace = NewLinuxTrace();
   platform->dispatcher = NewLinuxDispatcher();
@@ -387,8 +429,9 @@ int Run(const Options& options) {
   platform->analytics = NewStoreAnalytics(store);
 
   std::shared_ptr<QNReportingServiceDelegate> delegate = QNReportingServiceDelegate::Create(
-      platform, {.maxSessionsPerClient = options.limits.max_sessions_per_client,
-                 .maxSessions = options.limits.max_sessions});
+      platform, {.maxSessionsPerUid = options.limits.max_sessions_per_uid,
+                 .maxSessions = options.limits.max_sessions,
+                 .sharedSessions = options.shared_sessions});
 
   auto stats = std::make_shared<LinuxStatsPublisher>(paths.runtime_dir + "/" + kStatsFileName,
                                                      options.metrics_file);
@@ -408,16 +451,25 @@ int Run(const Options& options) {
   ipc_options.max_pending_requests = options.limits.max_pending_requests;
   ipc_options.max_pending_request_bytes = options.limits.max_pending_bytes;
   ipc_options.max_outgoing_bytes = options.limits.max_unread_reply_bytes;
-  // Messages waiting in the sessions' queues and in the store's queue: above the mark the
-  // clients that send messages wait (they are not read), so a slow disk slows them down
-  // instead of filling the daemon's memory.
+  ipc_options.max_reporter_ids = options.limits.max_reporter_ids;
+  ipc_options.max_connections_per_uid = options.limits.max_connections_per_uid;
+  ipc_options.budgets = options.limits.ipc_budgets;
+  ipc_options.partial_frame_timeout_ms =
+      static_cast<int>(options.limits.partial_frame_timeout_s * 1000);
+  // Messages waiting in the sessions' queues and in the store's queue (counted and in
+  // bytes), and single messages waiting in delay timers: above a mark the clients that send
+  // messages wait (they are not read), so a slow disk slows them down instead of filling the
+  // daemon's memory.
   ipc_options.message_intake_blocked = [store = std::weak_ptr<ReportingStore>(store), counters,
-                                        high_water = options.limits.store_high_water] {
+                                        limits = options.limits] {
     auto open = store.lock();
     const std::int64_t queued = Counters::Get(counters->deliveriesQueued);
     return (open ? open->Backlog() : 0) +
-               static_cast<std::uint64_t>(std::max<std::int64_t>(queued, 0)) >
-           high_water;
+                   static_cast<std::uint64_t>(std::max<std::int64_t>(queued, 0)) >
+               limits.store_high_water ||
+           (open ? open->BacklogBytes() : 0) > limits.store_high_water_bytes ||
+           Counters::Get(counters->parkedBytes) >
+               static_cast<std::int64_t>(limits.max_parked_bytes);
   };
   LinuxIpcListenerResult listening =
       NewLinuxIpcListener(ipc_options, log, delegate->context().logScope);

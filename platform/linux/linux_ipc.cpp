@@ -203,6 +203,13 @@ std::optional<ListeningSocket> ActivatedSocket() {
 
 class LinuxIpcListener;
 
+// What the connections of one uid (or of all uids) hold now. Shared with the connections,
+// which may outlive the listener; the byte counts change on any thread.
+struct IpcUse {
+  std::size_t connections = 0;  // io_context thread only
+  std::array<std::atomic<std::size_t>, kIpcBudgetCount> bytes{};
+};
+
 // One accepted connection. Lives as long as its pending asio operations, the listener's
 // registry, or a reply in progress hold it. Everything except QueueReply and the getters runs
 // on the listener's io_context thread.
@@ -215,7 +222,8 @@ class LinuxIpcListener;
 class LinuxConnection final : public IpcConnection,
                               public std::enable_shared_from_this<LinuxConnection> {
  public:
-  LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_t pid, uid_t uid);
+  LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_t pid, uid_t uid,
+                  std::shared_ptr<IpcUse> uid_use);
 
   pid_t PeerPid() const override { return pid_; }
   uid_t PeerUid() const override { return uid_; }
@@ -244,9 +252,13 @@ class LinuxConnection final : public IpcConnection,
   // go of the exported object and handlers. io_context thread.
   void Finish();
 
-  // Looks again at a connection held back because the store was behind. io_context thread.
+  // Looks again at a connection held back because the store was behind, or for a budget.
+  // io_context thread.
   void WakeIfHeldByStore() {
     if (hold_ == Hold::kStore) Pump();
+  }
+  void WakeIfHeldByBudget() {
+    if (hold_ == Hold::kBudget) Pump();
   }
 
   // Marks the connection ended without running anything; for a listener that is destroyed
@@ -261,7 +273,7 @@ class LinuxConnection final : public IpcConnection,
     kEnded,
   };
   // Why the connection is not read for now.
-  enum class Hold { kNone, kRequests, kReplies, kStore };
+  enum class Hold { kNone, kRequests, kReplies, kBudget, kStore };
 
   // Hands over the frames already read and reads more, as far as flow control allows.
   void Pump();
@@ -273,7 +285,19 @@ class LinuxConnection final : public IpcConnection,
   // Asks the exported object to say when the requests handed since the last call are taken.
   void CloseBatch();
   void OnBatchTaken(std::size_t requests, std::size_t bytes);
-  Hold WhyHeld();
+  // `reading`: whether to read more (the frame budget holds reading only, as handing the
+  // frames over is what frees it).
+  Hold WhyHeld(bool reading);
+  // Sets what this connection holds of `budget` to `bytes`, in its uid's and the total
+  // use; returns whether that went down. The reply budget's under mu_, the others on the
+  // io_context thread.
+  bool Count(IpcBudget budget, std::size_t bytes);
+  void CountRepliesLocked();  // REQUIRES: mu_ held
+  // Lets the connections held for a budget look again, after this one freed some.
+  void Released();
+  // Closes the connection when its read bytes hold no whole frame for too long.
+  void WatchPartialFrame();
+  void OnPartialFrameTimer();
   void SetHold(Hold hold);
   // Bad input: log and count it, stop reading, and queue the error frame once every request
   // read before it has been taken in (so that their replies go out first).
@@ -304,6 +328,11 @@ class LinuxConnection final : public IpcConnection,
   const std::string description_;
   asio::steady_timer close_timer_;
   asio::steady_timer store_timer_;  // re-checks the store while it holds this connection
+  asio::steady_timer frame_timer_;  // runs while read bytes hold a partial frame
+  const std::shared_ptr<IpcUse> uid_use_;
+  const std::shared_ptr<IpcUse> total_use_;
+  // What this connection adds to those uses (the reply entry guarded by mu_).
+  std::array<std::size_t, kIpcBudgetCount> counted_{};
 
   // io_context thread only.
   std::shared_ptr<IpcExportedObject> object_;
@@ -314,6 +343,12 @@ class LinuxConnection final : public IpcConnection,
   bool resumed_ = false;
   bool read_in_flight_ = false;
   Hold hold_ = Hold::kNone;
+  IpcBudget held_budget_ = kIpcRequestBytes;  // which budget, while hold_ is kBudget
+  std::uint64_t frames_read_ = 0;
+  std::uint64_t frames_at_watch_ = 0;  // frames_read_ when the partial frame timer started
+  std::uint64_t frame_watch_ = 0;      // the partial frame timer's current run
+  bool frame_watched_ = false;
+  bool finished_ = false;  // Finish ran: the request and frame budgets hold nothing of it
   bool sends_messages_ = false;
   bool peer_done_ = false;            // end of stream: nothing more to read
   bool yielded_ = false;              // HandleFrames stopped at kFramesPerTurn with frames left
@@ -387,6 +422,19 @@ class LinuxIpcListener final : public IpcListener {
 
   // How many connections are held back because the store is behind.
   void CountStoreHold(int change) { store_holds_.fetch_add(change, std::memory_order_relaxed); }
+  const std::shared_ptr<IpcUse>& total_use() const { return total_use_; }
+  // io_context thread: the connections held for a budget look again (once per turn).
+  void CountBudgetHold(int change) { budget_holds_ += change; }
+  void WakeBudgetHeld() {
+    if (budget_holds_ == 0 || budget_wake_posted_) return;
+    budget_wake_posted_ = true;
+    asio::post(*io_, [this] {
+      budget_wake_posted_ = false;
+      std::vector<std::shared_ptr<LinuxConnection>> open;
+      for (auto& [raw, connection] : connections_) open.push_back(connection);
+      for (auto& connection : open) connection->WakeIfHeldByBudget();
+    });
+  }
 
   // Any thread: looks again at every connection held back because the store was behind.
   void WakeStoreHeld() {
@@ -400,7 +448,10 @@ class LinuxIpcListener final : public IpcListener {
 
   // io_context thread.
   void Forget(LinuxConnection* connection) {
-    if (connections_.erase(connection)) Counters::Add(counters_->connectionsOpen, -1);
+    if (!connections_.erase(connection)) return;
+    Counters::Add(counters_->connectionsOpen, -1);
+    auto use = uses_.find(connection->PeerUid());
+    if (use != uses_.end() && --use->second->connections == 0) uses_.erase(use);
   }
 
  private:
@@ -435,16 +486,26 @@ class LinuxIpcListener final : public IpcListener {
       credentials.pid = 0;
       credentials.uid = static_cast<uid_t>(-1);
     }
+    std::shared_ptr<IpcUse>& use = uses_[credentials.uid];
+    if (!use) use = std::make_shared<IpcUse>();
     auto connection = std::make_shared<LinuxConnection>(*this, std::move(socket), credentials.pid,
-                                                        credentials.uid);
+                                                        credentials.uid, use);
     const bool over_limit = connections_.size() >= options_.max_connections;
+    const bool over_uid_limit = use->connections >= options_.max_connections_per_uid;
     connections_.emplace(connection.get(), connection);
+    ++use->connections;
     Counters::Add(counters_->connectionsOpen, 1);
-    if (over_limit) {
+    if (over_limit || over_uid_limit) {
       Counters::Add(counters_->connectionsRefused);
-      QN_LOG(*log_, scope_.get(), LogLevel::kError,
-             "%s:%d:%s: %s refused: %zu connections are open, the most allowed",
-             connection->Description(), options_.max_connections);
+      if (over_limit) {
+        QN_LOG(*log_, scope_.get(), LogLevel::kError,
+               "%s:%d:%s: %s refused: %zu connections are open, the most allowed",
+               connection->Description(), options_.max_connections);
+      } else {
+        QN_LOG(*log_, scope_.get(), LogLevel::kError,
+               "%s:%d:%s: %s refused: uid %u has %zu connections open, the most one user may",
+               connection->Description(), credentials.uid, options_.max_connections_per_uid);
+      }
       connection->Refuse(protocol::ConnectionError::kTooManyConnections,
                          StringWithFormat("the daemon serves %zu connections, the most it allows; "
                                           "try again later",
@@ -499,12 +560,17 @@ class LinuxIpcListener final : public IpcListener {
   // io_context thread only (set before Resume for the delegate).
   std::shared_ptr<IpcListenerDelegate> delegate_;
   std::unordered_map<LinuxConnection*, std::shared_ptr<LinuxConnection>> connections_;
+  std::unordered_map<uid_t, std::shared_ptr<IpcUse>> uses_;  // uids with a connection open
+  const std::shared_ptr<IpcUse> total_use_ = std::make_shared<IpcUse>();
+  int budget_holds_ = 0;
+  bool budget_wake_posted_ = false;
   bool stopped_ = false;
   bool accept_failing_ = false;
   std::atomic<int> store_holds_{0};
 };
 
-LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_t pid, uid_t uid)
+LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_t pid, uid_t uid,
+                                 std::shared_ptr<IpcUse> uid_use)
     : listener_(listener),
       io_(listener.io()),
       log_(listener.log()),
@@ -520,7 +586,10 @@ LinuxConnection::LinuxConnection(LinuxIpcListener& listener, Socket socket, pid_
       description_(
           StringWithFormat("<connection pid=%d uid=%u fd=%d>", pid, uid, socket_.native_handle())),
       close_timer_(*listener.io()),
-      store_timer_(*listener.io()) {}
+      store_timer_(*listener.io()),
+      frame_timer_(*listener.io()),
+      uid_use_(std::move(uid_use)),
+      total_use_(listener.total_use()) {}
 
 void LinuxConnection::Resume() {
   asio::dispatch(*io_, [self = shared_from_this()] {
@@ -535,7 +604,7 @@ void LinuxConnection::Resume() {
   });
 }
 
-LinuxConnection::Hold LinuxConnection::WhyHeld() {
+LinuxConnection::Hold LinuxConnection::WhyHeld(bool reading) {
   if (untaken_requests_ >= options_.max_pending_requests ||
       untaken_bytes_ >= options_.max_pending_request_bytes) {
     return Hold::kRequests;
@@ -543,6 +612,15 @@ LinuxConnection::Hold LinuxConnection::WhyHeld() {
   {
     std::lock_guard lock(mu_);
     if (pending_.size() + writing_bytes_ >= pause_reply_bytes_) return Hold::kReplies;
+  }
+  for (std::size_t b = 0; b < kIpcBudgetCount; ++b) {
+    if (b == kIpcFrameBytes && !reading) continue;
+    const IpcByteBudget& budget = options_.budgets[b];
+    if (uid_use_->bytes[b].load(std::memory_order_relaxed) >= budget.per_uid ||
+        total_use_->bytes[b].load(std::memory_order_relaxed) >= budget.total) {
+      held_budget_ = static_cast<IpcBudget>(b);
+      return Hold::kBudget;
+    }
   }
   if (sends_messages_ && options_.message_intake_blocked && options_.message_intake_blocked()) {
     return Hold::kStore;
@@ -560,11 +638,13 @@ void LinuxConnection::Pump() {
   const bool ok = HandleFrames();
   CloseBatch();
   if (!ok) return;
+  if (Count(kIpcFrameBytes, decoder_.buffered())) Released();
+  WatchPartialFrame();
   if (yielded_) {
     asio::post(*io_, [self = shared_from_this()] { self->Pump(); });
     return;
   }
-  const Hold hold = WhyHeld();
+  const Hold hold = WhyHeld(true);
   SetHold(hold);
   if (hold == Hold::kStore) {
     // The store's writer wakes held connections after each batch (WakeStoreHeld); this
@@ -582,11 +662,74 @@ void LinuxConnection::SetHold(Hold hold) {
   if (hold != Hold::kNone) {
     Counters::Add(hold == Hold::kRequests  ? counters_->pausedForRequests
                   : hold == Hold::kReplies ? counters_->pausedForReplies
+                  : hold == Hold::kBudget  ? counters_->pausedForBudget[held_budget_]
                                            : counters_->pausedForStore);
   }
   if (hold_ == Hold::kStore) listener_.CountStoreHold(-1);
   if (hold == Hold::kStore) listener_.CountStoreHold(1);
+  if (hold_ == Hold::kBudget) listener_.CountBudgetHold(-1);
+  if (hold == Hold::kBudget) listener_.CountBudgetHold(1);
   hold_ = hold;
+}
+
+bool LinuxConnection::Count(IpcBudget budget, std::size_t bytes) {
+  if (budget != kIpcReplyBytes && finished_) bytes = 0;
+  const std::size_t before = std::exchange(counted_[budget], bytes);
+  if (bytes >= before) {
+    uid_use_->bytes[budget].fetch_add(bytes - before, std::memory_order_relaxed);
+    total_use_->bytes[budget].fetch_add(bytes - before, std::memory_order_relaxed);
+    return false;
+  }
+  uid_use_->bytes[budget].fetch_sub(before - bytes, std::memory_order_relaxed);
+  total_use_->bytes[budget].fetch_sub(before - bytes, std::memory_order_relaxed);
+  return true;
+}
+
+void LinuxConnection::CountRepliesLocked() {
+  Count(kIpcReplyBytes, state_ == State::kEnded ? 0 : pending_.size() + writing_bytes_);
+}
+
+void LinuxConnection::Released() {
+  {
+    std::lock_guard lock(mu_);
+    if (state_ == State::kEnded) return;  // the listener may be gone
+  }
+  listener_.WakeBudgetHeld();
+}
+
+void LinuxConnection::WatchPartialFrame() {
+  if (decoder_.buffered() == 0) {
+    if (frame_watched_) frame_timer_.cancel();
+    frame_watched_ = false;
+    return;
+  }
+  if (frame_watched_) return;
+  frame_watched_ = true;
+  frames_at_watch_ = frames_read_;
+  frame_timer_.expires_after(std::chrono::milliseconds(options_.partial_frame_timeout_ms));
+  frame_timer_.async_wait(
+      [self = shared_from_this(), run = ++frame_watch_](const asio::error_code& error) {
+        if (!error && run == self->frame_watch_) self->OnPartialFrameTimer();
+      });
+}
+
+void LinuxConnection::OnPartialFrameTimer() {
+  frame_watched_ = false;
+  {
+    std::lock_guard lock(mu_);
+    if (state_ != State::kOpen) return;
+  }
+  // Whole frames went through since, or the bytes wait for the service, not for the peer.
+  const bool waits_for_service =
+      hold_ == Hold::kRequests || hold_ == Hold::kReplies || hold_ == Hold::kStore;
+  if (frames_read_ != frames_at_watch_ || waits_for_service) {
+    WatchPartialFrame();
+    return;
+  }
+  Counters::Add(counters_->partialFrames);
+  Fail(protocol::ConnectionError::kBadMessagePack,
+       StringWithFormat("no whole frame within %d ms (%zu bytes of a frame pending)",
+                        options_.partial_frame_timeout_ms, decoder_.buffered()));
 }
 
 void LinuxConnection::StartRead() {
@@ -634,7 +777,7 @@ void LinuxConnection::FinishIfAnswered() {
 }
 
 bool LinuxConnection::HandleFrames() {
-  for (int handed = 0; WhyHeld() == Hold::kNone; ++handed) {
+  for (int handed = 0; WhyHeld(false) == Hold::kNone; ++handed) {
     if (handed == kFramesPerTurn) {
       // Let the other connections' requests in before this one goes on.
       yielded_ = true;
@@ -642,6 +785,7 @@ bool LinuxConnection::HandleFrames() {
     }
     auto body = decoder_.Next();
     if (!body) break;
+    ++frames_read_;
     const std::size_t bytes = body->size() + kFrameHeaderBytes;
     auto decoded = DecodeMsgPack(*body);
     if (auto* problem = std::get_if<protocol::RequestProblem>(&decoded)) {
@@ -655,7 +799,22 @@ bool LinuxConnection::HandleFrames() {
       return false;
     }
     const auto header = std::get<protocol::RequestHeader>(checked);
+    if (protocol::IsPrivileged(header.op) && uid_ != 0 && uid_ != options_.privileged_uid) {
+      Fail(protocol::ConnectionError::kNotPermitted,
+           StringWithFormat("%s is allowed only to root and uid %u, not to uid %u (request %u)",
+                            protocol::OpName(header.op), options_.privileged_uid, uid_,
+                            header.request_id));
+      return false;
+    }
     const Array& items = *request.as_array();
+    if (const Array* ids = header.op == protocol::Op::kSendMessage ? items[5].as_array() : nullptr;
+        ids && ids->size() > options_.max_reporter_ids) {
+      Fail(protocol::ConnectionError::kBadArguments,
+           StringWithFormat("the reporter ID list of request %u holds %zu IDs, more than the %zu "
+                            "allowed",
+                            header.request_id, ids->size(), options_.max_reporter_ids));
+      return false;
+    }
     Array args(items.begin() + 2, items.end());
     if (!object_) {
       QN_LOG(*log_, scope_.get(), LogLevel::kError,
@@ -669,6 +828,7 @@ bool LinuxConnection::HandleFrames() {
     batch_bytes_ += bytes;
     ++untaken_requests_;
     untaken_bytes_ += bytes;
+    Count(kIpcRequestBytes, untaken_bytes_);
     std::weak_ptr<LinuxConnection> weak = shared_from_this();
     const std::uint32_t request_id = header.request_id;
     object_->HandleRequest(header.op, args, [weak, request_id](Value result) {
@@ -699,11 +859,12 @@ void LinuxConnection::CloseBatch() {
 void LinuxConnection::OnBatchTaken(std::size_t requests, std::size_t bytes) {
   untaken_requests_ -= requests;
   untaken_bytes_ -= bytes;
+  if (Count(kIpcRequestBytes, untaken_bytes_)) Released();
   if (!error_frame_.empty()) {
     if (untaken_requests_ == 0) SendErrorFrame();
     return;
   }
-  if (hold_ == Hold::kRequests) Pump();
+  if (hold_ == Hold::kRequests || hold_ == Hold::kBudget) Pump();
   FinishIfAnswered();
 }
 
@@ -761,10 +922,12 @@ void LinuxConnection::QueueReply(std::uint32_t request_id, Value result) {
   pending_ += frame;
   if (pending_.size() + writing_bytes_ > max_outgoing_bytes_) {
     pending_.clear();
+    CountRepliesLocked();
     state_ = State::kClosing;
     asio::post(*io_, [self = shared_from_this()] { self->OnOverflow(); });
     return;
   }
+  CountRepliesLocked();
   if (!write_active_) {
     write_active_ = true;
     asio::post(*io_, [self = shared_from_this()] {
@@ -816,12 +979,16 @@ void LinuxConnection::OnWrite(const asio::error_code& error) {
   if (writing_.capacity() > kKeptBufferCapacity) std::string().swap(writing_);
   writing_bytes_ = 0;
   write_active_ = false;
+  CountRepliesLocked();
   if (!pending_.empty()) {
     StartWriteLocked();
+    lock.unlock();
+    listener_.WakeBudgetHeld();
     return;
   }
   const State state = state_;
   lock.unlock();
+  if (state != State::kClosing) listener_.WakeBudgetHeld();
   if (state == State::kClosing) {
     Finish();  // the error frame is out
   } else if (hold_ == Hold::kReplies) {
@@ -837,13 +1004,19 @@ void LinuxConnection::Finish() {
     if (state_ == State::kEnded) return;
     state_ = State::kEnded;
     pending_.clear();
+    CountRepliesLocked();
   }
   asio::error_code ignored;
   socket_.shutdown(Socket::shutdown_both, ignored);
   socket_.close(ignored);
   close_timer_.cancel();
   store_timer_.cancel();
+  frame_timer_.cancel();
   SetHold(Hold::kNone);
+  finished_ = true;
+  Count(kIpcRequestBytes, 0);
+  Count(kIpcFrameBytes, 0);
+  listener_.WakeBudgetHeld();
   auto keep = shared_from_this();
   listener_.Forget(this);
   auto invalidation = std::move(invalidation_);
@@ -864,6 +1037,7 @@ void LinuxConnection::Abandon() {
   socket_.close(ignored);
   close_timer_.cancel();
   store_timer_.cancel();
+  frame_timer_.cancel();
   invalidation_ = nullptr;
   interruption_ = nullptr;
   object_ = nullptr;

@@ -1,5 +1,8 @@
 #pragma once
 
+#include <unistd.h>
+
+#include <array>
 #include <cstddef>
 #include <functional>
 #include <memory>
@@ -11,6 +14,20 @@
 
 namespace qn {
 
+// What a peer makes the IPC layer hold, in bytes; each has a budget per uid and one for all
+// peers together.
+enum IpcBudget : std::size_t {
+  kIpcRequestBytes,  // requests handed to the exported object, not yet taken in
+  kIpcFrameBytes,    // bytes read and not yet handed over: partial frames, and whole ones
+                     // waiting their turn
+  kIpcReplyBytes,    // replies not yet written to the peer
+  kIpcBudgetCount,
+};
+struct IpcByteBudget {
+  std::size_t per_uid;
+  std::size_t total;
+};
+
 struct LinuxIpcOptions {
   // The socket path to bind when the process was not started by socket activation.
   std::string socket_path;
@@ -19,8 +36,19 @@ struct LinuxIpcOptions {
   // Whether Resume tells systemd the service is ready (sd_notify READY=1; a no-op when
   // not started by systemd).
   bool notify_ready = true;
-  // Connections open at once; one more gets the error frame (code 8) and is closed.
+  // Connections open at once, in all and of one uid; one more gets the error frame (code 8)
+  // and is closed.
   std::size_t max_connections = 4096;
+  std::size_t max_connections_per_uid = 512;
+  // While the connections of a peer's uid, or of all uids, hold a budget's bytes or more,
+  // that peer is not read (a request or reply budget also holds back the requests already
+  // read). Nothing is dropped: the peer's writes wait in its socket.
+  std::array<IpcByteBudget, kIpcBudgetCount> budgets = {IpcByteBudget{4u << 20, 16u << 20},
+                                                        IpcByteBudget{4u << 20, 16u << 20},
+                                                        IpcByteBudget{4u << 20, 16u << 20}};
+  // A connection whose read bytes hold no whole frame for this long gets the error frame
+  // (code 2) and is closed, so a frame that never ends cannot hold its buffer for ever.
+  int partial_frame_timeout_ms = 30000;
   // A connection is not read while this many of its requests (or this many bytes of them)
   // have been handed to its exported object and not yet taken in (IpcExportedObject::
   // AfterRequests), so the server queue holds a bounded number of any one client's requests.
@@ -34,6 +62,13 @@ struct LinuxIpcOptions {
   std::function<bool()> message_intake_blocked;
   // Where the IPC layer counts requests, bad frames, pauses and refusals; may be null.
   std::shared_ptr<Counters> counters;
+  // The most reporter IDs a request's ID list may hold; a longer list gets the error frame,
+  // code 6, and the connection closes. It bounds what one message can make the daemon do.
+  std::size_t max_reporter_ids = 256;
+  // Besides root, the one uid whose peers may make privileged requests (protocol::
+  // IsPrivileged); from any other peer such a request gets the error frame, code 10, and
+  // the connection closes. The daemon's own uid.
+  uid_t privileged_uid = ::geteuid();
   // How long a connection closed for bad input waits for its error frame to be written.
   int error_flush_timeout_ms = 1000;
 };
@@ -66,8 +101,8 @@ struct LinuxIpcListenerResult {
 // closes its connection the same way (code 9).
 //
 // Flow control (see LinuxIpcOptions): a connection is read only while it has few enough
-// requests waiting in the service, its peer reads its replies, and, once it has sent a
-// message, the store keeps up. A connection held back is simply not read; nothing it sent
+// requests waiting in the service, its peer reads its replies, its uid and all uids stay
+// within their byte budgets, and, once it has sent a message, the store keeps up. A connection held back is simply not read; nothing it sent
 // is dropped.
 //
 // REQUIRES: `log` is not null.

@@ -240,6 +240,7 @@ std::function<void()> ReportingStore::DrainHook() const {
 ReportingStore::Stats ReportingStore::stats() const { return writer_->stats(); }
 
 std::uint64_t ReportingStore::Backlog() const { return writer_->backlog(); }
+std::uint64_t ReportingStore::BacklogBytes() const { return writer_->backlog_bytes(); }
 
 bool ReportingStore::IsOpen() const { return writer_->open(); }
 

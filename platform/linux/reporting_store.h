@@ -166,6 +166,8 @@ class ReportingStore {
   // Records handed over and not yet written (the store's lag). Lock-free: cheap enough to
   // ask before every request.
   std::uint64_t Backlog() const;
+  // The approximate bytes (Value::ApproximateBytes) of those records' payloads. Lock-free.
+  std::uint64_t BacklogBytes() const;
   // Whether the store still takes records (not closed).
   bool IsOpen() const;
   const std::string& path() const { return path_; }

@@ -79,6 +79,8 @@ TEST_F(BadInputTest, EachKindGetsItsErrorFrameAndOnlyThatConnectionCloses) {
       {RawConnection::Frame(Value(Array{2, 1, 70000, 5})), ConnectionError::kBadArguments},
       {RawConnection::Frame(Value(Array{6, 1, Value(Array{}), 1, 1, Value()})),
        ConnectionError::kBadArguments},
+      {RawConnection::Frame(Value(Array{6, 1, Value(Dictionary{}), 1, 1, Value(Array(257, 5))})),
+       ConnectionError::kBadArguments},
   };
   for (const auto& [bytes, code] : cases) {
     SCOPED_TRACE(static_cast<int>(code));

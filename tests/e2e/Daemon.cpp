@@ -1,9 +1,11 @@
 #include "tests/e2e/Daemon.h"
 
 #include <fcntl.h>
+#include <grp.h>
 #include <poll.h>
 #include <signal.h>
 #include <spawn.h>
+#include <sys/stat.h>
 #include <sys/syscall.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -158,6 +160,26 @@ std::unique_ptr<client::Client> Daemon::Connect() {
   return client;
 }
 
+std::unique_ptr<testing::RawConnection> Daemon::ConnectAs(uid_t uid) {
+  ::chmod(home().c_str(), 0750);  // mkdtemp's 0700 would keep the child out
+  auto raw = std::make_unique<testing::RawConnection>("");
+  const pid_t child = ::fork();
+  if (child == 0) {  // connects the socket it shares with the parent, as `uid` of group root
+    _exit(::setgroups(0, nullptr) == 0 && ::setuid(uid) == 0 && raw->Connect(socket_path()) ? 0
+                                                                                            : 1);
+  }
+  int status = -1;
+  ::waitpid(child, &status, 0);
+  if (status != 0) ADD_FAILURE() << "no connection as uid " << uid;
+  return status == 0 ? std::move(raw) : nullptr;
+}
+
+std::size_t Daemon::PeakRss() const {
+  const auto status = testing::ReadFileText("/proc/" + std::to_string(process_->pid()) + "/status");
+  const auto at = status.find("VmHWM:");
+  return at == std::string::npos ? 0 : std::stoull(status.substr(at + 6)) * 1024;
+}
+
 std::optional<ExitStatus> Daemon::Stop(int signal) {
   process_->Signal(signal);
   return process_->Wait();
@@ -180,7 +202,7 @@ bool Daemon::WaitForRows(
   return Eventually([&] { return condition(Rows()); });
 }
 
-bool Daemon::WaitForStat(std::initializer_list<const char*> path, std::int64_t least) {
+bool Daemon::WaitForStat(const std::vector<const char*>& path, std::int64_t least) {
   return Eventually([&] {
     Value stats = Json(testing::ReadFileText(home() + "/run/stats.json"));
     const Value* at = &stats;

@@ -47,6 +47,7 @@ class ChildProcess {
   ~ChildProcess();
 
   bool running();
+  pid_t pid() const { return pid_; }
   void Signal(int signal) const;
   // Waits for the process to end, at most `timeout`; nullopt when it did not.
   std::optional<ExitStatus> Wait(std::chrono::milliseconds timeout = kPatience);
@@ -81,6 +82,12 @@ class Daemon {
 
   // A new connection (null with a test failure when it cannot connect).
   std::unique_ptr<client::Client> Connect();
+  // A raw connection that a forked child running as `uid` (group root, so that it may reach
+  // the socket) connected: the daemon sees `uid` as its peer.
+  // REQUIRES: the test runs as root.
+  std::unique_ptr<testing::RawConnection> ConnectAs(uid_t uid);
+  // The daemon's peak resident memory so far (VmHWM), in bytes; 0 when unreadable.
+  std::size_t PeakRss() const;
 
   // Sends `signal` and waits for the daemon to end.
   std::optional<ExitStatus> Stop(int signal = SIGTERM);
@@ -92,7 +99,7 @@ class Daemon {
   bool WaitForRows(const std::function<bool(const std::vector<ReportingStoreRow>&)>& condition);
   // Waits, at most kPatience, until the stats file the daemon refreshes each second holds
   // at least `least` at `path` (e.g. {"paused", "replies"}).
-  bool WaitForStat(std::initializer_list<const char*> path, std::int64_t least);
+  bool WaitForStat(const std::vector<const char*>& path, std::int64_t least);
 
  private:
   testing::TempDir home_;

@@ -18,9 +18,9 @@ namespace qn::testing {
 // when the test says so. Thread-safe.
 class FakeIpcConnection final : public IpcConnection {
  public:
-  explicit FakeIpcConnection(pid_t pid) : pid_(pid) {}
+  explicit FakeIpcConnection(pid_t pid, uid_t uid = 1000) : pid_(pid), uid_(uid) {}
   pid_t PeerPid() const override { return pid_; }
-  uid_t PeerUid() const override { return 1000; }
+  uid_t PeerUid() const override { return uid_; }
   std::string Description() const override {
     return "<FakeIpcConnection pid=" + std::to_string(pid_) + ">";
   }
@@ -73,6 +73,7 @@ class FakeIpcConnection final : public IpcConnection {
 
  private:
   const pid_t pid_;
+  const uid_t uid_;
   std::mutex mu_;
   std::shared_ptr<IpcExportedObject> exported_;  // GUARDED_BY(mu_)
   std::function<void()> interruption_;           // GUARDED_BY(mu_)

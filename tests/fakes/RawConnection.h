@@ -31,6 +31,7 @@ class RawConnection {
     if (!socket_path.empty()) Connect(socket_path);
   }
   ~RawConnection() { ::close(fd_); }
+  int fd() const { return fd_; }
   bool Connect(const std::string& socket_path) {
     sockaddr_un address{};
     address.sun_family = AF_UNIX;

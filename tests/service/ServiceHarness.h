@@ -86,9 +86,9 @@ class ServiceHarness {
 
   // Accepts a connection from `pid` (named `name` in the process table, when given) and
   // runs the listing step.
-  Client Connect(pid_t pid, std::optional<std::string> name = std::nullopt) {
+  Client Connect(pid_t pid, std::optional<std::string> name = std::nullopt, uid_t uid = 1000) {
     if (name) env.process->SetName(pid, *name);
-    auto connection = std::make_shared<FakeIpcConnection>(pid);
+    auto connection = std::make_shared<FakeIpcConnection>(pid, uid);
     EXPECT_TRUE(listener->Accept(connection));
     Run();
     std::shared_ptr<QNReportingServerInstance> instance;

@@ -173,30 +173,30 @@ TEST_F(ServiceTest, GetAllReportersListsClientByClientInMapOrder) {
   EXPECT_THAT(r.all(), ElementsAre(ElementsAre(3, 1, 2, 3), ElementsAre(1, 2, 3)));
 }
 
-// Beyond the limit per client or in all, a create for a new ID makes no session (the reply is
+// Beyond the limit per uid or in all, a create for a new ID makes no session (the reply is
 // still YES): one error line, a refusal counted; replacing an ID still works, and a destroy
 // frees a place.
 TEST(SessionLimitTest, CreatesBeyondEitherLimitMakeNoSession) {
   const struct {
-    std::size_t perClient, total;
+    std::size_t perUid, total;
     const char* line;
-  } rows[] = {{3, 100, ": client 100 already holds 3 sessions, no session for reporter 4"},
+  } rows[] = {{3, 100, ": uid 1000 already holds 3 sessions, no session for reporter 4 of "},
               {100, 3,
                ": the clients hold 3 sessions, the most allowed; no session for reporter 4 of "
                "client 100"}};
   for (const auto& row : rows) {
     SCOPED_TRACE(row.line);
-    ServiceHarness h(nullptr, {.maxSessionsPerClient = row.perClient, .maxSessions = row.total});
+    ServiceHarness h(nullptr, {.maxSessionsPerUid = row.perUid, .maxSessions = row.total});
     const Counters& counters = *h.env.platform->counters;
     Client a = h.Connect(100);
-    Client b = h.Connect(200);
+    Client b = h.Connect(200, std::nullopt, 2000);
     BoolReplies r;
     for (std::int64_t id : {1, 2, 3, 4, 1}) a->createReportingSession(id, r.Callback());
     h.Run();
     EXPECT_THAT(r.all(), ElementsAre(true, true, true, true, true));
     EXPECT_EQ(a->clientReportingSessionMap().size(), 3u);
     EXPECT_EQ(h.env.log->Count(row.line), 1);
-    h.Create(b, 9);  // another client's place: its own, or none left in all
+    h.Create(b, 9);  // another uid's place: its own, or none left in all
     EXPECT_EQ(b.Session(9) != nullptr, row.total > 3);
     a->destroyReportingSession(1, r.Callback());
     h.Create(b, 10);
@@ -290,7 +290,7 @@ TEST_F(ServiceTest, DisabledReportingRefusesSendsHidesOthers) {
   EXPECT_TRUE(livo_.SingleMessages().empty());
 
   // Cross-client lookups find nothing, even for the caller's own ID; own lookups still work.
-  EXPECT_FALSE(h_.delegate->findReportingSessionForID(42));
+  EXPECT_FALSE(h_.delegate->findReportingSessionForID(42, std::nullopt));
   Replies<Dictionary> valid;
   b_->reporterIDValid(42, valid.Callback());
   a_->reporterIDValid(42, valid.Callback());

@@ -188,6 +188,7 @@ void ReportingStoreWriter::Start() {
 // queue is full. Returns false when the record was not taken; a control record's
 // callback is then the caller's to run.
 bool ReportingStoreWriter::Push(Record&& record, bool control, std::int64_t* new_session_id) {
+  record.bytes = record.payload.ApproximateBytes();
   std::unique_lock lock(mu_);
   // Taken under the lock: session ids then follow the queue's order, which is the
   // commit order.
@@ -201,6 +202,7 @@ bool ReportingStoreWriter::Push(Record&& record, bool control, std::int64_t* new
   queue_.push_back(std::move(record));
   ++stats_.handed_over;
   backlog_.fetch_add(1, std::memory_order_relaxed);
+  backlog_bytes_.fetch_add(queue_.back().bytes, std::memory_order_relaxed);
   const bool wake = writer_idle_ || (gathering_ && queue_.size() == kGatherRecords);
   writer_idle_ = false;
   lock.unlock();
@@ -301,6 +303,8 @@ void ReportingStoreWriter::Run() {
     const std::uint64_t count = batch.size();
     const auto failed = static_cast<std::uint64_t>(
         std::count_if(batch.begin(), batch.end(), [](const Record& r) { return r.failed; }));
+    std::uint64_t bytes = 0;
+    for (const Record& r : batch) bytes += r.bytes;
     batch.clear();
     if (batch.capacity() > kKeptQueueCapacity) batch.shrink_to_fit();
     {
@@ -311,6 +315,7 @@ void ReportingStoreWriter::Run() {
       written_ = batch_end;
     }
     backlog_.fetch_sub(count, std::memory_order_relaxed);
+    backlog_bytes_.fetch_sub(bytes, std::memory_order_relaxed);
     std::function<void()> after_batch;
     {
       std::lock_guard lock(mu_);

@@ -62,6 +62,7 @@ struct Record {
   bool failed = false;  // set by the writer when the record could not be written
   double time = 0;
   Value payload;
+  std::size_t bytes = 0;  // the payload's approximate size, counted in backlog_bytes_
   std::unique_ptr<RecordExtra> extra;
 };
 
@@ -101,6 +102,7 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   ReportingStore::Stats stats() const;
 
   std::uint64_t backlog() const { return backlog_.load(std::memory_order_relaxed); }
+  std::uint64_t backlog_bytes() const { return backlog_bytes_.load(std::memory_order_relaxed); }
 
   void SetAfterBatch(std::function<void()> callback);
 
@@ -213,6 +215,8 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   bool gathering_ = false;                 // GUARDED_BY(mu_): the writer gathers a batch
   int drains_waiting_ = 0;                 // GUARDED_BY(mu_): Drain calls waiting
   std::atomic<std::uint64_t> backlog_{0};  // records handed over and not yet written
+  // The approximate bytes of the payloads handed over and not yet written.
+  std::atomic<std::uint64_t> backlog_bytes_{0};
 
   std::mutex thread_mu_;  // serialises join/detach of thread_
   std::thread thread_;
