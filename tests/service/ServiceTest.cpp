@@ -455,15 +455,19 @@ class BlockThrottleTest : public ::testing::Test {
   Throttle throttle_{log_, nullptr};
 };
 
-// Two same-key messages 0.2 s apart with a delay well above that (wide margin).
+// Two same-key messages 0.2 s apart with a delay well above that (wide margin); a duplicate
+// with a shorter delay brings the action forward.
 TEST_F(BlockThrottleTest, OnlyTheLastActionOfABurstRunsOnce) {
   std::atomic<int> first{0}, second{0}, other{0};
   std::promise<void> ran;
   const Dictionary message{{"a", 1}, {"_throttle_seconds", 1.5}};
   throttle_.addMessageBlock([&] { ++first; }, 1, message, 5, 1);
+  throttle_.addMessageBlock([&] { ++first; }, 4, Dictionary{{"_throttle_seconds", 4}}, 5, 1);
   std::this_thread::sleep_for(std::chrono::milliseconds(200));
   const auto second_added = std::chrono::steady_clock::now();
-  std::chrono::steady_clock::time_point second_ran;
+  std::chrono::steady_clock::time_point second_ran, shortened_ran;
+  throttle_.addMessageBlock([&] { shortened_ran = std::chrono::steady_clock::now(); }, 4,
+                            Dictionary{{"_throttle_seconds", 0}}, 5, 1);
   throttle_.addMessageBlock(
       [&] {
         second_ran = std::chrono::steady_clock::now();
@@ -479,6 +483,7 @@ TEST_F(BlockThrottleTest, OnlyTheLastActionOfABurstRunsOnce) {
   EXPECT_EQ(first, 0);
   EXPECT_EQ(second, 1);
   EXPECT_GE(second_ran - second_added, std::chrono::milliseconds(1450));  // the delay restarted
+  EXPECT_LT(shortened_ran - second_added, std::chrono::seconds(1));       // not at 4 s
   EXPECT_EQ(other, 1);
   EXPECT_EQ(
       log_->Count(
