@@ -258,10 +258,11 @@ std::string QNReportingBlockThrottle::buildMessageKey(const Dictionary& message,
   parts.push_back(QNReportingCategoryName(category));
   parts.push_back(QNReportingTypeName(type));
 
+  // Joined by position: an empty part (an empty payload key or value) keeps its place.
   std::string key;
-  for (const std::string& part : parts) {
-    if (!key.empty()) key += '|';
-    key += part;
+  for (std::size_t i = 0; i < parts.size(); ++i) {
+    if (i > 0) key += '|';
+    key += parts[i];
   }
   return key;
 }

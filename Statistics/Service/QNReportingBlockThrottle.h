@@ -90,7 +90,7 @@ class QNReportingBlockThrottle {
   // in code-point order, each followed by its printed value or "^" when the key is skipped
   // (the default skip list, the sender's "_comparison_field_blacklist" array, and Volume /
   // VolumeOperationTime when both are present), then "reporterID", the ID, and the names of
-  // the category and type, joined by "|".
+  // the category and type, joined by "|" by position (an empty part keeps its place).
   static std::string buildMessageKey(const Dictionary& message, std::int64_t reporterID,
                                      std::uint32_t category, std::uint16_t type);
 

@@ -404,6 +404,7 @@ TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValuesAndDuplicates) {
                                  1),
        "a|x|b|2|systemuptime_sec|^|reporterID|42|Setup|Start"},
       {Throttle::buildMessageKey(Dictionary{}, 7, 1, 0), "reporterID|7|Generic|Generic"},
+      {Key(Dictionary{{"", "x"}}), "|x|reporterID|1|Setup|Start"},  // "" sorts first
       // Code-point order: upper case, then "_", then lower case.
       {Key(Dictionary{{"b", 1}, {"_x", 2}, {"A", 3}}), "A|3|_x|2|b|1|reporterID|1|Setup|Start"},
       {Key(Dictionary{{"a", 1}, {"_comparison_field_blacklist", Array{Value("a")}}}),
@@ -423,7 +424,8 @@ TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValuesAndDuplicates) {
       {Key(Dictionary{{"x", 1}, {"processuptime_ms", 5}}), Key(Dictionary{{"x", 1}}), false},
       {Key(Dictionary{}, 1, 12), Key(Dictionary{}, 1, 13), true},  // both "Undefined"
       {Key(Dictionary{}, 1, 5, 6), Key(Dictionary{}, 1, 5, 65534), true},
-      {Key(Dictionary{}, 1), Key(Dictionary{}, 2), false}};
+      {Key(Dictionary{}, 1), Key(Dictionary{}, 2), false},
+      {Key(Dictionary{{"", ""}}), Key(Dictionary{}), false}};
   for (const auto& [x, y, same] : pairs) EXPECT_EQ(x == y, same) << x << " / " << y;
 }
 
