@@ -144,7 +144,7 @@ TEST_F(ServiceTest, StartStopAndDestroyOfZeroOrUnknownIDsReplyAtOnce) {
   EXPECT_TRUE(h_.env.trace->AllArgumentsZero());
 }
 
-TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionOfEveryClient) {
+TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionAListSkipsZero) {
   h_.Create(a_, 1, 2, true);
   h_.Create(a_, 2, 2);
   h_.Create(b_, 3, 7, true);
@@ -159,6 +159,14 @@ TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionOfEveryClient) {
   EXPECT_EQ(log_.Count(": sessions for client 100 : "), 1);
   EXPECT_EQ(log_.Count(": sessions for client 200 : "), 1);
   EXPECT_EQ(log_.Count(": active reporting sessions 2 : "), 1);
+
+  // A list skips 0 even where the caller owns a started session 0, and unknown IDs: nothing
+  // goes out, not even standalone.
+  h_.Create(a_, 0);
+  a_.Session(0)->start();
+  EXPECT_FALSE(h_.Send(a_, {{"k", "v"}}, 3, 1, std::vector<std::int64_t>{0, 99}));
+  EXPECT_EQ(livo_.AllSessionMessages().size(), 2u);
+  EXPECT_TRUE(livo_.SingleMessages().empty());
 }
 
 TEST_F(ServiceTest, GetAllReportersListsClientByClientInMapOrder) {
