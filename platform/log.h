@@ -69,13 +69,14 @@ constexpr bool IsNamespace(std::string_view component) {
          (component[0] >= 'a' && component[0] <= 'z');
 }
 
-// Writes to `out` (when not null) the name by which a reader calls the function that a
-// __PRETTY_FUNCTION__ text describes, and returns its length: "Class::method" for a member,
-// the bare name for a free function. Return type, namespaces, template arguments and
-// parameters are left out; in a lambda's text the outermost function, the one that made the
-// lambda, is named. A text that names no function (a lambda outside any) is kept whole.
-// Both GCC's and Clang's forms are read.
-constexpr std::size_t ReadableFunctionName(std::string_view pretty, char* out) {
+// Hands to `put`, piece by piece, the name by which a reader calls the function that a
+// __PRETTY_FUNCTION__ text describes: "Class::method" for a member, the bare name for a free
+// function. Return type, namespaces, template arguments and parameters are left out; in a
+// lambda's text the outermost function, the one that made the lambda, is named. A text that
+// names no function (a lambda outside any) is kept whole. Both GCC's and Clang's forms are
+// read.
+template <typename Put>
+constexpr void ReadableFunctionName(std::string_view pretty, Put put) {
   // The outermost function's qualified name ends at the first '(' outside template
   // arguments, not counting "(anonymous namespace)" and an operator's own symbol.
   std::size_t begin = 0;
@@ -101,22 +102,17 @@ constexpr std::size_t ReadableFunctionName(std::string_view pretty, char* out) {
     }
   }
   if (end == std::string_view::npos) {
-    if (out) pretty.copy(out, pretty.size());
-    return pretty.size();
+    put(pretty);
+    return;
   }
 
   // Its components, namespaces dropped from the front, template arguments left out.
   const std::string_view name = pretty.substr(begin, end - begin);
-  std::size_t length = 0;
-  auto put = [&](std::string_view part) {
-    if (out) part.copy(out + length, part.size());
-    length += part.size();
-  };
-  bool leading = true;
+  bool first = true;  // nothing put yet: namespaces are still dropped
   std::size_t start = 0;
   while (start <= name.size()) {
     if (At(name, start, "operator")) {  // always the last component
-      if (length > 0) put("::");
+      if (!first) put("::");
       put(name.substr(start));
       break;
     }
@@ -134,22 +130,32 @@ constexpr std::size_t ReadableFunctionName(std::string_view pretty, char* out) {
     }
     const std::string_view component = name.substr(start, stop - start);
     const bool last = stop >= name.size();
-    if (!(leading && !last && IsNamespace(component))) {
-      leading = false;
-      if (length > 0) put("::");
+    if (!(first && !last && IsNamespace(component))) {
+      if (!first) put("::");
+      first = false;
       put(component.substr(0, component.find('<')));
     }
     start = stop + 2;
   }
-  if (out) out[length] = '\0';
+}
+
+constexpr std::size_t ReadableFunctionNameLength(std::string_view pretty) {
+  std::size_t length = 0;
+  ReadableFunctionName(pretty, [&](std::string_view part) { length += part.size(); });
   return length;
 }
 
 // A function's readable name, made at compile time from its __PRETTY_FUNCTION__.
+// REQUIRES: N is ReadableFunctionNameLength(pretty) + 1.
 template <std::size_t N>
 struct FunctionName {
   char text[N] = {};
-  constexpr explicit FunctionName(std::string_view pretty) { ReadableFunctionName(pretty, text); }
+  constexpr explicit FunctionName(std::string_view pretty) {
+    std::size_t length = 0;
+    ReadableFunctionName(pretty, [&](std::string_view part) {
+      for (char c : part) text[length++] = c;
+    });
+  }
 };
 
 template <typename... Args>
@@ -174,7 +180,7 @@ void Emit(Log& log, const LogScope* scope, LogLevel level, const char* file, int
   do {                                                                                  \
     static constexpr std::string_view qn_pretty_ = __PRETTY_FUNCTION__;                 \
     static constexpr ::qn::log_detail::FunctionName<                                    \
-        ::qn::log_detail::ReadableFunctionName(qn_pretty_, nullptr) + 1>                \
+        ::qn::log_detail::ReadableFunctionNameLength(qn_pretty_) + 1>                   \
         qn_function_{qn_pretty_};                                                       \
     QN_LOG_AS(qn_function_.text, log, scope, level, format __VA_OPT__(, ) __VA_ARGS__); \
   } while (0)
