@@ -5,6 +5,8 @@
 #include <exception>
 #include <utility>
 
+#include <asio/post.hpp>
+
 #include "Statistics/QNReportingUtility.h"
 
 namespace qn {
@@ -130,6 +132,19 @@ void QNReportingBlockThrottle::schedule(const std::string& key,
   });
 }
 
+void QNReportingBlockThrottle::rearm(const std::string& key) {
+  std::shared_ptr<Wrapper> wrapper;
+  {
+    std::lock_guard lock(timersInFlightLock_);
+    auto found = timersInFlight_.find(key);
+    if (found != timersInFlight_.end()) wrapper = found->second;
+  }
+  // A wrapper not yet scheduled gets its date when it is. A wait that has completed already
+  // (nothing to cancel) has its fire queued, which reads the date itself.
+  if (!wrapper || !wrapper->timer_ || wrapper->timer_->expiry() <= wrapper->fireDate()) return;
+  if (wrapper->timer_->cancel() > 0) schedule(key, wrapper);
+}
+
 void QNReportingBlockThrottle::fire(const std::string& key,
                                     const std::shared_ptr<Wrapper>& wrapper) {
   // A duplicate moved the date while the timer waited: wait again, until the new date.
@@ -173,8 +188,11 @@ void QNReportingBlockThrottle::addMessageBlock(Block block, std::int64_t reporte
   }
   if (existing) {
     THROTTLE_LOG(LogLevel::kDebug, "%s:%d:%s: Dropping duplicate message for %@", key);
+    const auto before = existing->fireDate();
     existing->sleepFor(delay);
     existing->setBlock(std::move(block));
+    // A later date is met when the timer fires; an earlier one needs the timer moved.
+    if (existing->fireDate() < before) asio::post(workingRunLoop_, [this, key] { rearm(key); });
     return;
   }
 
@@ -240,10 +258,11 @@ std::string QNReportingBlockThrottle::buildMessageKey(const Dictionary& message,
   parts.push_back(QNReportingCategoryName(category));
   parts.push_back(QNReportingTypeName(type));
 
+  // Joined by position: an empty part (an empty payload key or value) keeps its place.
   std::string key;
-  for (const std::string& part : parts) {
-    if (!key.empty()) key += '|';
-    key += part;
+  for (std::size_t i = 0; i < parts.size(); ++i) {
+    if (i > 0) key += '|';
+    key += parts[i];
   }
   return key;
 }

@@ -22,8 +22,9 @@ class QNReportingBlockThrottle;
 
 // One pending action of the throttle and the one-shot timer that will run it.
 // `block` may be read and replaced from any thread; the timer's fire date likewise (it is
-// only a date until the throttle's thread schedules the timer, and that thread re-reads it
-// whenever the timer fires, so a moved date is honoured).
+// only a date until the throttle's thread schedules the timer; after that the thread
+// re-reads it whenever the timer fires, and the throttle moves the timer when a duplicate
+// brings the date forward).
 class QNReportingBlockThrottleTimerWrapper {
  public:
   using Block = std::function<void()>;
@@ -69,9 +70,10 @@ class QNReportingBlockThrottle {
   QNReportingBlockThrottle& operator=(const QNReportingBlockThrottle&) = delete;
 
   // Runs `block` after the message's throttle time unless a duplicate of the message comes
-  // first (which then replaces the block and restarts the delay). An action that throws
-  // still has its entry removed; the exception is logged at error level on the throttle's
-  // thread, which goes on.
+  // first (which then replaces the block and restarts the delay: the action is due at the
+  // duplicate's time plus the duplicate's own throttle time, earlier or later than before). An
+  // action that throws still has its entry removed; the exception is logged at error level on the
+  // throttle's thread, which goes on.
   void addMessageBlock(Block block, std::int64_t reporterID, const Dictionary& message,
                        std::uint32_t category, std::uint16_t type);
 
@@ -88,7 +90,7 @@ class QNReportingBlockThrottle {
   // in code-point order, each followed by its printed value or "^" when the key is skipped
   // (the default skip list, the sender's "_comparison_field_blacklist" array, and Volume /
   // VolumeOperationTime when both are present), then "reporterID", the ID, and the names of
-  // the category and type, joined by "|".
+  // the category and type, joined by "|" by position (an empty part keeps its place).
   static std::string buildMessageKey(const Dictionary& message, std::int64_t reporterID,
                                      std::uint32_t category, std::uint16_t type);
 
@@ -109,6 +111,9 @@ class QNReportingBlockThrottle {
   void queueThreadBody();
   // Schedules the wrapper's timer on this thread's event loop. Queue thread only.
   void schedule(const std::string& key, const std::shared_ptr<Wrapper>& wrapper);
+  // A duplicate moved the date of `key` earlier: moves its scheduled timer there. Queue
+  // thread only.
+  void rearm(const std::string& key);
   // The timer of `key` fired: run its block unless its date moved, then drop the entry.
   void fire(const std::string& key, const std::shared_ptr<Wrapper>& wrapper);
 

@@ -36,6 +36,19 @@ Value DescribeSessions(const std::vector<std::shared_ptr<QNReportingSession>>& s
   return Value(std::move(items));
 }
 
+// Runs `then` on the server queue once every summary file that stops have queued so far is
+// renamed into place (at once when files are written inline), so that a client that has
+// its reply finds the file, and a killService: sent after the reply cannot lose it.
+void AfterSummaryFiles(const QNReportingServerContext& ctx, Task then) {
+  if (const auto& summaries = ctx.platform->summary_queue) {
+    summaries->Async([server = ctx.serverQueue, then = std::move(then)]() mutable {
+      server->Async(std::move(then));
+    });
+    return;
+  }
+  then();
+}
+
 }  // namespace
 
 // ---------------------------------------------------------------------------------------
@@ -362,6 +375,7 @@ void QNReportingServerInstance::stopReportingSessionForID(std::int64_t reporterI
       reply(true);
       return;
     }
+    QNReportingSession::TransactionCompleteBlock pending;
     if (auto session = self.findReportingSessionForID(reporterID, false)) {
       auto delegate = self.delegate_.lock();
       std::optional<Dictionary> stats;
@@ -383,22 +397,15 @@ void QNReportingServerInstance::stopReportingSessionForID(std::int64_t reporterI
       }
       session->setDriverSnapShot(nullptr);
       session->stop();
-      if (auto pending = session->transactionCompleteBlock()) {
-        pending(true);
-        session->setTransactionCompleteBlock(nullptr);
-      }
+      pending = session->transactionCompleteBlock();
+      session->setTransactionCompleteBlock(nullptr);
     }
     QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault, "%s:%d:%s: stopping %lli", reporterID);
-    // The summary file that the stop queued is renamed into place before the reply leaves,
-    // so a client that has its reply finds the file (and a killService: sent after the
-    // reply cannot lose it). The reply still goes out from the server queue.
-    if (const auto& summaries = ctx.platform->summary_queue) {
-      summaries->Async([server = ctx.serverQueue, reply = std::move(reply)]() mutable {
-        server->Async([reply = std::move(reply)] { reply(true); });
-      });
-      return;
-    }
-    reply(true);
+    // The summary file first, then the pending start reply, then this one.
+    AfterSummaryFiles(ctx, [pending = std::move(pending), reply = std::move(reply)] {
+      if (pending) pending(true);
+      reply(true);
+    });
   });
 }
 
@@ -419,7 +426,8 @@ void QNReportingServerInstance::destroyReportingSession(std::int64_t reporterID,
       Counters::Add(ctx.platform->counters->sessionsOpen, -1);
     }
     QN_LOG(ctx.log(), ctx.scope(), LogLevel::kDefault, "%s:%d:%s: destroying %lli", reporterID);
-    reply(true);
+    // The reply waits for the summary files queued so far, that of a session stopped here too.
+    AfterSummaryFiles(ctx, [reply = std::move(reply)] { reply(true); });
   });
 }
 

@@ -118,9 +118,11 @@ class QNReportingServerInstance final
   // Error code 1 in domain "com.norvel.audio.reporting" when reporting is disabled.
   void sendMessage(MessagePayload message, std::uint32_t category, std::uint16_t type,
                    std::optional<std::vector<std::int64_t>> reporterIDs, ErrorReply reply) override;
-  // The reply leaves after the summary queue (when the platform has one) has written the
-  // summary file that the stop queued.
+  // The session's pending start reply and then this reply leave after the summary queue
+  // (when the platform has one) has written the summary file that the stop queued.
   void stopReportingSessionForID(std::int64_t reporterID, BoolReply reply) override;
+  // Stops a started session (its pending start reply stays undelivered); the reply waits
+  // for the summary file as the stop's does.
   void destroyReportingSession(std::int64_t reporterID, BoolReply reply) override;
   void reporterIDValid(std::int64_t reporterID, DictionaryReply reply) override;
   void getAllReporters(ReporterIDsReply reply) override;

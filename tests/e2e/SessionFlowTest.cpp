@@ -6,6 +6,7 @@
 #include <algorithm>
 #include <filesystem>
 #include <fstream>
+#include <future>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -15,7 +16,9 @@
 namespace qn::e2e {
 namespace {
 
+using ::testing::Contains;
 using ::testing::ElementsAre;
+using ::testing::EndsWith;
 using ::testing::HasSubstr;
 using Table = ReportingStoreRow::Table;
 
@@ -68,11 +71,14 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
                 Value(Dictionary{{"HostApplicationDisplayID", "com.example.app"}}), 42),
             true);
   std::mutex mu;
-  std::vector<std::string> order;
-  client->startReportingSessionForID(42, [&](bool ok) {
-    std::lock_guard lock(mu);
-    order.push_back(ok ? "start YES" : "start NO");
-  });
+  std::vector<std::string> order;  // each reply with the summary files there when it came
+  auto record = [&](std::string reply) {
+    return [&, reply](bool ok) {
+      std::lock_guard lock(mu);
+      order.push_back(reply + (ok ? " YES " : " NO ") + std::to_string(NamesIn(summaries).size()));
+    };
+  };
+  client->startReportingSessionForID(42, record("start"));
   EXPECT_TRUE(RepliedWithoutError(client->sendMessageSync(Value(Dictionary{{"route", "speaker"}}),
                                                           5, 1, std::vector<std::int64_t>{42})));
   EXPECT_TRUE(RepliedWithoutError(client->sendMessageSync(Value(Dictionary{{"two words", 1}}), 11,
@@ -82,14 +88,11 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
     EXPECT_TRUE(order.empty()) << "the start reply waits for the stop";
   }
   WriteCounter(counter, 25);
-  client->stopReportingSessionForID(42, [&](bool ok) {
-    std::lock_guard lock(mu);
-    order.push_back(ok ? "stop YES" : "stop NO");
-  });
+  client->stopReportingSessionForID(42, record("stop"));
   ASSERT_TRUE(client->WaitForReplies());
   {
     std::lock_guard lock(mu);
-    EXPECT_THAT(order, ElementsAre("start YES", "stop YES"));
+    EXPECT_THAT(order, ElementsAre("start YES 1", "stop YES 1"));
   }
   const auto files = NamesIn(summaries);
   ASSERT_EQ(files.size(), 1u);
@@ -144,8 +147,8 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   EXPECT_GE(Field(uptime_payload, "seconds")->as_double().value_or(-1), 0.0);
 }
 
-// killService: exit status 2; what the store was handed is kept, and so is the summary file of
-// the session stopped right before.
+// killService: exit status 2; what the store was handed is kept, and so are the summary files
+// of the sessions stopped and destroyed right before.
 TEST(LifecycleTest, KillServiceExitsTwoAndTheStoreKeepsAll) {
   Daemon daemon({"--internal-build"});
   ASSERT_TRUE(daemon.started());
@@ -158,6 +161,20 @@ TEST(LifecycleTest, KillServiceExitsTwoAndTheStoreKeepsAll) {
   const Value message(Dictionary{{"EngineOnTime", 2.5}, {"qnreporting_timestamp", 1700000000}});
   EXPECT_TRUE(RepliedWithoutError(killer->sendMessageSync(message, 5, 6, {{42}})));
   EXPECT_EQ(killer->stopReportingSessionForIDSync(42), true);
+  // A started session destroyed: its file is in place at the reply (its start reply never
+  // comes); without a host application the file is named "unknown".
+  const std::string summaries = daemon.home() + "/log/DiagnosticLogs/Audio/Reporting";
+  EXPECT_EQ(killer->createReportingSessionSync(43), true);
+  EXPECT_EQ(killer->setServiceTypeSync(0, 43), true);
+  killer->startReportingSessionForID(43, nullptr);
+  EXPECT_TRUE(
+      RepliedWithoutError(killer->sendMessageSync(Value(Dictionary{{"n", 1}}), 1, 0, {{43}})));
+  auto at_destroy = std::make_shared<std::promise<std::vector<std::string>>>();
+  auto files = at_destroy->get_future();
+  killer->destroyReportingSession(
+      43, [at_destroy, summaries](bool) { at_destroy->set_value(NamesIn(summaries)); });
+  ASSERT_EQ(files.wait_for(kPatience), std::future_status::ready);
+  EXPECT_THAT(files.get(), Contains(EndsWith("-quenta-unknown-generic.json")));
   // Both bridges hand their events to the store on the server queue. The reply to the last
   // message comes once every earlier one is handed over; the kill right after it must not
   // lose what the store has not written yet.
@@ -169,7 +186,7 @@ TEST(LifecycleTest, KillServiceExitsTwoAndTheStoreKeepsAll) {
   EXPECT_TRUE(RepliedWithoutError(killer->sendMessageSync(message, 5, 6, {{42}})));
   killer->killService();
   EXPECT_EQ(daemon.process().Wait(), Exited(2));
-  EXPECT_EQ(NamesIn(daemon.home() + "/log/DiagnosticLogs/Audio/Reporting").size(), 1u);
+  EXPECT_EQ(NamesIn(summaries).size(), 2u);
   EXPECT_TRUE(bystander->WaitUntilEnded());
   EXPECT_THAT(daemon.process().Stderr(), HasSubstr(": DESTROYING SERVICE"));
 

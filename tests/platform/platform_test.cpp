@@ -58,13 +58,31 @@ TEST(LinuxLogTest, StreamSinkWritesExactlyTheLine) {
   const int line = __LINE__ + 1;
   QN_LOG(*log, nullptr, LogLevel::kInfo, "%s:%d:%s: created reporting session for ID: %lli", 42);
   QN_LOG_AS("QNReportingUtilityWait", *log, nullptr, LogLevel::kError, "%s:%d:%s: %@", "odd  %s");
-  const std::string expected = std::string("platform_test.cpp:") + std::to_string(line) + ":" +
-                               "virtual void qn::{anonymous}::LinuxLogTest_"
-                               "StreamSinkWritesExactlyTheLine_Test::TestBody(): created "
-                               "reporting session for ID: 42\n" +
-                               "platform_test.cpp:" + std::to_string(line + 1) +
-                               ":QNReportingUtilityWait: odd  %s\n";
+  [&] { QN_LOG(*log, nullptr, LogLevel::kInfo, "%s:%d:%s: in a lambda"); }();
+  const std::string function = "LinuxLogTest_StreamSinkWritesExactlyTheLine_Test::TestBody";
+  const std::string expected =
+      "platform_test.cpp:" + std::to_string(line) + ":" + function +
+      ": created reporting session for ID: 42\nplatform_test.cpp:" + std::to_string(line + 1) +
+      ":QNReportingUtilityWait: odd  %s\nplatform_test.cpp:" + std::to_string(line + 2) + ":" +
+      function + ": in a lambda\n";
   EXPECT_EQ(file.Text(), expected);
+}
+
+// The function part of a line from either compiler's text of the function (this build
+// shows only its own compiler's forms).
+TEST(LinuxLogTest, FunctionPartNamesTheMethodThatMadeTheLine) {
+  const std::pair<std::string_view, std::string_view> rows[] = {
+      {"auto qn::QNReportingSession::writeSummaryJson()::(anonymous class)::operator()() const",
+       "QNReportingSession::writeSummaryJson"},
+      {"const char *qn::(anonymous namespace)::Name(std::map<int, int>)", "Name"},
+      {"void qn::Holder<int>::Run(W) [W = int]", "Holder::Run"},
+      {"bool qn::{anonymous}::Key::operator<(const qn::{anonymous}::Key&) const", "Key::operator<"},
+      {"qn::<lambda()>", "qn::<lambda()>"}};
+  for (const auto& [pretty, name] : rows) {
+    std::string out;
+    log_detail::ReadableFunctionName(pretty, [&](std::string_view part) { out += part; });
+    EXPECT_EQ(out, name) << pretty;
+  }
 }
 
 TEST(LinuxLogTest, DebugLinesOnlyForEnabledScopes) {

@@ -144,7 +144,7 @@ TEST_F(ServiceTest, StartStopAndDestroyOfZeroOrUnknownIDsReplyAtOnce) {
   EXPECT_TRUE(h_.env.trace->AllArgumentsZero());
 }
 
-TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionOfEveryClient) {
+TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionAListSkipsZero) {
   h_.Create(a_, 1, 2, true);
   h_.Create(a_, 2, 2);
   h_.Create(b_, 3, 7, true);
@@ -159,6 +159,14 @@ TEST_F(ServiceTest, BroadcastReachesEveryStartedSessionOfEveryClient) {
   EXPECT_EQ(log_.Count(": sessions for client 100 : "), 1);
   EXPECT_EQ(log_.Count(": sessions for client 200 : "), 1);
   EXPECT_EQ(log_.Count(": active reporting sessions 2 : "), 1);
+
+  // A list skips 0 even where the caller owns a started session 0, and unknown IDs: nothing
+  // goes out, not even standalone.
+  h_.Create(a_, 0);
+  a_.Session(0)->start();
+  EXPECT_FALSE(h_.Send(a_, {{"k", "v"}}, 3, 1, std::vector<std::int64_t>{0, 99}));
+  EXPECT_EQ(livo_.AllSessionMessages().size(), 2u);
+  EXPECT_TRUE(livo_.SingleMessages().empty());
 }
 
 TEST_F(ServiceTest, GetAllReportersListsClientByClientInMapOrder) {
@@ -404,6 +412,7 @@ TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValuesAndDuplicates) {
                                  1),
        "a|x|b|2|systemuptime_sec|^|reporterID|42|Setup|Start"},
       {Throttle::buildMessageKey(Dictionary{}, 7, 1, 0), "reporterID|7|Generic|Generic"},
+      {Key(Dictionary{{"", "x"}}), "|x|reporterID|1|Setup|Start"},  // "" sorts first
       // Code-point order: upper case, then "_", then lower case.
       {Key(Dictionary{{"b", 1}, {"_x", 2}, {"A", 3}}), "A|3|_x|2|b|1|reporterID|1|Setup|Start"},
       {Key(Dictionary{{"a", 1}, {"_comparison_field_blacklist", Array{Value("a")}}}),
@@ -423,7 +432,8 @@ TEST(MessageKeyTest, PartsInKeyOrderWithMaskedValuesAndDuplicates) {
       {Key(Dictionary{{"x", 1}, {"processuptime_ms", 5}}), Key(Dictionary{{"x", 1}}), false},
       {Key(Dictionary{}, 1, 12), Key(Dictionary{}, 1, 13), true},  // both "Undefined"
       {Key(Dictionary{}, 1, 5, 6), Key(Dictionary{}, 1, 5, 65534), true},
-      {Key(Dictionary{}, 1), Key(Dictionary{}, 2), false}};
+      {Key(Dictionary{}, 1), Key(Dictionary{}, 2), false},
+      {Key(Dictionary{{"", ""}}), Key(Dictionary{}), false}};
   for (const auto& [x, y, same] : pairs) EXPECT_EQ(x == y, same) << x << " / " << y;
 }
 
@@ -455,15 +465,19 @@ class BlockThrottleTest : public ::testing::Test {
   Throttle throttle_{log_, nullptr};
 };
 
-// Two same-key messages 0.2 s apart with a delay well above that (wide margin).
+// Two same-key messages 0.2 s apart with a delay well above that (wide margin); a duplicate
+// with a shorter delay brings the action forward.
 TEST_F(BlockThrottleTest, OnlyTheLastActionOfABurstRunsOnce) {
   std::atomic<int> first{0}, second{0}, other{0};
   std::promise<void> ran;
   const Dictionary message{{"a", 1}, {"_throttle_seconds", 1.5}};
   throttle_.addMessageBlock([&] { ++first; }, 1, message, 5, 1);
+  throttle_.addMessageBlock([&] { ++first; }, 4, Dictionary{{"_throttle_seconds", 4}}, 5, 1);
   std::this_thread::sleep_for(std::chrono::milliseconds(200));
   const auto second_added = std::chrono::steady_clock::now();
-  std::chrono::steady_clock::time_point second_ran;
+  std::chrono::steady_clock::time_point second_ran, shortened_ran;
+  throttle_.addMessageBlock([&] { shortened_ran = std::chrono::steady_clock::now(); }, 4,
+                            Dictionary{{"_throttle_seconds", 0}}, 5, 1);
   throttle_.addMessageBlock(
       [&] {
         second_ran = std::chrono::steady_clock::now();
@@ -479,6 +493,7 @@ TEST_F(BlockThrottleTest, OnlyTheLastActionOfABurstRunsOnce) {
   EXPECT_EQ(first, 0);
   EXPECT_EQ(second, 1);
   EXPECT_GE(second_ran - second_added, std::chrono::milliseconds(1450));  // the delay restarted
+  EXPECT_LT(shortened_ran - second_added, std::chrono::seconds(1));       // not at 4 s
   EXPECT_EQ(other, 1);
   EXPECT_EQ(
       log_->Count(
