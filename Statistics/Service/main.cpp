@@ -31,6 +31,8 @@
 #include "Statistics/Service/QNReportingSession.h"
 #include "common/Files.h"
 #include "common/Paths.h"
+#include "platform/linux/export/device_id.h"
+#include "platform/linux/export/nats_exporter.h"
 #include "platform/linux/linux_defaults.h"
 #include "platform/linux/linux_device_info.h"
 #include "platform/linux/linux_dispatch.h"
@@ -115,6 +117,7 @@ struct Options {
   std::optional<std::string> driver_stats;
   std::string debug_scopes;
   Limits limits;
+  NatsExportOptions export_nats;  // export is on when it names servers
 };
 
 // A CLI11 check that a value is not empty.
@@ -209,6 +212,68 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
         "Reply bytes a client may leave unread (not read from 1/8 on)");
   limit("--store-high-water", limits.store_high_water,
         "Messages waiting for the store before senders are held back");
+  // Export to NATS JetStream (docs/export.md). Each option may also come from the
+  // environment (QN_EXPORT_NATS, ...), e.g. the unit's environment file.
+  NatsExportOptions& exp = options.export_nats;
+  const auto token = [](const char* extra) {
+    return CLI::Validator(
+        [extra](std::string& text) {
+          std::string_view rest = text;
+          while (true) {
+            const std::string_view part = rest.substr(0, rest.find('.'));
+            if (!IsValidDeviceId(part) || (!*extra && part.size() != rest.size())) {
+              return std::string("needs letters, digits, '-' or '_'") + extra;
+            }
+            if (part.size() == rest.size()) return std::string();
+            rest.remove_prefix(part.size() + 1);
+          }
+        },
+        "");
+  };
+  CLI::Option* nats =
+      app.add_option("--export-nats", exp.servers, "Export the store to these NATS servers")
+          ->type_name("URL[,URL...]")
+          ->delimiter(',')
+          ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll)
+          ->envname("QN_EXPORT_NATS")
+          ->check(kNotEmpty)
+          ->group("Export");
+  const auto export_option = [&](const char* name, std::string& value, const char* what,
+                                 const char* env, const char* type) {
+    return app.add_option(name, value, what)
+        ->type_name(type)
+        ->envname(env)
+        ->needs(nats)
+        ->group("Export");
+  };
+  export_option("--export-subject", exp.subject_prefix, "Subjects PREFIX.<device>.<kind>",
+                "QN_EXPORT_SUBJECT", "PREFIX")
+      ->default_str(exp.subject_prefix)
+      ->check(token(" (dot-separated)"));
+  export_option("--export-stream", exp.stream, "The JetStream stream", "QN_EXPORT_STREAM", "NAME")
+      ->default_str(exp.stream)
+      ->check(token(""));
+  app.add_flag("--export-create-stream", exp.create_stream, "Create the stream when missing")
+      ->envname("QN_EXPORT_CREATE_STREAM")
+      ->needs(nats)
+      ->group("Export");
+  app.add_option("--export-replicas", exp.replicas, "Replicas of a stream it creates")
+      ->type_name("N")
+      ->default_val(1)
+      ->check(CLI::Range(1, 5))
+      ->envname("QN_EXPORT_REPLICAS")
+      ->needs(nats)
+      ->group("Export");
+  export_option("--export-creds", exp.creds_file, "NATS credentials file", "QN_EXPORT_CREDS",
+                "FILE");
+  export_option("--export-tls-ca", exp.tls_ca, "CA certificates for TLS", "QN_EXPORT_TLS_CA",
+                "FILE");
+  export_option("--export-tls-cert", exp.tls_cert, "Client certificate for TLS",
+                "QN_EXPORT_TLS_CERT", "FILE");
+  export_option("--export-tls-key", exp.tls_key, "Client key for TLS", "QN_EXPORT_TLS_KEY", "FILE");
+  export_option("--device-id", exp.device, "This device's ID (default: from the machine ID)",
+                "QN_DEVICE_ID", "ID")
+      ->check(token(""));
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -230,8 +295,9 @@ sigset_t HandledSignals() {
   return set;
 }
 
-// The counters and the store's figures, as the stats file shows them.
-Dictionary StatsOf(const Counters& counters, const ReportingStore& store) {
+// The counters, the store's figures and the exporter's, as the stats file shows them.
+Dictionary StatsOf(const Counters& counters, const ReportingStore& store,
+                   const NatsExporter* exporter) {
   Dictionary stats = counters.Snapshot();
   const ReportingStore::Stats figures = store.stats();
   stats.Set("store", Value(Dictionary{{"committed", Value(figures.committed)},
@@ -239,6 +305,7 @@ Dictionary StatsOf(const Counters& counters, const ReportingStore& store) {
                                       {"dropped_queue_full", Value(figures.dropped_queue_full)},
                                       {"lag", Value(store.Backlog())},
                                       {"batches", Value(figures.batches)}}));
+  if (exporter) stats.Set("export", Value(exporter->Stats()));
   return stats;
 }
 
@@ -292,6 +359,24 @@ int Run(const Options& options) {
     std::fprintf(stderr, "%s: cannot open the reporting store %s: %s\n", kProgram,
                  store_path.c_str(), store_error ? store_error->Description().c_str() : "");
     return 1;
+  }
+
+  // The exporter, when configured; it starts before any client can write.
+  std::shared_ptr<NatsExporter> exporter;
+  if (!options.export_nats.servers.empty()) {
+    NatsExportOptions export_options = options.export_nats;
+    export_options.db_path = store_path;
+    Error error;
+    std::optional<std::string> device = export_options.device.empty()
+                                            ? ExportDeviceId(paths.state_dir, &error)
+                                            : std::optional(export_options.device);
+    if (device) {
+      export_options.device = *device;
+      exporter = NatsExporter::Start(std::move(export_options), log);
+    } else {
+      QN_LOG(*log, nullptr, LogLevel::kError, "%s:%d:%s: export: no device ID (%s); not exporting",
+             error.Description().c_str());
+    }
   }
 
   auto platform = std::make_shared<Platform>();
@@ -360,20 +445,24 @@ int Run(const Options& options) {
     return 1;
   }
   std::shared_ptr<IpcListener> listener = listening.listener;
-  store->SetAfterBatch(listening.wake_message_intake);
+  store->SetAfterBatch(
+      [wake = listening.wake_message_intake, exporting = std::weak_ptr<NatsExporter>(exporter)] {
+        wake();
+        if (auto open = exporting.lock()) open->Wake();
+      });
   listener->SetDelegate(delegate);
 
   // The one thread that takes the handled signals (blocked everywhere else).
   std::shared_ptr<Notify> notify = platform->notify;
   auto stats = std::make_shared<LinuxStatsPublisher>(paths.runtime_dir + "/" + kStatsFileName);
-  std::thread signals([listener, notify, log, stats, counters, store] {
+  std::thread signals([listener, notify, log, stats, counters, store, exporter] {
     const sigset_t set = HandledSignals();
     for (;;) {
       // Between signals, once a second, the counters are published.
       const timespec second{1, 0};
       const int signal = sigtimedwait(&set, nullptr, &second);
       if (signal < 0) {
-        if (errno == EAGAIN) stats->Publish(StatsOf(*counters, *store));
+        if (errno == EAGAIN) stats->Publish(StatsOf(*counters, *store, exporter.get()));
         continue;
       }
       if (signal == SIGHUP) {
@@ -415,6 +504,7 @@ int Run(const Options& options) {
   // it is never destroyed from one of its own tasks.
   std::shared_ptr<Dispatcher> dispatcher = platform->dispatcher;
   store->SetAfterBatch(nullptr);
+  if (exporter) exporter->Stop();
   listener.reset();
   delegate.reset();
   platform.reset();
