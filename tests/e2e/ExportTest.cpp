@@ -149,8 +149,8 @@ TEST(ExportTest, ClusterFaultsLoseAndDuplicateNothing) {
   auto daemon = StartOn(home, args);
   ASSERT_TRUE(daemon->started());
 
+  // Each fault comes right after a burst of rows, while they are being exported.
   SendMessages(*daemon, 20'000);
-  ASSERT_TRUE(daemon->WaitForStat({"export", "acknowledged"}, 2'000));
   int leader = -1;
   ASSERT_TRUE(Eventually([&] { return (leader = nats.Leader("QUENTA")) >= 0; }));
   nats.Kill(leader);
@@ -161,11 +161,13 @@ TEST(ExportTest, ClusterFaultsLoseAndDuplicateNothing) {
   ASSERT_EQ(daemon->process().Wait(), (ExitStatus{false, SIGKILL}));
   daemon = StartOn(home, args);
   ASSERT_TRUE(daemon->started());
+  ASSERT_TRUE(daemon->WaitForStat({"export", "acknowledged"}, 1));  // exporting again
 
-  SendMessages(*daemon, 15'000);
   nats.Pause(0, true);
   nats.Pause(1, true);
-  std::this_thread::sleep_for(std::chrono::seconds(4));  // without quorum for a while
+  SendMessages(*daemon, 15'000);
+  // Without quorum for longer than a publish waits for its acknowledgement.
+  std::this_thread::sleep_for(std::chrono::seconds(7));
   nats.Pause(0, false);
   nats.Pause(1, false);
 
@@ -181,6 +183,7 @@ TEST(ExportTest, ClusterFaultsLoseAndDuplicateNothing) {
   for (const auto& message : messages) ids.insert(message.msg_id);
   EXPECT_EQ(static_cast<std::int64_t>(ids.size()), rows);
   EXPECT_EQ(static_cast<std::int64_t>(messages.size()), rows);
+  EXPECT_GT(ExportStat(*daemon, "resends"), 0) << "the lost quorum went unnoticed";
 }
 
 // No server at the URL at start-up, a server that comes later, a stream that is missing:

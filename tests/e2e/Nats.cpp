@@ -153,9 +153,16 @@ std::vector<StreamMessage> ReadStream(const std::string& urls, const std::string
   jsSubOptions_Init(&options);
   options.Stream = stream.c_str();
   options.Ordered = true;
-  if (natsConnection_ConnectTo(&nc, urls.c_str()) == NATS_OK &&
-      natsConnection_JetStream(&js, nc, nullptr) == NATS_OK &&
-      js_SubscribeSync(&sub, js, "quenta.>", nullptr, &options, nullptr) == NATS_OK) {
+  // Making the consumer fails while the cluster still elects leaders.
+  if (Eventually([&] {
+        natsSubscription_Destroy(sub);
+        jsCtx_Destroy(js);
+        natsConnection_Destroy(nc);
+        sub = nullptr, js = nullptr, nc = nullptr;
+        return natsConnection_ConnectTo(&nc, urls.c_str()) == NATS_OK &&
+               natsConnection_JetStream(&js, nc, nullptr) == NATS_OK &&
+               js_SubscribeSync(&sub, js, "quenta.>", nullptr, &options, nullptr) == NATS_OK;
+      })) {
     const auto deadline = std::chrono::steady_clock::now() + kPatience;
     while (messages.size() < expected && std::chrono::steady_clock::now() < deadline) {
       natsMsg* msg = nullptr;

@@ -152,8 +152,13 @@ void NatsExporter::SetState(const std::string& state, const std::string& line, b
   });
   if (line == last_state_) return;
   last_state_ = line;
-  QN_LOG(*log_, nullptr, error ? LogLevel::kError : LogLevel::kDefault, "%s:%d:%s: export: %s",
-         line.c_str());
+  Say(error, line);
+}
+
+void NatsExporter::Say(bool error, const std::string& line) {
+  if (!log_) return;
+  QN_LOG_AS("NatsExporter", *log_, nullptr, error ? LogLevel::kError : LogLevel::kDefault,
+            "%s:%d:%s: export: %s", line.c_str());
 }
 
 bool NatsExporter::OpenSource() {
@@ -341,9 +346,8 @@ bool NatsExporter::CheckStream() {
              true);
     return false;
   }
-  QN_LOG(*log_, nullptr, LogLevel::kDefault,
-         "%s:%d:%s: export: created stream %s (%s, %d replicas)", options_.stream.c_str(),
-         subjects.c_str(), options_.replicas);
+  Say(false, "created stream " + options_.stream + " (" + subjects + ", " +
+                 std::to_string(options_.replicas) + " replicas)");
   return true;
 }
 
@@ -401,8 +405,7 @@ void NatsExporter::Failed(const std::string& error) {
   });
   if (!failing_) {
     failing_ = true;
-    QN_LOG(*log_, nullptr, LogLevel::kError,
-           "%s:%d:%s: export: publishing failed (%s); sending again with back-off", error.c_str());
+    Say(true, "publishing failed (" + error + "); sending again with back-off");
   }
 }
 
@@ -453,7 +456,7 @@ void NatsExporter::HandleEvents(std::vector<Event>& events) {
     backoff_ = options_.backoff_min;
     if (failing_) {
       failing_ = false;
-      QN_LOG(*log_, nullptr, LogLevel::kDefault, "%s:%d:%s: export: publishing again");
+      Say(false, "publishing again");
     }
     Update([&](Figures& f) {
       f.acknowledged += acknowledged;

@@ -65,7 +65,7 @@ struct NatsExportOptions {
 // back-off and shows the reason in Stats. Credentials never appear in a log line or Stats.
 class NatsExporter {
  public:
-  // Starts the thread. Nothing else happens on the caller's thread.
+  // Starts the thread. Nothing else happens on the caller's thread. `log` may be null.
   static std::shared_ptr<NatsExporter> Start(NatsExportOptions options, std::shared_ptr<Log> log);
   // Stops (see Stop).
   ~NatsExporter();
@@ -138,6 +138,8 @@ class NatsExporter {
   void RefreshLag();
   Entry* Find(ExportKind kind, std::int64_t id);
   void Failed(const std::string& error);
+  // Logs "export: <line>" (nothing without a log).
+  void Say(bool error, const std::string& line);
   // Records `state` and logs it when it differs from the last one.
   void SetState(const std::string& state, const std::string& line, bool error);
   template <typename F>
