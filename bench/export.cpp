@@ -46,7 +46,7 @@ void Fail(const char* what, natsStatus s) {
   std::exit(1);
 }
 
-// A store of `rows` single messages (the sample payload) with a table of cursors.
+// A store of `rows` single messages (the sample payload).
 std::string MakeStore(const Args& args) {
   const std::string path = args.dir + "/bench-export.db";
   for (const char* suffix : {"", "-wal", "-shm"}) ::unlink((path + suffix).c_str());
@@ -58,13 +58,6 @@ std::string MakeStore(const Args& args) {
                             SamplePayload());
   }
   store->Close();
-  sqlite3* db = nullptr;
-  sqlite3_open(path.c_str(), &db);
-  sqlite3_exec(db,
-               "CREATE TABLE IF NOT EXISTS export_cursors(exporter TEXT NOT NULL, kind TEXT NOT "
-               "NULL, last_id INTEGER NOT NULL, PRIMARY KEY(exporter, kind))",
-               nullptr, nullptr, nullptr);
-  sqlite3_close(db);
   return path;
 }
 

@@ -45,6 +45,7 @@
 #include "platform/linux/linux_stats.h"
 #include "platform/linux/linux_trace.h"
 #include "platform/linux/reporting_store.h"
+#include "platform/linux/store/retention.h"
 #include "platform/linux/store_sinks.h"
 #include "platform/platform.h"
 
@@ -117,6 +118,7 @@ struct Options {
   std::optional<std::string> driver_stats;
   std::string debug_scopes;
   Limits limits;
+  ReportingStore::Options store;  // its retention: --store-max-bytes, --store-max-age
   NatsExportOptions export_nats;  // export is on when it names servers
 };
 
@@ -212,6 +214,37 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
         "Reply bytes a client may leave unread (not read from 1/8 on)");
   limit("--store-high-water", limits.store_high_water,
         "Messages waiting for the store before senders are held back");
+  // The store's retention, in journald's forms: a size (K, M, G, T) and a duration.
+  const CLI::Validator byte_size(
+      [](std::string& text) {
+        return store::ParseByteSize(text) ? std::string() : "needs a size such as 512M or 4G";
+      },
+      "");
+  const CLI::Validator duration(
+      [](std::string& text) {
+        return store::ParseDuration(text) ? std::string() : "needs a duration such as 30d or 12h";
+      },
+      "");
+  app.add_option_function<std::string>(
+         "--store-max-bytes",
+         [&options](const std::string& text) {
+           options.store.max_bytes = store::ParseByteSize(text);
+         },
+         "Largest size of the store's file, oldest rows removed beyond it (0: no limit)")
+      ->type_name("SIZE")
+      ->default_str("10% of its file system, at most 4G")
+      ->check(byte_size)
+      ->group("Limits");
+  app.add_option_function<std::string>(
+         "--store-max-age",
+         [&options](const std::string& text) {
+           options.store.max_age_seconds = store::ParseDuration(text).value_or(0);
+         },
+         "Rows older than this are removed (exported ones only)")
+      ->type_name("DURATION")
+      ->default_str("off")
+      ->check(duration)
+      ->group("Limits");
   // Export to NATS JetStream (docs/export.md). Each option may also come from the
   // environment (QN_EXPORT_NATS, ...), e.g. the unit's environment file.
   NatsExportOptions& exp = options.export_nats;
@@ -300,11 +333,21 @@ Dictionary StatsOf(const Counters& counters, const ReportingStore& store,
                    const NatsExporter* exporter) {
   Dictionary stats = counters.Snapshot();
   const ReportingStore::Stats figures = store.stats();
-  stats.Set("store", Value(Dictionary{{"committed", Value(figures.committed)},
-                                      {"failed", Value(figures.failed)},
-                                      {"dropped_queue_full", Value(figures.dropped_queue_full)},
-                                      {"lag", Value(store.Backlog())},
-                                      {"batches", Value(figures.batches)}}));
+  Dictionary store_stats{{"committed", Value(figures.committed)},
+                         {"failed", Value(figures.failed)},
+                         {"dropped_queue_full", Value(figures.dropped_queue_full)},
+                         {"lag", Value(store.Backlog())},
+                         {"batches", Value(figures.batches)},
+                         {"removed", Value(figures.retention_removed)},
+                         {"lost", Value(figures.retention_lost)},
+                         {"bytes_on_disk", Value(figures.bytes_on_disk)}};
+  if (figures.oldest_row_time) {  // in whole seconds
+    const auto now = std::chrono::system_clock::now().time_since_epoch();
+    store_stats.Set("oldest_row_age",
+                    Value(static_cast<std::int64_t>(std::chrono::duration<double>(now).count() -
+                                                    *figures.oldest_row_time)));
+  }
+  stats.Set("store", Value(std::move(store_stats)));
   if (exporter) stats.Set("export", Value(exporter->Stats()));
   return stats;
 }
@@ -354,7 +397,8 @@ int Run(const Options& options) {
 
   std::optional<Error> store_error;
   const std::string store_path = paths.state_dir + "/reports.db";
-  std::shared_ptr<ReportingStore> store = ReportingStore::Open(store_path, log, &store_error);
+  std::shared_ptr<ReportingStore> store =
+      ReportingStore::Open(store_path, log, options.store, &store_error);
   if (!store) {
     std::fprintf(stderr, "%s: cannot open the reporting store %s: %s\n", kProgram,
                  store_path.c_str(), store_error ? store_error->Description().c_str() : "");

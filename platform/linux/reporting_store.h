@@ -58,6 +58,11 @@ class ReportingStore {
     std::size_t max_queued_records = 1'000'000;
     // How long a write waits for a lock held by another connection before it fails.
     int busy_timeout_ms = 2000;
+    // Retention (see Retention): the database file's size limit in bytes; nullopt: 10% of
+    // its file system, at most 4 GiB; 0: none.
+    std::optional<std::uint64_t> max_bytes;
+    // Rows older than this many seconds are removed; 0: no age limit.
+    double max_age_seconds = 0;
   };
 
   // What the store has done so far.
@@ -66,7 +71,11 @@ class ReportingStore {
     std::uint64_t committed = 0;    // records in committed transactions
     std::uint64_t failed = 0;       // records that could not be written (see Failures)
     std::uint64_t dropped_queue_full = 0;
-    std::uint64_t batches = 0;  // transactions attempted
+    std::uint64_t batches = 0;              // transactions attempted
+    std::uint64_t retention_removed = 0;    // rows removed by retention
+    std::uint64_t retention_lost = 0;       // of them, rows no exporter had shipped yet
+    std::uint64_t bytes_on_disk = 0;        // of the database file, as of the last look
+    std::optional<double> oldest_row_time;  // wall-clock seconds; nullopt: no row
   };
 
   // Opens (creating when missing) the database at `path`, creates or checks its schema

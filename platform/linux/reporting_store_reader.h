@@ -16,22 +16,22 @@ namespace qn {
 // Read access to the reporting store's database, for the command-line tool
 // (`qnreport events [--sink reporting|analytics|powerlog] [--json]`).
 //
-// The database (schema version 1, PRAGMA user_version):
-//   livo_sessions(id INTEGER PRIMARY KEY, session_info TEXT, user_info TEXT,
-//                 created REAL, flushed REAL NULL)
+// What it reads (the views of schema version 2, platform/linux/store/schema.h; version 1
+// had tables of the same names and columns):
+//   livo_sessions(id, session_info TEXT, user_info TEXT, created REAL, flushed REAL NULL)
 //       one row per framework session; flushed is set by each flush of the session.
-//   livo_messages(id INTEGER PRIMARY KEY, session INTEGER NULL, category INTEGER,
-//                 type INTEGER, payload TEXT, session_info TEXT NULL, user_info TEXT NULL,
-//                 time REAL)
+//   livo_messages(id, session NULL, category, type, payload TEXT, session_info TEXT NULL,
+//                 user_info TEXT NULL, time REAL)
 //       session is the livo_sessions id of the message's session, NULL for a single
 //       message, which then carries its own session_info and user_info.
-//   analytics_events(id INTEGER PRIMARY KEY, name TEXT, payload TEXT, time REAL)
-//   powerlog_events(id INTEGER PRIMARY KEY, subsystem INTEGER, name TEXT, payload TEXT,
-//                   time REAL)
+//   analytics_events(id, name TEXT, payload TEXT, time REAL)
+//       an event that repeats a message is rebuilt from it: the message's payload with
+//       the event's HostApplicationDisplayID set.
+//   powerlog_events(id, subsystem, name TEXT, payload TEXT, time REAL)
 // Every TEXT column except names holds compact lenient JSON (ToJsonLenient in common/Json.h
 // says how values JSON cannot hold are written). Times are seconds since the Unix epoch,
-// taken when the record was handed to the store. Within a table, ids follow the order of
-// hand-over.
+// taken when the record was handed to the store. Within a view, ids follow the order of
+// hand-over and are never reused, also after retention removed rows.
 
 // The sinks whose rows the store keeps: "reporting" (livo_sessions and livo_messages),
 // "analytics", "powerlog".

@@ -2,7 +2,9 @@
 
 #include <gtest/gtest.h>
 
+#include <condition_variable>
 #include <memory>
+#include <mutex>
 #include <optional>
 #include <string>
 #include <vector>
@@ -13,6 +15,34 @@
 #include "tests/fakes/TempDir.h"
 
 namespace qn::testing {
+
+// Holds the writer thread inside a task until Release, so that a test can hand records
+// over while the writer is known to be busy, and knows what lands in the next batch.
+class WriterGate {
+ public:
+  // Queues the blocking task; returns once the writer is inside it.
+  void Close(ReportingStore& store) {
+    store.AfterWrite([this] {
+      std::unique_lock lock(mu_);
+      entered_ = true;
+      cv_.notify_all();
+      cv_.wait(lock, [this] { return open_; });
+    });
+    std::unique_lock lock(mu_);
+    cv_.wait(lock, [this] { return entered_; });
+  }
+  void Release() {
+    std::lock_guard lock(mu_);
+    open_ = true;
+    cv_.notify_all();
+  }
+
+ private:
+  mutable std::mutex mu_;
+  std::condition_variable cv_;
+  bool entered_ = false;
+  bool open_ = false;
+};
 
 // A reporting store in a fresh folder, its log captured.
 class StoreTest : public ::testing::Test {
