@@ -1,17 +1,20 @@
 // Ingest throughput of the reporting store, against what bare SQLite reaches on the same
 // disk with the same journal settings.
 //
-//   bench_store_ingest [MESSAGES] [DIR] [bare|store]
+//   bench_store_ingest [MESSAGES] [DIR] [bare|store|events]
 //
 // 1. Bare SQLite: MESSAGES rows of 200 bytes into a two-column table, one transaction per
 //    10,000 rows, one prepared statement, WAL, synchronous=NORMAL; once with SQLite's
 //    default page size and once with the store's 16 KiB pages.
 // 2. The store: MESSAGES messages with an 8-key payload handed over through the LivoReporting
 //    sink's SendMessage (one framework session), then Drain; the time runs from the first
-//    hand-over until everything is committed.
+//    hand-over until everything is committed. Then twice more with an analytics event
+//    handed over before each message: once as the daemon's analytics copy makes it (the
+//    store refers to the message instead of writing the payload again) and once as an
+//    event that repeats nothing (two rows and two JSON texts per message).
 // Prints the rates and the ratio of the store's to the better bare one. The database files go to a
 // fresh folder under DIR (default: the system's temporary folder) and are removed afterwards. A
-// last argument "bare" or "store" runs only that half (for profiling).
+// last argument "bare", "store" or "events" runs only that part (for profiling).
 #include <sqlite3.h>
 #include <sys/resource.h>
 #include <unistd.h>
@@ -109,8 +112,15 @@ qn::Value Payload(long n) {
   return qn::Value(std::move(d));
 }
 
+// What goes with each message besides its livo_messages row.
+enum class Events {
+  kNone,
+  kRepeat,  // its analytics event, as the daemon hands it over: the store refers to the message
+  kCopy,    // an analytics event that does not repeat it (two rows, two JSON texts)
+};
+
 // Messages per second through the LivoReporting sink, committed.
-double Store(const std::string& path, long messages) {
+double Store(const std::string& path, long messages, Events events) {
   std::optional<qn::Error> error;
   auto store = qn::ReportingStore::Open(path, nullptr, &error);
   if (!store) {
@@ -118,16 +128,30 @@ double Store(const std::string& path, long messages) {
     std::exit(1);
   }
   auto livo = qn::NewStoreLivoReporting(store);
+  auto analytics = qn::NewStoreAnalytics(store);
   auto session = livo->CreateSession(qn::Dictionary{{"SessionID", 1}}, qn::Dictionary{}, {});
   // Distinct payloads, built beforehand: the benchmark measures the store, not the
   // building of dictionaries.
   std::vector<qn::Value> payloads;
-  for (long i = 0; i < 1024; ++i) payloads.push_back(Payload(i));
+  std::vector<qn::Value> event_payloads;
+  for (long i = 0; i < 1024; ++i) {
+    payloads.push_back(Payload(i));
+    qn::Dictionary event = *payloads.back().as_dictionary();
+    // The daemon's copy sets the host in place; one that moves it last repeats nothing.
+    if (events == Events::kCopy) event.Erase(qn::Value("HostApplicationDisplayID"));
+    event.Set("HostApplicationDisplayID", "com.example.music.player");
+    event_payloads.push_back(qn::Value(std::move(event)));
+  }
   store->Drain();
 
   const auto start = Clock::now();
   const double cpu_start = CpuSeconds();
   for (long i = 0; i < messages; ++i) {
+    if (events != Events::kNone) {
+      analytics->SendEventLazy("com.norvel.quenta.Bench.Stop", [&event_payloads, i] {
+        return event_payloads[static_cast<std::size_t>(i) & 1023];
+      });
+    }
     session->SendMessage(5, 2, payloads[static_cast<std::size_t>(i) & 1023], nullptr);
   }
   const auto handed = Clock::now();
@@ -137,13 +161,16 @@ double Store(const std::string& path, long messages) {
 
   const auto stats = store->stats();
   const double elapsed = Seconds(end - start);
-  const double rate = static_cast<double>(stats.committed - 1) / elapsed;  // minus the session row
+  const double rate = static_cast<double>(messages) / elapsed;
+  const char* with = events == Events::kNone     ? ""
+                     : events == Events::kRepeat ? " and its analytics event (refers to it)"
+                                                 : " and an analytics event (a copy)";
   std::printf(
-      "store: %ld messages (8-key payload) via LivoReporting SendMessage, committed in %.3f s: "
-      "%.0f messages/s (CPU %.2f us/message, both threads)\n"
+      "store: %ld messages (8-key payload) via LivoReporting SendMessage%s, committed in %.3f "
+      "s: %.0f messages/s (CPU %.2f us/message, both threads)\n"
       "       hand-over alone %.3f s (%.0f/s); %llu transactions; %llu dropped (queue full); "
       "%llu failed\n",
-      messages, elapsed, rate, cpu / messages * 1e6, Seconds(handed - start),
+      messages, with, elapsed, rate, cpu / messages * 1e6, Seconds(handed - start),
       messages / Seconds(handed - start), static_cast<unsigned long long>(stats.batches),
       static_cast<unsigned long long>(stats.dropped_queue_full),
       static_cast<unsigned long long>(stats.failed));
@@ -166,11 +193,17 @@ int main(int argc, char** argv) {
   // Bare SQLite with its default pages and with the store's 16 KiB pages; the store is
   // compared with the better of the two.
   double bare = 0;
-  if (only != "store") {
+  if (only.empty() || only == "bare") {
     bare = BareSqlite((dir / "bare-default.db").string(), messages, 0);
     bare = std::max(bare, BareSqlite((dir / "bare-16k.db").string(), messages, 16384));
   }
-  const double store = only == "bare" ? 0 : Store((dir / "reports.db").string(), messages);
+  const double store = only == "bare" || only == "events"
+                           ? 0
+                           : Store((dir / "reports.db").string(), messages, Events::kNone);
+  if (only.empty() || only == "events") {
+    Store((dir / "repeat.db").string(), messages, Events::kRepeat);
+    Store((dir / "copy.db").string(), messages, Events::kCopy);
+  }
   if (only.empty()) {
     std::printf("ratio store/best bare: %.2f\n", store / bare);
     std::printf("targets: >= 250000 messages/s: %s; >= 0.5 of bare sqlite: %s\n",

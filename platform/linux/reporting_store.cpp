@@ -83,10 +83,11 @@ std::optional<Error> OpenDatabase(const std::string& path, const ReportingStore:
   int version = 0;
   if (auto e = store::CheckSchemaVersion(db.get(), path, &version)) return e;
   // Session ids are ours (NewSessionId): above every id in the table and every id it
-  // ever had (AUTOINCREMENT's sequence), so that none is reused.
+  // ever had (its sequence), so that none is reused.
   const char* max_id_sql =
-      version >= 2   ? "SELECT max(IFNULL((SELECT max(id) FROM store_sessions), 0), "
-                       "IFNULL((SELECT seq FROM sqlite_sequence WHERE name = 'store_sessions'), 0))"
+      version >= 2
+          ? "SELECT max(IFNULL((SELECT max(id) FROM store_sessions), 0), "
+            "IFNULL((SELECT last_id FROM store_sequences WHERE name = 'store_sessions'), 0))"
       : version == 1 ? "SELECT IFNULL(max(id), 0) FROM livo_sessions"
                      : "SELECT 0";
   std::int64_t max_id = 0;

@@ -17,8 +17,14 @@ class ReportingStoreWriter;
 
 // The embedded reporting store: an SQLite database (WAL journal) that keeps what the
 // framework sinks are handed (framework sessions and their messages, single messages,
-// analytics events, power-log events). Its schema is documented in
-// reporting_store_reader.h.
+// analytics events, power-log events). What readers see is documented in
+// reporting_store_reader.h; the layout behind it, its versions and their migration in
+// platform/linux/store/schema.h. An older file is migrated by the writer thread before
+// its first batch (records queue meanwhile); a newer one makes Open fail.
+//
+// Retention: past Options::max_bytes or Options::max_age_seconds the writer removes the
+// oldest rows between its transactions, in small steps, and the file shrinks (see
+// platform/linux/store/retention.h for what it keeps; Stats has its figures).
 //
 // Threads: one writer thread of the store owns the database connection. Every Add* call
 // only hands a record over through an in-memory queue and returns at once; it never

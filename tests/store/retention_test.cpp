@@ -106,6 +106,14 @@ TEST_F(RetentionTest, TheFileShrinksOldestFirstAndUnshippedRowsGoLast) {
   EXPECT_TRUE(Ids(db_path_, ReportingStoreRow::Table::kLivoSession).empty());
   EXPECT_LE(std::filesystem::file_size(db_path_), kMiB);
   EXPECT_EQ(log_->Count("removing the oldest rows, past the size limit"), 2);
+
+  // Ids go on where they were, also in the tables retention emptied.
+  auto store = OpenWithLimits(0);
+  EXPECT_EQ(store->NewSessionId(), 2);
+  store->AddSessionMessage(1, 1, 1, Value(1));
+  store->Drain();
+  EXPECT_EQ(Ids(db_path_, ReportingStoreRow::Table::kLivoMessage),
+            std::vector<std::int64_t>{10'001});
 }
 
 TEST_F(RetentionTest, TheAgeLimitRemovesShippedRowsAndKeepsSessionsWithMessages) {

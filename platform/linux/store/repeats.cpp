@@ -7,7 +7,7 @@
 namespace qn::store {
 namespace {
 
-constexpr std::size_t kRemembered = 8192;
+constexpr std::uint32_t kNone = UINT32_MAX;
 constexpr std::string_view kHostKey = "HostApplicationDisplayID";
 
 bool IsHostKey(const Value& key) {
@@ -53,25 +53,28 @@ bool SameJson(const Value& a, const Value& b) {
   }
 }
 
-// The index key of a payload: its size without the host entry and its first other key.
-// nullopt for payloads that are never linked (not a dictionary, a first key that is not a
-// string).
+// The index key of a payload: every entry but the host entry, in order (containers by
+// their size only, so that a key costs little however deep a payload is). nullopt for
+// payloads that are never linked (a key that is not a string).
 std::optional<std::uint64_t> KeyOf(const Dictionary& payload) {
-  std::size_t size = payload.size();
-  std::string_view first;
-  bool have_first = false;
-  for (const auto& [key, value] : payload) {
-    if (IsHostKey(key)) {
-      --size;
-      continue;
+  std::uint64_t key = 0xCBF29CE484222325ull;
+  for (const auto& [name, value] : payload) {
+    const std::string* text = name.as_string();
+    if (!text) return std::nullopt;
+    if (*text == kHostKey) continue;
+    std::uint64_t entry = std::hash<std::string_view>{}(*text);
+    if (const Array* array = value.as_array()) {
+      entry ^= array->size() * 0x9E3779B97F4A7C15ull + 1;
+    } else if (const Dictionary* dict = value.as_dictionary()) {
+      entry ^= dict->size() * 0x9E3779B97F4A7C15ull + 2;
+    } else if (const std::string* string = value.as_string()) {
+      entry ^= std::hash<std::string_view>{}(*string) * 0x9E3779B97F4A7C15ull;
+    } else {
+      entry ^= value.Hash() * 0x9E3779B97F4A7C15ull;
     }
-    if (!have_first) {
-      if (!key.is_string()) return std::nullopt;
-      first = *key.as_string();
-      have_first = true;
-    }
+    key = (key ^ entry) * 0x100000001B3ull + (key >> 29);
   }
-  return std::hash<std::string_view>{}(first) ^ (size * 0x9E3779B97F4A7C15ull);
+  return key;
 }
 
 // A host name that SQLite's json_set writes as the JSON writer does.
@@ -98,38 +101,57 @@ bool Repeats(const Dictionary& event, const Dictionary& message) {
 }  // namespace
 
 void RecentMessages::Add(std::int64_t id, const Value& payload) {
-  const Dictionary* dict = payload.as_dictionary();
-  if (!dict) return;
-  const auto key = KeyOf(*dict);
-  if (!key) return;
-  if (order_.size() >= kRemembered) {
-    index_.erase(order_.front());
-    order_.pop_front();
-  }
-  order_.push_back(index_.emplace(*key, std::pair{id, payload}));
+  if (payload.is_dictionary()) entries_.push_back(Entry{id, payload, std::nullopt});
 }
 
-std::optional<RecentMessages::Repeat> RecentMessages::Find(const Value& event_payload) const {
+void RecentMessages::Index() {
+  for (; indexed_ < entries_.size(); ++indexed_) {
+    Entry& entry = entries_[indexed_];
+    if (!entry.key && entry.linkable) {
+      entry.key = KeyOf(*entry.payload.as_dictionary());
+      entry.linkable = entry.key.has_value();
+    }
+    next_.push_back(kNone);
+    if (!entry.linkable) continue;
+    auto [head, fresh] = heads_.try_emplace(*entry.key, static_cast<std::uint32_t>(indexed_));
+    if (!fresh) {
+      next_.back() = head->second;
+      head->second = static_cast<std::uint32_t>(indexed_);
+    }
+  }
+}
+
+std::optional<RecentMessages::Repeat> RecentMessages::Find(const Value& event_payload) {
   const Dictionary* event = event_payload.as_dictionary();
-  if (!event) return std::nullopt;
+  if (!event || entries_.empty()) return std::nullopt;
   const Value* host = event->Find(kHostKey);
   if (!host || !host->is_string() || !PlainHost(*host->as_string())) return std::nullopt;
   const auto key = KeyOf(*event);
   if (!key) return std::nullopt;
-  auto [begin, end] = index_.equal_range(*key);
-  for (auto it = begin; it != end; ++it) {
-    if (Repeats(*event, *it->second.second.as_dictionary())) {
-      return Repeat{it->second.first, *host->as_string()};
+  Index();
+  const auto head = heads_.find(*key);
+  if (head == heads_.end()) return std::nullopt;
+  for (std::uint32_t i = head->second; i != kNone; i = next_[i]) {
+    if (Repeats(*event, *entries_[i].payload.as_dictionary())) {
+      return Repeat{entries_[i].id, *host->as_string()};
     }
   }
   return std::nullopt;
 }
 
-void RecentMessages::Forget(std::size_t mark) {
-  while (order_.size() > mark) {
-    index_.erase(order_.back());
-    order_.pop_back();
-  }
+void RecentMessages::Committed() {
+  entries_.erase(entries_.begin(), entries_.begin() + static_cast<std::ptrdiff_t>(previous_));
+  previous_ = entries_.size();
+  heads_.clear();
+  next_.clear();
+  indexed_ = 0;
+}
+
+void RecentMessages::RolledBack() {
+  entries_.resize(previous_);
+  heads_.clear();
+  next_.clear();
+  indexed_ = 0;
 }
 
 }  // namespace qn::store

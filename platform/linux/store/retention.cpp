@@ -29,7 +29,8 @@ struct KindSql {
 
 constexpr KindSql kKindSql[] = {
     {"sessions", "store_sessions", "created",
-     "NOT EXISTS (SELECT 1 FROM store_messages m WHERE m.session = t.id)"},
+     "(t.last_message IS NULL OR t.last_message < "
+     "(SELECT IFNULL(min(id), 9223372036854775807) FROM store_messages))"},
     {"messages", "store_messages", "time",
      "NOT EXISTS (SELECT 1 FROM store_analytics a WHERE a.message = t.id AND a.id > ?3)"},
     {"analytics", "store_analytics", "time", "1"},

@@ -49,8 +49,8 @@ CREATE TABLE powerlog_events(
               "create the version 1 tables");
 }
 
-// Version 2: AUTOINCREMENT tables under new names, an analytics event that repeats a
-// message refers to it, views with the old names and shapes, and the exporters' cursors.
+// Version 2: tables under new names whose ids come from store_sequences, an analytics event that
+// repeats a message refers to it, views with the old names and shapes, and the exporters' cursors.
 // Every old row moves with its id; old analytics rows keep their own payload.
 std::optional<Error> MigrateToVersion2(sqlite3* db, std::string* done) {
   std::int64_t counts[4] = {0, 0, 0, 0};
@@ -62,14 +62,15 @@ std::optional<Error> MigrateToVersion2(sqlite3* db, std::string* done) {
   }
   if (auto e = Exec(db, R"sql(
 CREATE TABLE store_sessions(
-  id INTEGER PRIMARY KEY AUTOINCREMENT,
+  id INTEGER PRIMARY KEY,
   session_info TEXT NOT NULL,
   user_info TEXT NOT NULL,
   created REAL NOT NULL,
-  flushed REAL
+  flushed REAL,
+  last_message INTEGER
 );
 CREATE TABLE store_messages(
-  id INTEGER PRIMARY KEY AUTOINCREMENT,
+  id INTEGER PRIMARY KEY,
   session INTEGER,
   category INTEGER NOT NULL,
   type INTEGER NOT NULL,
@@ -78,9 +79,8 @@ CREATE TABLE store_messages(
   user_info TEXT,
   time REAL NOT NULL
 );
-CREATE INDEX store_messages_session ON store_messages(session) WHERE session IS NOT NULL;
 CREATE TABLE store_analytics(
-  id INTEGER PRIMARY KEY AUTOINCREMENT,
+  id INTEGER PRIMARY KEY,
   name TEXT NOT NULL,
   message INTEGER,
   host TEXT,
@@ -89,11 +89,15 @@ CREATE TABLE store_analytics(
 );
 CREATE INDEX store_analytics_message ON store_analytics(message) WHERE message IS NOT NULL;
 CREATE TABLE store_powerlog(
-  id INTEGER PRIMARY KEY AUTOINCREMENT,
+  id INTEGER PRIMARY KEY,
   subsystem INTEGER NOT NULL,
   name TEXT NOT NULL,
   payload TEXT NOT NULL,
   time REAL NOT NULL
+);
+CREATE TABLE store_sequences(
+  name TEXT PRIMARY KEY,
+  last_id INTEGER NOT NULL
 );
 CREATE TABLE export_cursors(
   exporter TEXT NOT NULL,
@@ -106,10 +110,19 @@ INSERT INTO store_sessions(id, session_info, user_info, created, flushed)
 INSERT INTO store_messages(id, session, category, type, payload, session_info, user_info, time)
   SELECT id, session, category, type, payload, session_info, user_info, time
   FROM livo_messages ORDER BY id;
+UPDATE store_sessions SET last_message = m.last
+  FROM (SELECT session, max(id) AS last FROM store_messages WHERE session IS NOT NULL
+        GROUP BY session) AS m
+  WHERE m.session = store_sessions.id;
 INSERT INTO store_analytics(id, name, payload, time)
   SELECT id, name, payload, time FROM analytics_events ORDER BY id;
 INSERT INTO store_powerlog(id, subsystem, name, payload, time)
   SELECT id, subsystem, name, payload, time FROM powerlog_events ORDER BY id;
+INSERT INTO store_sequences
+  SELECT 'store_sessions', IFNULL(max(id), 0) FROM store_sessions UNION ALL
+  SELECT 'store_messages', IFNULL(max(id), 0) FROM store_messages UNION ALL
+  SELECT 'store_analytics', IFNULL(max(id), 0) FROM store_analytics UNION ALL
+  SELECT 'store_powerlog', IFNULL(max(id), 0) FROM store_powerlog;
 DROP TABLE livo_messages;
 DROP TABLE livo_sessions;
 DROP TABLE analytics_events;

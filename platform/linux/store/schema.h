@@ -11,7 +11,9 @@
 // The store's schema: its versions and the steps from each to the next.
 //
 // Version 2 (this program's) keeps one row per delivered message:
-//   store_sessions(id, session_info, user_info, created, flushed)
+//   store_sessions(id, session_info, user_info, created, flushed, last_message)
+//       last_message: the newest message row of the session (NULL: none yet), written
+//       once per transaction; retention keeps the session while that row remains.
 //   store_messages(id, session NULL, category, type, payload, session_info NULL,
 //                  user_info NULL, time)
 //   store_analytics(id, name, message NULL, host NULL, payload NULL, time)
@@ -20,7 +22,10 @@
 //   store_powerlog(id, subsystem, name, payload, time)
 //   export_cursors(exporter, kind, last_id): how far each exporter got per kind
 //       ('sessions', 'messages', 'analytics', 'powerlog'), written by the exporter.
-// Every id is AUTOINCREMENT: never reused, growing in commit order. Readers see the
+//   store_sequences(name, last_id): the highest id each table ever had. The writer
+//       assigns ids itself (one writer: they grow in commit order) and raises these once
+//       per transaction, so that an id is never reused, also after retention emptied a
+//       table (AUTOINCREMENT would do the same at a cost on every insert). Readers see the
 // version 1 shapes through views of the version 1 table names (livo_sessions,
 // livo_messages, analytics_events, powerlog_events); reporting_store_reader.h lists them.
 // The file uses incremental auto-vacuum, so that retention can give pages back.

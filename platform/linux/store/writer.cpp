@@ -72,6 +72,10 @@ const char* KindName(RecordKind kind) {
   return "control";
 }
 
+// The tables whose ids the writer assigns, by ReportingStoreWriter::Table.
+constexpr const char* kTableNames[] = {"store_sessions", "store_messages", "store_analytics",
+                                       "store_powerlog"};
+
 }  // namespace
 
 // WAL pages after which the writer finishes the checkpoint itself between two transactions.
@@ -116,23 +120,35 @@ std::optional<Error> ReportingStoreWriter::Prepare() {
       {&insert_session_,
        "INSERT INTO store_sessions(id, session_info, user_info, created) VALUES(?1, ?2, ?3, ?4)"},
       {&flush_session_, "UPDATE store_sessions SET flushed = ?2 WHERE id = ?1"},
+      {&set_last_message_, "UPDATE store_sessions SET last_message = ?2 WHERE id = ?1"},
       {&insert_message_,
-       "INSERT INTO store_messages(session, category, type, payload, time) "
-       "VALUES(?1, ?2, ?3, ?4, ?5)"},
+       "INSERT INTO store_messages(session, category, type, payload, time, id) "
+       "VALUES(?1, ?2, ?3, ?4, ?5, ?6)"},
       {&insert_single_,
        "INSERT INTO store_messages(session, category, type, payload, session_info, user_info, "
-       "time) VALUES(NULL, ?1, ?2, ?3, ?4, ?5, ?6)"},
+       "time, id) VALUES(NULL, ?1, ?2, ?3, ?4, ?5, ?6, ?7)"},
       {&insert_analytics_,
-       "INSERT INTO store_analytics(name, message, host, payload, time) "
-       "VALUES(?1, ?2, ?3, ?4, ?5)"},
+       "INSERT INTO store_analytics(name, message, host, payload, time, id) "
+       "VALUES(?1, ?2, ?3, ?4, ?5, ?6)"},
       {&insert_powerlog_,
-       "INSERT INTO store_powerlog(subsystem, name, payload, time) VALUES(?1, ?2, ?3, ?4)"},
+       "INSERT INTO store_powerlog(subsystem, name, payload, time, id) "
+       "VALUES(?1, ?2, ?3, ?4, ?5)"},
+      {&raise_sequence_,
+       "UPDATE store_sequences SET last_id = ?2 WHERE name = ?1 AND last_id < ?2"},
   };
   for (auto& s : statements) {
     sqlite3_stmt* stmt = nullptr;
     int rc = sqlite3_prepare_v3(db_.get(), s.sql, -1, SQLITE_PREPARE_PERSISTENT, &stmt, nullptr);
     if (rc != SQLITE_OK) return SqliteError(db_.get(), rc, std::string("prepare ") + s.sql);
     s.stmt->reset(stmt);
+  }
+  for (int table = kMessages; table < kTables; ++table) {
+    const std::string sql = std::string("SELECT max(IFNULL((SELECT max(id) FROM ") +
+                            kTableNames[table] +
+                            "), 0), IFNULL((SELECT last_id FROM store_sequences WHERE name = '" +
+                            kTableNames[table] + "'), 0))";
+    if (auto e = store::QueryInt(db_.get(), sql.c_str(), &next_ids_[table])) return e;
+    ++next_ids_[table];
   }
   const std::string path = sqlite3_db_filename(db_.get(), "main");
   store::RetentionLimits limits;
@@ -341,7 +357,8 @@ void ReportingStoreWriter::CloseDatabase() {
   sqlite3_wal_hook(db_.get(), nullptr, nullptr);
   checkpointer_.reset();
   for (Statement* s : {&begin_, &commit_, &rollback_, &insert_session_, &flush_session_,
-                       &insert_message_, &insert_single_, &insert_analytics_, &insert_powerlog_}) {
+                       &set_last_message_, &raise_sequence_, &insert_message_, &insert_single_,
+                       &insert_analytics_, &insert_powerlog_}) {
     s->reset();
   }
   retention_.reset();  // its statements
@@ -378,7 +395,8 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
     std::span<Record> records) {
   int rc = Step(begin_.get());
   if (rc != SQLITE_DONE) return Fail(rc, "begin");
-  const std::size_t remembered = recent_messages_.Mark();
+  session_last_message_.clear();
+  std::fill(std::begin(written_ids_), std::end(written_ids_), 0);
   // Analytics events after the rest: one that repeats a message of the same batch (handed
   // over before it, as the message waits for its session's queue) then finds its row. Ids
   // still follow hand-over within each table.
@@ -387,16 +405,37 @@ std::optional<ReportingStoreWriter::Failure> ReportingStoreWriter::WriteTransact
       if ((record.kind == RecordKind::kAnalytics) != analytics) continue;
       rc = WriteRecord(record);
       if (rc != SQLITE_DONE) {
-        recent_messages_.Forget(remembered);
+        recent_messages_.RolledBack();
         return Fail(rc, "insert");
       }
     }
   }
+  for (const auto& [session, last] : session_last_message_) {
+    sqlite3_bind_int64(set_last_message_.get(), 1, session);
+    sqlite3_bind_int64(set_last_message_.get(), 2, last);
+    rc = Step(set_last_message_.get());
+    if (rc != SQLITE_DONE) {
+      recent_messages_.RolledBack();
+      return Fail(rc, "update");
+    }
+  }
+  session_last_message_.clear();
+  for (int table = 0; table < kTables; ++table) {
+    if (written_ids_[table] == 0) continue;
+    sqlite3_bind_text(raise_sequence_.get(), 1, kTableNames[table], -1, SQLITE_STATIC);
+    sqlite3_bind_int64(raise_sequence_.get(), 2, written_ids_[table]);
+    rc = Step(raise_sequence_.get());
+    if (rc != SQLITE_DONE) {
+      recent_messages_.RolledBack();
+      return Fail(rc, "update");
+    }
+  }
   rc = Step(commit_.get());
   if (rc != SQLITE_DONE) {
-    recent_messages_.Forget(remembered);
+    recent_messages_.RolledBack();
     return Fail(rc, "commit");
   }
+  recent_messages_.Committed();
   if (failing_rc_ != 0) {
     if (log_) {
       QN_LOG(*log_, nullptr, LogLevel::kDefault,
@@ -439,12 +478,18 @@ void ReportingStoreWriter::BindJson(sqlite3_stmt* stmt, int index, std::string& 
   BindText(stmt, index, buffer);
 }
 
+std::int64_t ReportingStoreWriter::TakeId(Table table) {
+  written_ids_[table] = next_ids_[table]++;
+  return written_ids_[table];
+}
+
 void ReportingStoreWriter::BindText(sqlite3_stmt* stmt, int index, const std::string& text) {
   sqlite3_bind_text(stmt, index, text.data(), static_cast<int>(text.size()), SQLITE_STATIC);
 }
 
 int ReportingStoreWriter::WriteRecord(Record& r) {
   sqlite3_stmt* stmt = nullptr;
+  std::int64_t row = 0;
   switch (r.kind) {
     case RecordKind::kSessionMessage:
       stmt = insert_message_.get();
@@ -453,6 +498,7 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
       sqlite3_bind_int(stmt, 3, r.type);
       BindJson(stmt, 4, json_payload_, r.payload);
       sqlite3_bind_double(stmt, 5, r.time);
+      sqlite3_bind_int64(stmt, 6, row = TakeId(kMessages));
       break;
     case RecordKind::kSingleMessage:
       stmt = insert_single_.get();
@@ -462,6 +508,7 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
       BindJson(stmt, 4, json_session_info_, r.extra->session_info);
       BindJson(stmt, 5, json_user_info_, r.extra->user_info);
       sqlite3_bind_double(stmt, 6, r.time);
+      sqlite3_bind_int64(stmt, 7, row = TakeId(kMessages));
       break;
     case RecordKind::kSession:
       stmt = insert_session_.get();
@@ -469,6 +516,7 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
       BindJson(stmt, 2, json_session_info_, r.extra->session_info);
       BindJson(stmt, 3, json_user_info_, r.extra->user_info);
       sqlite3_bind_double(stmt, 4, r.time);
+      written_ids_[kSessions] = std::max(written_ids_[kSessions], r.id);
       break;
     case RecordKind::kFlush:
       stmt = flush_session_.get();
@@ -492,6 +540,7 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
         BindJson(stmt, 4, json_payload_, r.payload);
       }
       sqlite3_bind_double(stmt, 5, r.time);
+      sqlite3_bind_int64(stmt, 6, TakeId(kAnalytics));
       break;
     }
     case RecordKind::kPowerLog:
@@ -500,6 +549,7 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
       BindText(stmt, 2, r.extra->name);
       BindJson(stmt, 3, json_payload_, r.payload);
       sqlite3_bind_double(stmt, 4, r.time);
+      sqlite3_bind_int64(stmt, 5, TakeId(kPowerLog));
       break;
     case RecordKind::kExec: {
       char* message = nullptr;
@@ -517,7 +567,8 @@ int ReportingStoreWriter::WriteRecord(Record& r) {
   const int rc = Step(stmt);
   if (rc == SQLITE_DONE &&
       (r.kind == RecordKind::kSessionMessage || r.kind == RecordKind::kSingleMessage)) {
-    recent_messages_.Add(sqlite3_last_insert_rowid(db_.get()), r.payload);
+    recent_messages_.Add(row, r.payload);
+    if (r.kind == RecordKind::kSessionMessage) session_last_message_[r.id] = row;
   }
   return rc;
 }

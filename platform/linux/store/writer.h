@@ -12,6 +12,7 @@
 #include <span>
 #include <string>
 #include <thread>
+#include <unordered_map>
 #include <vector>
 
 #include "common/Error.h"
@@ -103,6 +104,12 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   bool open() const;
 
  private:
+  // The tables whose rows the writer gives ids (sessions get theirs from NewSessionId).
+  enum Table { kSessions, kMessages, kAnalytics, kPowerLog, kTables };
+  // The next id of `table`'s sequence, noted as written in this transaction. Ids taken by a
+  // transaction that is rolled back are skipped, never reused.
+  std::int64_t TakeId(Table table);
+
   std::optional<Error> Prepare();
   void Run();
   // Lets retention remove a step of rows when a limit is passed; updates its stats.
@@ -162,12 +169,16 @@ class ReportingStoreWriter : public std::enable_shared_from_this<ReportingStoreW
   bool ready_ = false;  // writer thread once started: Ready succeeded
   int wal_pages_ = 0;   // writer thread: frames in the WAL after the last commit
   Statement begin_, commit_, rollback_;
-  Statement insert_session_, flush_session_, insert_message_, insert_single_;
-  Statement insert_analytics_, insert_powerlog_;
+  Statement insert_session_, flush_session_, set_last_message_, insert_message_, insert_single_;
+  Statement insert_analytics_, insert_powerlog_, raise_sequence_;
+  std::int64_t next_ids_[kTables] = {};     // writer thread: the next id of each table
+  std::int64_t written_ids_[kTables] = {};  // writer thread: this transaction's highest
   std::string json_payload_, json_session_info_, json_user_info_;
   std::unique_ptr<store::Retention> retention_;  // set by Prepare
   bool retention_busy_ = false;                  // it has more to remove
-  store::RecentMessages recent_messages_;        // for analytics events that repeat a message
+  // The newest message row of each session this transaction wrote to.
+  std::unordered_map<std::int64_t, std::int64_t> session_last_message_;
+  store::RecentMessages recent_messages_;  // for analytics events that repeat a message
   int failing_rc_ = 0;  // the error of the database as a whole while writes fail, else 0
   std::uint64_t lost_while_failing_ = 0;
 
