@@ -5,6 +5,7 @@
 #include <algorithm>
 #include <cstdio>
 #include <ctime>
+#include <random>
 
 namespace qn {
 namespace {
@@ -48,6 +49,7 @@ std::shared_ptr<NatsExporter> NatsExporter::Start(NatsExportOptions options,
                                                   std::shared_ptr<Log> log) {
   auto exporter = std::make_shared<NatsExporter>(std::move(options), std::move(log));
   exporter->thread_ = std::thread([raw = exporter.get()] { raw->Run(); });
+  exporter->saver_ = std::thread([raw = exporter.get()] { raw->SaveLoop(); });
   return exporter;
 }
 
@@ -61,8 +63,8 @@ NatsExporter::~NatsExporter() { Stop(); }
 
 void NatsExporter::Wake() {
   std::lock_guard lock(mutex_);
+  if (!woken_) changed_.notify_one();  // else the thread was told already
   woken_ = true;
-  changed_.notify_one();
 }
 
 void NatsExporter::Stop() {
@@ -73,6 +75,12 @@ void NatsExporter::Stop() {
       changed_.notify_one();
     }
     if (thread_.joinable()) thread_.join();
+    {
+      std::lock_guard lock(mutex_);
+      saver_stopping_ = true;  // after the exporter's last cursors
+      save_wanted_.notify_one();
+    }
+    if (saver_.joinable()) saver_.join();
   });
 }
 
@@ -97,7 +105,8 @@ Dictionary NatsExporter::Stats() const {
 void NatsExporter::Post(Event event) {
   std::lock_guard lock(mutex_);
   events_.push_back(std::move(event));
-  changed_.notify_one();
+  // The first event wakes the thread, which takes all that came meanwhile at once.
+  if (events_.size() == 1) changed_.notify_one();
 }
 
 void NatsExporter::OnAck(jsCtx*, natsMsg* msg, jsPubAck* ack, jsPubAckErr* error, void* self) {
@@ -241,8 +250,20 @@ bool NatsExporter::Connect() {
   if (s == NATS_OK) s = natsOptions_SetName(opts, "qnreportingd");
   if (s == NATS_OK) s = natsOptions_SetTimeout(opts, kConnectTimeout.count());
   if (s == NATS_OK) s = natsOptions_SetMaxReconnect(opts, -1);
-  if (s == NATS_OK) s = natsOptions_SetReconnectWait(opts, options_.backoff_min.count());
-  if (s == NATS_OK) s = natsOptions_SetReconnectJitter(opts, 100, 1000);
+  // Reconnects back off (doubling after each round over the servers, with jitter), so that
+  // a cluster electing leaders is not hammered.
+  if (s == NATS_OK) {
+    s = natsOptions_SetCustomReconnectDelay(
+        opts,
+        [](natsConnection*, int attempts, void* self) -> int64_t {
+          const NatsExportOptions& o = static_cast<NatsExporter*>(self)->options_;
+          const int64_t most = o.backoff_max.count();
+          const int64_t delay = std::min(most, o.backoff_min.count() << std::min(attempts, 16));
+          thread_local std::minstd_rand random(std::random_device{}());
+          return delay / 2 + static_cast<int64_t>(random() % static_cast<uint64_t>(delay / 2 + 1));
+        },
+        this);
+  }
   // A server that stops answering (stopped, not gone) is noticed within a few seconds.
   if (s == NATS_OK) s = natsOptions_SetPingInterval(opts, 2000);
   if (s == NATS_OK) s = natsOptions_SetMaxPingsOut(opts, 2);
@@ -584,12 +605,32 @@ void NatsExporter::AdvanceAndSave(bool now) {
   }
   if (!cursors_dirty_ || (!now && Clock::now() - last_save_ < kTick)) return;
   last_save_ = Clock::now();
-  if (auto error = source_->SaveCursors(name_, cursors)) {
-    // Tried again at the next tick; the state says why meanwhile.
-    Update([&](Figures& f) { f.last_error = error->Description(); });
-    return;
-  }
   cursors_dirty_ = false;
+  std::lock_guard lock(mutex_);
+  to_save_ = cursors;
+  save_wanted_.notify_one();
+}
+
+void NatsExporter::SaveLoop() {
+  std::unique_ptr<ExportSource> db;
+  std::unique_lock lock(mutex_);
+  while (true) {
+    save_wanted_.wait(lock, [&] { return to_save_ || saver_stopping_; });
+    if (!to_save_) return;
+    const std::array<std::int64_t, kExportKinds> cursors = *to_save_;
+    to_save_.reset();
+    lock.unlock();
+    std::optional<Error> error;
+    if (!db) db = ExportSource::Open(options_.db_path, options_.device, &error);
+    if (db) error = db->SaveCursors(name_, cursors);
+    lock.lock();
+    if (!error) continue;
+    // Tried again a second later (newer cursors replace these); the counters say why.
+    figures_.last_error = error->Description();
+    if (saver_stopping_) return;
+    if (!to_save_) to_save_ = cursors;
+    save_wanted_.wait_for(lock, kTick, [&] { return saver_stopping_; });
+  }
 }
 
 void NatsExporter::RefreshLag() {

@@ -51,7 +51,8 @@ struct NatsExportOptions {
 // is not acknowledged within `ack_timeout` is sent again, after a pause that grows while
 // failures go on. A cursor moves only over a contiguous run of acknowledged rows (a
 // duplicate counts as acknowledged) and is saved in the store's `export_cursors` under
-// the name "nats:<stream>" about once a second and at Stop: after any ending, export
+// the name "nats:<stream>" about once a second (by a thread of its own, so that waiting
+// for the store's write lock never holds publishing up) and at Stop: after any ending, export
 // resumes after the saved cursor, so delivery is at least once.
 //
 // A session row is published once it was flushed, or at once when an earlier run of the
@@ -134,7 +135,12 @@ class NatsExporter {
   void RecheckWaitingSessions();
   void Fill();
   void Expire();
+  // Moves the cursors over acknowledged rows and hands them to the saver (at most once a
+  // second unless `now`).
   void AdvanceAndSave(bool now);
+  // The saver thread: writes the cursors it is handed, so that waiting for the store's
+  // write lock never holds up publishing.
+  void SaveLoop();
   void RefreshLag();
   Entry* Find(ExportKind kind, std::int64_t id);
   void Failed(const std::string& error);
@@ -161,6 +167,10 @@ class NatsExporter {
   std::vector<Event> events_;  // GUARDED_BY(mutex_)
   Figures figures_;            // GUARDED_BY(mutex_)
   std::thread thread_;
+  std::thread saver_;
+  std::condition_variable save_wanted_;
+  std::optional<std::array<std::int64_t, kExportKinds>> to_save_;  // GUARDED_BY(mutex_)
+  bool saver_stopping_ = false;                                    // GUARDED_BY(mutex_)
   std::once_flag stopped_;
 
   // The exporter thread's own.
