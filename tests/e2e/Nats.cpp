@@ -163,10 +163,13 @@ std::vector<StreamMessage> ReadStream(const std::string& urls, const std::string
                natsConnection_JetStream(&js, nc, nullptr) == NATS_OK &&
                js_SubscribeSync(&sub, js, "quenta.>", nullptr, &options, nullptr) == NATS_OK;
       })) {
-    const auto deadline = std::chrono::steady_clock::now() + kPatience;
+    // Ends once `expected` came, or when none came for kPatience (a sanitizer build reads
+    // slowly, but steadily).
+    auto deadline = std::chrono::steady_clock::now() + kPatience;
     while (messages.size() < expected && std::chrono::steady_clock::now() < deadline) {
       natsMsg* msg = nullptr;
       if (natsSubscription_NextMsg(&msg, sub, 1000) != NATS_OK) continue;
+      deadline = std::chrono::steady_clock::now() + kPatience;
       StreamMessage& out = messages.emplace_back();
       out.subject = natsMsg_GetSubject(msg);
       const char* id = nullptr;

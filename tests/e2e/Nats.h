@@ -42,7 +42,7 @@ struct StreamMessage {
   Value body;
 };
 // Every message of `stream` (read with an ordered consumer from `urls`), waiting until
-// there are `expected`; fewer when they never come within kPatience.
+// there are `expected`; fewer when none comes for kPatience.
 std::vector<StreamMessage> ReadStream(const std::string& urls, const std::string& stream,
                                       std::size_t expected);
 
