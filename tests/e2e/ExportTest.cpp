@@ -122,7 +122,9 @@ TEST(ExportTest, EveryKindArrivesOnceWithItsIdAndARestartSendsNothingAgain) {
   // The restarted daemon resumes after its saved cursors: it publishes only its own new
   // rows (the readiness probe's uptime event), which the server would not tell apart from
   // re-sends within its duplicate window, so the count published is what is checked.
+  ASSERT_TRUE(Eventually([&] { return ExportStat(*daemon, "lag_rows") == 0; }));
   ASSERT_EQ(daemon->Stop(), Exited(0));
+  std::filesystem::remove(home.File("run/stats.json"));  // the stopped daemon's figures
   daemon = StartOn(home, args);
   ASSERT_TRUE(daemon->started());
   ASSERT_TRUE(daemon->WaitForStat({"export", "acknowledged"}, 1));
@@ -155,6 +157,7 @@ TEST(ExportTest, ClusterFaultsLoseAndDuplicateNothing) {
   SendMessages(*daemon, 15'000);
   daemon->process().Signal(SIGKILL);
   ASSERT_EQ(daemon->process().Wait(), (ExitStatus{false, SIGKILL}));
+  std::filesystem::remove(home.File("run/stats.json"));
   daemon = StartOn(home, args);
   ASSERT_TRUE(daemon->started());
   ASSERT_TRUE(daemon->WaitForStat({"export", "acknowledged"}, 1));  // exporting again

@@ -17,6 +17,7 @@ constexpr int kReadBatch = 256;
 constexpr auto kTick = std::chrono::seconds(1);  // lag, cursor saves, overdue publishes
 constexpr auto kConnectTimeout = milliseconds(2000);
 constexpr auto kCloseWait = std::chrono::seconds(5);
+constexpr auto kFinalAckWait = milliseconds(1000);            // at Stop, for publishes in flight
 constexpr std::int64_t kDuplicateWindowNs = 120'000'000'000;  // a created stream's window
 constexpr const char* kMsgIdHeader = "Nats-Msg-Id";
 
@@ -229,7 +230,13 @@ void NatsExporter::Run() {
     const bool sending = inflight_ < options_.max_unacked && !to_send_.empty();
     if (!WaitUntil(sending ? std::min(resume_at_, next_tick_) : next_tick_)) break;
   }
-  // Acknowledgements that arrived before the end still move the cursors.
+  // Publishes in flight get a moment to be acknowledged; what arrived still moves the cursors.
+  if (js_ && inflight_) {
+    jsPubOptions po;
+    jsPubOptions_Init(&po);
+    po.MaxWait = kFinalAckWait.count();
+    js_PublishAsyncComplete(js_, &po);
+  }
   {
     std::lock_guard lock(mutex_);
     events.swap(events_);
