@@ -32,6 +32,8 @@
 #include "Statistics/Service/QNReportingSession.h"
 #include "common/Files.h"
 #include "common/Paths.h"
+#include "platform/linux/export/device_id.h"
+#include "platform/linux/export/nats_exporter.h"
 #include "platform/linux/linux_defaults.h"
 #include "platform/linux/linux_device_info.h"
 #include "platform/linux/linux_dispatch.h"
@@ -129,6 +131,7 @@ struct Options {
   std::string metrics_file;  // the counters for Prometheus too, when set
   ReportingStore::Options store;  // its retention: --store-max-bytes, --store-max-age
   bool shared_sessions = false;
+  NatsExportOptions export_nats;  // export is on when it names servers
 };
 
 // A CLI11 check that a value is not empty.
@@ -287,6 +290,68 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
         "Configuration bytes a session keeps");
   limit("--max-configuration-bytes-total", limits.max_configuration_bytes_total,
         "The same for all sessions together");
+  // Export to NATS JetStream (docs/export.md). Each option may also come from the
+  // environment (QN_EXPORT_NATS, ...), e.g. the unit's environment file.
+  NatsExportOptions& exp = options.export_nats;
+  const auto token = [](const char* extra) {
+    return CLI::Validator(
+        [extra](std::string& text) {
+          std::string_view rest = text;
+          while (true) {
+            const std::string_view part = rest.substr(0, rest.find('.'));
+            if (!IsValidDeviceId(part) || (!*extra && part.size() != rest.size())) {
+              return std::string("needs letters, digits, '-' or '_'") + extra;
+            }
+            if (part.size() == rest.size()) return std::string();
+            rest.remove_prefix(part.size() + 1);
+          }
+        },
+        "");
+  };
+  CLI::Option* nats =
+      app.add_option("--export-nats", exp.servers, "Export the store to these NATS servers")
+          ->type_name("URL[,URL...]")
+          ->delimiter(',')
+          ->multi_option_policy(CLI::MultiOptionPolicy::TakeAll)
+          ->envname("QN_EXPORT_NATS")
+          ->check(kNotEmpty)
+          ->group("Export");
+  const auto export_option = [&](const char* name, std::string& value, const char* what,
+                                 const char* env, const char* type) {
+    return app.add_option(name, value, what)
+        ->type_name(type)
+        ->envname(env)
+        ->needs(nats)
+        ->group("Export");
+  };
+  export_option("--export-subject", exp.subject_prefix, "Subjects PREFIX.<device>.<kind>",
+                "QN_EXPORT_SUBJECT", "PREFIX")
+      ->default_str(exp.subject_prefix)
+      ->check(token(" (dot-separated)"));
+  export_option("--export-stream", exp.stream, "The JetStream stream", "QN_EXPORT_STREAM", "NAME")
+      ->default_str(exp.stream)
+      ->check(token(""));
+  app.add_flag("--export-create-stream", exp.create_stream, "Create the stream when missing")
+      ->envname("QN_EXPORT_CREATE_STREAM")
+      ->needs(nats)
+      ->group("Export");
+  app.add_option("--export-replicas", exp.replicas, "Replicas of a stream it creates")
+      ->type_name("N")
+      ->default_val(1)
+      ->check(CLI::Range(1, 5))
+      ->envname("QN_EXPORT_REPLICAS")
+      ->needs(nats)
+      ->group("Export");
+  export_option("--export-creds", exp.creds_file, "NATS credentials file", "QN_EXPORT_CREDS",
+                "FILE");
+  export_option("--export-tls-ca", exp.tls_ca, "CA certificates for TLS", "QN_EXPORT_TLS_CA",
+                "FILE");
+  export_option("--export-tls-cert", exp.tls_cert, "Client certificate for TLS",
+                "QN_EXPORT_TLS_CERT", "FILE");
+  export_option("--export-tls-key", exp.tls_key, "Client key for TLS", "QN_EXPORT_TLS_KEY", "FILE");
+  export_option("--device-id", exp.device, "This device's ID (default: from the machine ID)",
+                "QN_DEVICE_ID", "ID")
+      ->check(token(""));
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -308,9 +373,10 @@ sigset_t HandledSignals() {
   return set;
 }
 
-// The counters and the store's figures, as the stats file shows them, with the daemon's
-// process ID (so that a reader can tell a file left by a daemon that has ended).
-Dictionary StatsOf(const Counters& counters, const ReportingStore& store) {
+// The counters, the store's figures and the exporter's, as the stats file shows them, with
+// the daemon's process ID (so that a reader can tell a file left by a daemon that has ended).
+Dictionary StatsOf(const Counters& counters, const ReportingStore& store,
+                   const NatsExporter* exporter) {
   Dictionary stats = counters.Snapshot();
   stats.Set("pid", Value(static_cast<std::int64_t>(getpid())));
   const ReportingStore::Stats figures = store.stats();
@@ -330,6 +396,7 @@ Dictionary StatsOf(const Counters& counters, const ReportingStore& store) {
                                                     *figures.oldest_row_time)));
   }
   stats.Set("store", Value(std::move(store_stats)));
+  if (exporter) stats.Set("export", Value(exporter->Stats()));
   return stats;
 }
 
@@ -386,6 +453,24 @@ int Run(const Options& options) {
     return 1;
   }
 
+  // The exporter, when configured; it starts before any client can write.
+  std::shared_ptr<NatsExporter> exporter;
+  if (!options.export_nats.servers.empty()) {
+    NatsExportOptions export_options = options.export_nats;
+    export_options.db_path = store_path;
+    Error error;
+    std::optional<std::string> device = export_options.device.empty()
+                                            ? ExportDeviceId(paths.state_dir, &error)
+                                            : std::optional(export_options.device);
+    if (device) {
+      export_options.device = *device;
+      exporter = NatsExporter::Start(std::move(export_options), log);
+    } else {
+      QN_LOG(*log, nullptr, LogLevel::kError, "%s:%d:%s: export: no device ID (%s); not exporting",
+             error.Description().c_str());
+    }
+  }
+
   auto platform = std::make_shared<Platform>();
   platform->counters = counters;
   platform->max_aggregated_bytes = options.limits.max_aggregated_bytes;
@@ -437,7 +522,7 @@ int Run(const Options& options) {
                                                      options.metrics_file);
   // Published once before the socket exists: the files are there as soon as a client can
   // connect (and a metrics file that cannot be written is an error at start-up).
-  if (auto failure = stats->Publish(StatsOf(*counters, *store))) {
+  if (auto failure = stats->Publish(StatsOf(*counters, *store, exporter.get()))) {
     std::fprintf(stderr, "%s: cannot write the counters: %s\n", kProgram,
                  failure->Description().c_str());
     store->Drain();
@@ -480,19 +565,23 @@ int Run(const Options& options) {
     return 1;
   }
   std::shared_ptr<IpcListener> listener = listening.listener;
-  store->SetAfterBatch(listening.wake_message_intake);
+  store->SetAfterBatch(
+      [wake = listening.wake_message_intake, exporting = std::weak_ptr<NatsExporter>(exporter)] {
+        wake();
+        if (auto open = exporting.lock()) open->Wake();
+      });
   listener->SetDelegate(delegate);
 
   // The one thread that takes the handled signals (blocked everywhere else).
   std::shared_ptr<Notify> notify = platform->notify;
-  std::thread signals([listener, notify, log, stats, counters, store] {
+  std::thread signals([listener, notify, log, stats, counters, store, exporter] {
     const sigset_t set = HandledSignals();
     for (;;) {
       // Between signals, once a second, the counters are published.
       const timespec second{1, 0};
       const int signal = sigtimedwait(&set, nullptr, &second);
       if (signal < 0) {
-        if (errno == EAGAIN) stats->Publish(StatsOf(*counters, *store));
+        if (errno == EAGAIN) stats->Publish(StatsOf(*counters, *store, exporter.get()));
         continue;
       }
       if (signal == SIGHUP) {
@@ -534,6 +623,7 @@ int Run(const Options& options) {
   // it is never destroyed from one of its own tasks.
   std::shared_ptr<Dispatcher> dispatcher = platform->dispatcher;
   store->SetAfterBatch(nullptr);
+  if (exporter) exporter->Stop();
   listener.reset();
   delegate.reset();
   platform.reset();

@@ -22,6 +22,20 @@ std::int64_t Number(const Dictionary& stats, std::initializer_list<const char*> 
   return found ? found->as_int64().value_or(0) : 0;
 }
 
+// ", export lag N" (and why nothing moves, when not connected), or nothing without export.
+std::string ExportPart(const Dictionary& stats) {
+  const Value* found = stats.Find("export");
+  const Dictionary* figures = found ? found->as_dictionary() : nullptr;
+  if (!figures) return std::string();
+  std::string part = ", export lag " + std::to_string(Number(*figures, {"lag_rows"}));
+  const Value* connected = figures->Find("connected");
+  const Value* state = figures->Find("state");
+  if (!(connected && *connected == Value(true)) && state && state->as_string()) {
+    part += " (" + std::string(*state->as_string()) + ")";
+  }
+  return part;
+}
+
 }  // namespace
 
 std::string LinuxStatsPublisher::StatusLine(const Dictionary& stats) {
@@ -35,7 +49,7 @@ std::string LinuxStatsPublisher::StatusLine(const Dictionary& stats) {
          std::to_string(Number(stats, {"sessions_open"})) + " sessions, " +
          std::to_string(Number(stats, {"messages"})) + " messages, store lag " +
          std::to_string(Number(stats, {"store", "lag"})) + ", " + std::to_string(paused) +
-         " paused, " + std::to_string(dropped) + " dropped";
+         " paused, " + std::to_string(dropped) + " dropped" + ExportPart(stats);
 }
 
 std::optional<Error> LinuxStatsPublisher::Publish(const Dictionary& stats) {

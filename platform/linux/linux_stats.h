@@ -26,7 +26,8 @@ class LinuxStatsPublisher {
   std::optional<Error> Publish(const Dictionary& stats);
 
   // The status line of `stats`, e.g. "3 connections, 12 sessions, 1204 messages, store
-  // lag 0, 2 paused, 0 dropped".
+  // lag 0, 2 paused, 0 dropped", with ", export lag 0" (or ", export lag 40 (unreachable)"
+  // while not connected) when the daemon exports.
   static std::string StatusLine(const Dictionary& stats);
 
  private:
