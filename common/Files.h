@@ -15,6 +15,25 @@ namespace qn {
 // File-system helpers. Errors come back as values (ErrnoError, "posix" domain). Safe from
 // any thread; nothing is cached.
 
+// An open file descriptor, closed when this goes away. Move-only; -1 when empty.
+class FileDescriptor {
+ public:
+  FileDescriptor() = default;
+  explicit FileDescriptor(int fd) : fd_(fd) {}
+  FileDescriptor(FileDescriptor&& other) noexcept;
+  FileDescriptor& operator=(FileDescriptor&& other) noexcept;
+  FileDescriptor(const FileDescriptor&) = delete;
+  FileDescriptor& operator=(const FileDescriptor&) = delete;
+  ~FileDescriptor() { Reset(); }
+
+  int get() const { return fd_; }
+  int release();
+  void Reset();
+
+ private:
+  int fd_ = -1;
+};
+
 // Creates the directory `path` with any missing parent directories. Each directory created
 // gets exactly `mode` (set with chmod afterwards, so the umask does not narrow it);
 // directories that exist already are left as they are. Succeeds when `path` already is a
@@ -27,6 +46,24 @@ std::optional<Error> CreateDirectories(const std::string& path, mode_t mode);
 // umask. On failure no temporary file is left behind and the old file is untouched
 // (unless the failure is the final directory fsync, after the rename).
 std::optional<Error> WriteFileAtomically(const std::string& path, std::string_view contents);
+
+// The same inside the open folder `dir_fd` (`dir_path` only names it in error texts); a
+// new file gets exactly `mode` whatever the umask (without one, 0666 less the umask).
+// Nothing is looked up by path: the temporary file is made with O_EXCL | O_NOFOLLOW and
+// renamed into place with renameat.
+std::optional<Error> WriteFileAtomicallyAt(int dir_fd, const std::string& dir_path,
+                                           const std::string& name, std::string_view contents,
+                                           std::optional<mode_t> mode);
+
+// Opens the folder `path` for work relative to it, `base` being a folder the caller
+// trusts as it is (made by path with `mode` when missing). Each folder of `path` below
+// `base` is made with exactly `mode` when missing and opened with O_NOFOLLOW |
+// O_DIRECTORY, relative to the one above it: a symbolic link is refused (ELOOP), so is a
+// folder that another user owns (EPERM); group or others' write permission on a folder of
+// the caller's own is taken away. When `path` does not lie below `base`, its parent is the
+// trusted base. Errors name the folder at fault.
+std::optional<Error> OpenOwnFolder(const std::string& base, const std::string& path, mode_t mode,
+                                   FileDescriptor& folder);
 
 // Removes the temporary files that WriteFileAtomically leaves in `dir` when the process
 // ends between creating one and renaming it (".<name>.tmp-<...>"). Call it only while no

@@ -38,7 +38,11 @@ struct Platform {
   std::shared_ptr<Enerdex> enerdex;
   std::shared_ptr<Analytics> analytics;
 
-  // The diagnostic-log directory for audio reporting (summary files).
+  // The diagnostic-log directory for audio reporting (summary files), below the daemon's
+  // log folder `log_dir`. The log folder is trusted as it is; every folder below it is made
+  // (0750) and opened relative to the one above, never through a symbolic link, and refused
+  // when another user owns it (common/Files.h, OpenOwnFolder).
+  std::string log_dir = "/var/log/quenta";
   std::string diagnostic_logs_dir = "/var/log/quenta/DiagnosticLogs/Audio/Reporting";
   // The one serial queue that writes summary files, in the order sessions stop, off the
   // thread that stops them. A stop reply is sent only after the queue has run the write

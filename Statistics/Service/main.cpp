@@ -303,6 +303,7 @@ int Run(const Options& options) {
   platform->dispatcher = NewLinuxDispatcher();
   platform->notify = NewLinuxNotify({.runtime_dir = paths.runtime_dir, .log = log});
   platform->defaults = NewLinuxDefaults({.state_dir = paths.state_dir, .log = log});
+  platform->log_dir = paths.log_dir;
   platform->diagnostic_logs_dir = paths.log_dir + "/DiagnosticLogs/Audio/Reporting";
   // Summary files that an earlier run was writing when it ended: nothing writes there yet.
   if (const std::size_t stale = RemoveTemporaryFiles(platform->diagnostic_logs_dir)) {
