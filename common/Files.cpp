@@ -142,6 +142,31 @@ std::optional<Error> OpenOwnFolder(const std::string& base, const std::string& p
   return std::nullopt;
 }
 
+std::optional<Error> CheckPrivateFolder(const std::string& path) {
+  struct stat seen;
+  if (::lstat(path.c_str(), &seen) != 0) return ErrnoError("stat " + path, errno);
+  if (S_ISLNK(seen.st_mode)) return ErrnoError(path + " is a symbolic link", ELOOP);
+  if (!S_ISDIR(seen.st_mode)) return ErrnoError(path + " is not a folder", ENOTDIR);
+  FileDescriptor folder(::open(path.c_str(), O_RDONLY | O_DIRECTORY | O_NOFOLLOW | O_CLOEXEC));
+  struct stat st;
+  if (folder.get() < 0) return ErrnoError("open " + path, errno);
+  if (::fstat(folder.get(), &st) != 0) return ErrnoError("stat " + path, errno);
+  if (st.st_dev != seen.st_dev || st.st_ino != seen.st_ino) {
+    return ErrnoError(path + " changed while it was checked", EAGAIN);
+  }
+  if (st.st_uid != ::geteuid()) {
+    return ErrnoError(path + " belongs to uid " + std::to_string(st.st_uid) + ", not to uid " +
+                          std::to_string(::geteuid()) + " that runs this process",
+                      EPERM);
+  }
+  if (st.st_mode & (S_IWGRP | S_IWOTH)) {
+    char mode[8];
+    std::snprintf(mode, sizeof mode, "%04o", static_cast<unsigned>(st.st_mode & 07777));
+    return ErrnoError(path + " has mode " + mode + ": others may write to it", EPERM);
+  }
+  return std::nullopt;
+}
+
 std::size_t RemoveTemporaryFiles(const std::string& dir) {
   DIR* stream = ::opendir(dir.c_str());
   if (!stream) return 0;

@@ -65,6 +65,12 @@ std::optional<Error> WriteFileAtomicallyAt(int dir_fd, const std::string& dir_pa
 std::optional<Error> OpenOwnFolder(const std::string& base, const std::string& path, mode_t mode,
                                    FileDescriptor& folder);
 
+// Whether `path` is a folder fit to hold the calling process's private files: a folder, not
+// a symbolic link (lstat), that the process's effective user owns and that neither its
+// group nor others may write to (fstat of the folder opened with O_NOFOLLOW, so a folder
+// swapped in between is caught). The error says which of these fails.
+std::optional<Error> CheckPrivateFolder(const std::string& path);
+
 // Removes the temporary files that WriteFileAtomically leaves in `dir` when the process
 // ends between creating one and renaming it (".<name>.tmp-<...>"). Call it only while no
 // write into `dir` can be under way. Returns how many were removed; a missing `dir`

@@ -269,11 +269,25 @@ void WaitForSummaryFiles(SerialQueue& queue, Log& log) {
 
 int Run(const Options& options) {
   const Paths paths = ResolvePaths(options.paths);
-  for (const auto& [dir, mode] :
-       {std::pair{paths.runtime_dir, mode_t{0755}}, std::pair{paths.state_dir, mode_t{0750}},
-        std::pair{paths.log_dir, mode_t{0750}}}) {
-    if (auto failure = CreateDirectories(dir, mode)) {
+  if (!paths.problem.empty()) {
+    std::fprintf(stderr, "%s: %s; give --home DIR\n", kProgram, paths.problem.c_str());
+    return 1;
+  }
+  // The folders are the daemon's own: one that another user owns or may write to (made
+  // first in a shared place, say) could hand the socket or the store to that user.
+  // With --home, the folder holding the three must be the daemon's own too.
+  std::vector<std::pair<std::string, mode_t>> folders{
+      {paths.runtime_dir, 0755}, {paths.state_dir, 0750}, {paths.log_dir, 0750}};
+  if (options.paths.home) folders.insert(folders.begin(), {*options.paths.home, 0755});
+  for (const auto& [dir, mode] : folders) {
+    std::optional<Error> failure = CreateDirectories(dir, mode);
+    if (failure) {
       std::fprintf(stderr, "%s: cannot create %s: %s\n", kProgram, dir.c_str(),
+                   failure->Description().c_str());
+      return 1;
+    }
+    if ((failure = CheckPrivateFolder(dir))) {
+      std::fprintf(stderr, "%s: refusing the folder %s: %s\n", kProgram, dir.c_str(),
                    failure->Description().c_str());
       return 1;
     }

@@ -2,6 +2,7 @@
 // and its summary file, clients leaving, killService, signals, the command line.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -248,6 +249,31 @@ TEST(CommandLineTest, HelpExitsZeroBadArgumentsExitTwo) {
     ChildProcess process(QN_DAEMON_PATH, {bad}, dir.path());
     EXPECT_EQ(process.Wait(), Exited(2)) << bad;
     EXPECT_THAT(process.Stderr(), HasSubstr("qnreportingd: ")) << bad;
+  }
+}
+
+// A runtime folder that is not the daemon's own (another user's, or one others may write
+// to) could hand the socket to someone else: the daemon refuses it and exits with 1.
+TEST(CommandLineTest, ARuntimeFolderNotPrivateExitsOne) {
+  const struct {
+    const char* what;
+    uid_t owner;
+    std::filesystem::perms mode;
+  } cases[] = {
+      {"another user's", 65534, std::filesystem::perms::owner_all},
+      {"writable by others", geteuid(), std::filesystem::perms::all},
+  };
+  for (const auto& c : cases) {
+    if (c.owner != geteuid() && geteuid() != 0) continue;  // only root can give a folder away
+    testing::TempDir home;
+    const std::string run = home.File("run");
+    std::filesystem::create_directories(run);
+    std::filesystem::permissions(run, c.mode);
+    ASSERT_EQ(chown(run.c_str(), c.owner, static_cast<gid_t>(-1)), 0);
+    ChildProcess process(QN_DAEMON_PATH, {"--home", home.path()}, home.path());
+    EXPECT_EQ(process.Wait(), Exited(1)) << c.what;
+    EXPECT_THAT(process.Stderr(), HasSubstr("qnreportingd: refusing the folder " + run)) << c.what;
+    EXPECT_FALSE(std::filesystem::exists(run + "/reporting.sock")) << c.what;
   }
 }
 
