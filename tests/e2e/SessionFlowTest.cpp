@@ -2,6 +2,7 @@
 // and its summary file, clients leaving, killService, signals, the command line.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/prctl.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -16,8 +17,10 @@
 namespace qn::e2e {
 namespace {
 
+using ::testing::AllOf;
 using ::testing::ElementsAre;
 using ::testing::HasSubstr;
+using ::testing::Not;
 using Table = ReportingStoreRow::Table;
 
 constexpr const char* kUptimeEvent = "com.norvel.quenta.qnreportingclientuptime";
@@ -58,10 +61,15 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   auto started = StartOn(home, {"--driver-stats", stats.path(), "--internal-build"});
   Daemon& daemon = *started;
   ASSERT_TRUE(daemon.started());
+  // A client whose command name holds a newline: it shows escaped in the uptime line and
+  // row, never as a line of its own.
+  const std::string own_name = OwnCommandName();
+  prctl(PR_SET_NAME, "e2e\nFAKE: line");
   auto client = daemon.Connect();
   ASSERT_TRUE(client);
   EXPECT_TRUE(RepliedWithoutError(
       client->sendMessageSync(Value(Dictionary{{"k", "v"}}), 5, 1, std::nullopt)));
+  prctl(PR_SET_NAME, own_name.c_str());  // the name was read before that reply
 
   EXPECT_EQ(client->createReportingSessionSync(42), true);
   EXPECT_EQ(client->setServiceTypeSync(2, 42), true);
@@ -140,7 +148,9 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   auto uptime = AnalyticsNamed(rows, "com.norvel.quenta.qnreportingclientuptime");
   ASSERT_EQ(uptime.size(), 2u);  // the readiness probe, then this client
   const Value uptime_payload = Json(uptime[1].payload);
-  EXPECT_EQ(*Field(uptime_payload, "processName"), Value(OwnCommandName()));
+  EXPECT_EQ(*Field(uptime_payload, "processName"), Value("e2e\\nFAKE: line"));
+  EXPECT_THAT(daemon.process().Stderr(), AllOf(HasSubstr(" process=e2e\\nFAKE: line uptime_sec="),
+                                               Not(HasSubstr("\nFAKE: line"))));
   ASSERT_TRUE(Field(uptime_payload, "seconds"));
   EXPECT_GE(Field(uptime_payload, "seconds")->as_double().value_or(-1), 0.0);
 }
