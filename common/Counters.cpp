@@ -25,6 +25,7 @@ Dictionary Counters::Snapshot() const {
                                    {"replies_too_large", Value(Get(repliesTooLarge))},
                                    {"replies_unread", Value(Get(repliesUnread))}})},
       {"aggregation_capped", Value(Get(aggregationCapped))},
+      {"summary_files_removed", Value(Get(summaryFilesRemoved))},
       {"log_lines_dropped", Value(Get(logLinesDropped))},
       {"connections_open", Value(Get(connectionsOpen))},
       {"sessions_open", Value(Get(sessionsOpen))},

@@ -37,6 +37,9 @@ struct Counters {
   Counter repliesTooLarge{0};     // replies that did not fit a frame (connection closed)
   Counter repliesUnread{0};       // connections closed for leaving too many replies unread
 
+  // The oldest summary files removed to keep their folder within its limits.
+  Counter summaryFilesRemoved{0};
+
   // Drops: there should be none but the store's on a full disk.
   Counter logLinesDropped{0};  // the log's stream was full or gone
 

@@ -5,6 +5,7 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
 #include <cerrno>
 #include <chrono>
@@ -12,6 +13,7 @@
 #include <cstdio>
 #include <ctime>
 #include <utility>
+#include <vector>
 
 namespace qn {
 
@@ -165,6 +167,53 @@ std::optional<Error> CheckPrivateFolder(const std::string& path) {
     return ErrnoError(path + " has mode " + mode + ": others may write to it", EPERM);
   }
   return std::nullopt;
+}
+
+RemovedFiles RemoveOldestFiles(int dir_fd, std::string_view suffix, std::size_t max_files,
+                               std::uint64_t max_bytes, std::string_view keep) {
+  struct Entry {
+    timespec modified;
+    std::string name;
+    std::uint64_t bytes;
+  };
+  std::vector<Entry> entries;
+  std::uint64_t total = 0;
+  // fdopendir takes the descriptor it is given; the caller's stays open.
+  const int own = ::openat(dir_fd, ".", O_RDONLY | O_DIRECTORY | O_CLOEXEC);
+  DIR* stream = own < 0 ? nullptr : ::fdopendir(own);
+  if (!stream) {
+    if (own >= 0) ::close(own);
+    return {};
+  }
+  while (const dirent* entry = ::readdir(stream)) {
+    const std::string_view name = entry->d_name;
+    if (name.starts_with('.') || !name.ends_with(suffix)) continue;
+    struct stat st;
+    if (::fstatat(dir_fd, entry->d_name, &st, AT_SYMLINK_NOFOLLOW) != 0 || !S_ISREG(st.st_mode)) {
+      continue;
+    }
+    entries.push_back({st.st_mtim, std::string(name), static_cast<std::uint64_t>(st.st_size)});
+    total += static_cast<std::uint64_t>(st.st_size);
+  }
+  ::closedir(stream);
+  RemovedFiles removed;
+  if (entries.size() <= max_files && total <= max_bytes) return removed;
+  std::sort(entries.begin(), entries.end(), [](const Entry& a, const Entry& b) {
+    if (a.modified.tv_sec != b.modified.tv_sec) return a.modified.tv_sec < b.modified.tv_sec;
+    if (a.modified.tv_nsec != b.modified.tv_nsec) return a.modified.tv_nsec < b.modified.tv_nsec;
+    return a.name < b.name;
+  });
+  std::size_t count = entries.size();
+  for (const Entry& entry : entries) {
+    if (count <= max_files && total <= max_bytes) break;
+    if (entry.name == keep) continue;
+    if (::unlinkat(dir_fd, entry.name.c_str(), 0) != 0) continue;
+    --count;
+    total -= entry.bytes;
+    ++removed.files;
+    removed.bytes += entry.bytes;
+  }
+  return removed;
 }
 
 std::size_t RemoveTemporaryFiles(const std::string& dir) {

@@ -3,6 +3,7 @@
 #include <sys/types.h>
 
 #include <cstddef>
+#include <cstdint>
 #include <optional>
 #include <string>
 #include <string_view>
@@ -70,6 +71,19 @@ std::optional<Error> OpenOwnFolder(const std::string& base, const std::string& p
 // group nor others may write to (fstat of the folder opened with O_NOFOLLOW, so a folder
 // swapped in between is caught). The error says which of these fails.
 std::optional<Error> CheckPrivateFolder(const std::string& path);
+
+// What RemoveOldestFiles removed.
+struct RemovedFiles {
+  std::size_t files = 0;
+  std::uint64_t bytes = 0;
+};
+
+// Removes the oldest regular files (by modification time, then name) whose names end with
+// `suffix` in the open folder `dir_fd`, until at most `max_files` of them holding at most
+// `max_bytes` remain. Hidden files (a leading ".") are left alone and not counted; `keep`
+// (the file just written) counts but is never removed.
+RemovedFiles RemoveOldestFiles(int dir_fd, std::string_view suffix, std::size_t max_files,
+                               std::uint64_t max_bytes, std::string_view keep);
 
 // Removes the temporary files that WriteFileAtomically leaves in `dir` when the process
 // ends between creating one and renaming it (".<name>.tmp-<...>"). Call it only while no

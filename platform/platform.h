@@ -44,6 +44,12 @@ struct Platform {
   // when another user owns it (common/Files.h, OpenOwnFolder).
   std::string log_dir = "/var/log/quenta";
   std::string diagnostic_logs_dir = "/var/log/quenta/DiagnosticLogs/Audio/Reporting";
+  // The most summary files, and bytes of them, the folder keeps; after each write the
+  // oldest go first.
+  std::size_t max_summary_files = kDefaultMaxSummaryFiles;
+  static constexpr std::size_t kDefaultMaxSummaryFiles = 1000;
+  std::uint64_t max_summary_bytes = kDefaultMaxSummaryBytes;
+  static constexpr std::uint64_t kDefaultMaxSummaryBytes = 64u << 20;
   // The one serial queue that writes summary files, in the order sessions stop, off the
   // thread that stops them. A stop reply is sent only after the queue has run the write
   // that stop queued. Null: a session writes its file on the thread that stops it.

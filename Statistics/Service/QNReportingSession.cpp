@@ -582,6 +582,19 @@ void QNReportingSession::writeSummaryJson() {
     if (writeError) {
       QN_LOG(log, scope.get(), LogLevel::kError, "%s:%d:%s: jsonOutput writeToURL: %@",
              writeError->Description());
+      return;
+    }
+    const RemovedFiles removed = RemoveOldestFiles(
+        folder.get(), ".json", platform->max_summary_files, platform->max_summary_bytes, name);
+    if (removed.files) {
+      Counters::Add(platform->counters->summaryFilesRemoved, removed.files);
+      QN_LOG(log, scope.get(), LogLevel::kDefault,
+             "%s:%d:%s: removed the %lu oldest summary files (%llu bytes) to keep at most %lu "
+             "files and %llu bytes in %@",
+             static_cast<unsigned long>(removed.files),
+             static_cast<unsigned long long>(removed.bytes),
+             static_cast<unsigned long>(platform->max_summary_files),
+             static_cast<unsigned long long>(platform->max_summary_bytes), directory);
     }
   };
   if (platform_->summary_queue) {

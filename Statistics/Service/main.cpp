@@ -106,6 +106,8 @@ struct Limits {
   std::size_t max_pending_bytes = LinuxIpcOptions{}.max_pending_request_bytes;
   std::size_t max_unread_reply_bytes = LinuxIpcOptions{}.max_outgoing_bytes;
   std::size_t store_high_water = 4096;
+  std::size_t max_summary_files = Platform::kDefaultMaxSummaryFiles;
+  std::size_t max_summary_bytes = Platform::kDefaultMaxSummaryBytes;
 };
 
 struct Options {
@@ -209,6 +211,9 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
         "Reply bytes a client may leave unread (not read from 1/8 on)");
   limit("--store-high-water", limits.store_high_water,
         "Messages waiting for the store before senders are held back");
+  limit("--max-summary-files", limits.max_summary_files,
+        "Summary files kept in their folder (the oldest go first)");
+  limit("--max-summary-bytes", limits.max_summary_bytes, "Bytes of summary files kept");
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -319,6 +324,8 @@ int Run(const Options& options) {
   platform->defaults = NewLinuxDefaults({.state_dir = paths.state_dir, .log = log});
   platform->log_dir = paths.log_dir;
   platform->diagnostic_logs_dir = paths.log_dir + "/DiagnosticLogs/Audio/Reporting";
+  platform->max_summary_files = options.limits.max_summary_files;
+  platform->max_summary_bytes = options.limits.max_summary_bytes;
   // Summary files that an earlier run was writing when it ended: nothing writes there yet.
   if (const std::size_t stale = RemoveTemporaryFiles(platform->diagnostic_logs_dir)) {
     QN_LOG(*log, nullptr, LogLevel::kDefault,
