@@ -79,8 +79,9 @@ constexpr const char* kDescription =
 constexpr const char* kFooter = R"(
 Folders: with --home DIR, DIR/run (socket, notifications), DIR/state (store, defaults) and
 DIR/log (summary files). Without --home root uses /run/quenta, /var/lib/quenta and
-/var/log/quenta; other users $XDG_RUNTIME_DIR/quenta, $XDG_STATE_HOME/quenta and
-<state>/log.
+/var/log/quenta; other users $XDG_RUNTIME_DIR/quenta (without it they need --home),
+$XDG_STATE_HOME/quenta and <state>/log; under systemd the unit's folders. Each must belong
+to the daemon's user and be writable by no one else.
 Files: <state>/reports.db (the store), <state>/defaults/com.norvel.quenta.json (the
 defaults), <log>/DiagnosticLogs/Audio/Reporting (summary files, internal builds).
 
