@@ -564,13 +564,13 @@ void QNReportingSession::writeSummaryJson() {
   // so a later file of the same name replaces an earlier one. The folders are opened
   // relative to the log folder, so a symbolic link or a folder of another user planted on
   // the way is refused rather than followed.
-  Task write = [platform = platform_, scope = scope_, directory, name, output = std::move(output)] {
-    Log& log = *platform->log;
+  Task write = [log = platform_->log, counters = platform_->counters, root = platform_->log_dir,
+                maxFiles = platform_->max_summary_files, maxBytes = platform_->max_summary_bytes,
+                scope = scope_, directory, name, output = std::move(output)] {
     FileDescriptor folder;
-    std::optional<Error> folderError =
-        OpenOwnFolder(platform->log_dir, directory, kSummaryFolderMode, folder);
+    std::optional<Error> folderError = OpenOwnFolder(root, directory, kSummaryFolderMode, folder);
     if (folderError) {
-      QN_LOG(log, scope.get(), LogLevel::kError,
+      QN_LOG(*log, scope.get(), LogLevel::kError,
              "%s:%d:%s: can't create logging directory at %@: %@", directory,
              folderError->Description());
     }
@@ -580,21 +580,19 @@ void QNReportingSession::writeSummaryJson() {
             ? folderError
             : WriteFileAtomicallyAt(folder.get(), directory, name, *output, kSummaryFileMode);
     if (writeError) {
-      QN_LOG(log, scope.get(), LogLevel::kError, "%s:%d:%s: jsonOutput writeToURL: %@",
+      QN_LOG(*log, scope.get(), LogLevel::kError, "%s:%d:%s: jsonOutput writeToURL: %@",
              writeError->Description());
       return;
     }
-    const RemovedFiles removed = RemoveOldestFiles(
-        folder.get(), ".json", platform->max_summary_files, platform->max_summary_bytes, name);
+    const RemovedFiles removed = RemoveOldestFiles(folder.get(), ".json", maxFiles, maxBytes, name);
     if (removed.files) {
-      Counters::Add(platform->counters->summaryFilesRemoved, removed.files);
-      QN_LOG(log, scope.get(), LogLevel::kDefault,
+      Counters::Add(counters->summaryFilesRemoved, removed.files);
+      QN_LOG(*log, scope.get(), LogLevel::kDefault,
              "%s:%d:%s: removed the %lu oldest summary files (%llu bytes) to keep at most %lu "
              "files and %llu bytes in %@",
              static_cast<unsigned long>(removed.files),
-             static_cast<unsigned long long>(removed.bytes),
-             static_cast<unsigned long>(platform->max_summary_files),
-             static_cast<unsigned long long>(platform->max_summary_bytes), directory);
+             static_cast<unsigned long long>(removed.bytes), static_cast<unsigned long>(maxFiles),
+             static_cast<unsigned long long>(maxBytes), directory);
     }
   };
   if (platform_->summary_queue) {
