@@ -30,6 +30,7 @@ Dictionary Counters::Snapshot() const {
                                    {"partial_frames", Value(Get(partialFrames))}})},
       {"aggregation_capped", Value(Get(aggregationCapped))},
       {"configuration_capped", Value(Get(configurationCapped))},
+      {"summary_files_removed", Value(Get(summaryFilesRemoved))},
       {"log_lines_dropped", Value(Get(logLinesDropped))},
       {"connections_open", Value(Get(connectionsOpen))},
       {"sessions_open", Value(Get(sessionsOpen))},

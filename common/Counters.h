@@ -42,6 +42,9 @@ struct Counters {
   Counter partialFrames{0};        // connections closed for holding a partial frame too long
   Counter configurationCapped{0};  // configurations held but not merged (session over its cap)
 
+  // The oldest summary files removed to keep their folder within its limits.
+  Counter summaryFilesRemoved{0};
+
   // Drops: there should be none but the store's on a full disk.
   Counter logLinesDropped{0};  // the log's stream was full or gone
 

@@ -52,6 +52,12 @@ std::string StringWithFormat(std::string_view format, const Args&... args) {
   return StringWithFormatArgs(format, std::vector<FormatArg>{FormatArg(args)...});
 }
 
+// `text` with every control character written as an escape, so that a name another
+// process chose (its command name) cannot start a line of its own or move the terminal's
+// cursor: "\n", "\r", "\t" and "\\" as such, other bytes below 0x20 and 0x7f as "\x1b".
+// Other bytes, UTF-8 included, stay as they are.
+std::string EscapeControlCharacters(std::string_view text);
+
 // A missing object for "%@" / "%s": prints "(null)", as the formatter prints an absent object.
 struct NullObject {
   std::string Description() const { return "(null)"; }

@@ -30,6 +30,9 @@ PathEnvironment PathEnvironment::Current() {
   environment.xdg_runtime_dir = AbsoluteVariable("XDG_RUNTIME_DIR");
   environment.xdg_state_home = AbsoluteVariable("XDG_STATE_HOME");
   environment.home = AbsoluteVariable("HOME");
+  environment.runtime_directory = AbsoluteVariable("RUNTIME_DIRECTORY");
+  environment.state_directory = AbsoluteVariable("STATE_DIRECTORY");
+  environment.logs_directory = AbsoluteVariable("LOGS_DIRECTORY");
   if (!environment.home) {
     struct passwd entry;
     struct passwd* found = nullptr;
@@ -54,23 +57,36 @@ Paths ResolvePaths(const PathOptions& options, const PathEnvironment& environmen
     paths.state_dir = "/var/lib/quenta";
     paths.log_dir = "/var/log/quenta";
   } else {
-    const std::string uid = std::to_string(environment.uid);
     if (environment.xdg_runtime_dir && !environment.xdg_runtime_dir->empty()) {
       paths.runtime_dir = WithoutTrailingSlashes(*environment.xdg_runtime_dir) + "/quenta";
-    } else {
-      paths.runtime_dir = "/tmp/quenta-" + uid;
     }
     if (environment.xdg_state_home && !environment.xdg_state_home->empty()) {
       paths.state_dir = WithoutTrailingSlashes(*environment.xdg_state_home) + "/quenta";
     } else if (environment.home && !environment.home->empty()) {
       paths.state_dir = WithoutTrailingSlashes(*environment.home) + "/.local/state/quenta";
-    } else {
-      // No home folder at all (a system user): keep state beside the runtime folder.
-      paths.state_dir = "/tmp/quenta-" + uid + "/state";
     }
-    paths.log_dir = paths.state_dir + "/log";
+    if (!paths.state_dir.empty()) paths.log_dir = paths.state_dir + "/log";
   }
-  paths.socket_path = options.socket ? *options.socket : paths.runtime_dir + "/reporting.sock";
+  // A unit's own folders, made by systemd for the daemon's user, come first.
+  if (!options.home) {
+    for (const auto& [dir, set] : {std::pair{&paths.runtime_dir, &environment.runtime_directory},
+                                   std::pair{&paths.state_dir, &environment.state_directory},
+                                   std::pair{&paths.log_dir, &environment.logs_directory}}) {
+      if (*set && !(*set)->empty()) *dir = WithoutTrailingSlashes(**set);
+    }
+  }
+  if (paths.runtime_dir.empty()) {
+    paths.problem =
+        "XDG_RUNTIME_DIR is not set, and a user other than root has no runtime "
+        "folder without it";
+  } else if (paths.state_dir.empty()) {
+    paths.problem =
+        "neither XDG_STATE_HOME nor a home folder is set, and a user other than "
+        "root has no state folder without them";
+  }
+  paths.socket_path = options.socket              ? *options.socket
+                      : paths.runtime_dir.empty() ? ""
+                                                  : paths.runtime_dir + "/reporting.sock";
   return paths;
 }
 

@@ -38,8 +38,18 @@ struct Platform {
   std::shared_ptr<Enerdex> enerdex;
   std::shared_ptr<Analytics> analytics;
 
-  // The diagnostic-log directory for audio reporting (summary files).
+  // The diagnostic-log directory for audio reporting (summary files), below the daemon's
+  // log folder `log_dir`. The log folder is trusted as it is; every folder below it is made
+  // (0750) and opened relative to the one above, never through a symbolic link, and refused
+  // when another user owns it (common/Files.h, OpenOwnFolder).
+  std::string log_dir = "/var/log/quenta";
   std::string diagnostic_logs_dir = "/var/log/quenta/DiagnosticLogs/Audio/Reporting";
+  // The most summary files, and bytes of them, the folder keeps; after each write the
+  // oldest go first.
+  std::size_t max_summary_files = kDefaultMaxSummaryFiles;
+  static constexpr std::size_t kDefaultMaxSummaryFiles = 1000;
+  std::uint64_t max_summary_bytes = kDefaultMaxSummaryBytes;
+  static constexpr std::uint64_t kDefaultMaxSummaryBytes = 64u << 20;
   // The one serial queue that writes summary files, in the order sessions stop, off the
   // thread that stops them. A stop reply is sent only after the queue has run the write
   // that stop queued. Null: a session writes its file on the thread that stops it.

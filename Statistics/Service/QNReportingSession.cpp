@@ -25,6 +25,9 @@ constexpr std::uint32_t kTraceSessionDestroyed = 0x21042834;
 constexpr std::uint32_t kTraceMessage = 0x21042838;
 
 constexpr const char* kQueueLabel = "com.norvel.quenta.session.livoreporting";
+// Summary files are for the daemon's user and the admins in its group, never for others.
+constexpr mode_t kSummaryFolderMode = 0750;
+constexpr mode_t kSummaryFileMode = 0640;
 constexpr const char* kClientName = "com.norvel.quenta";
 constexpr std::int64_t kClientType = 19;
 constexpr double kClientVersion = 2.0;
@@ -591,22 +594,40 @@ void QNReportingSession::writeSummaryJson() {
       StringWithFormat("%@-%@-%@-%@.json", FormatLocalTime(now, "yyyyMMdd-HHmmssZ"), "quenta",
                        host ? FileNameComponent(host->Description()) : std::string("unknown"),
                        QNReportingServiceTypeName(serviceType()));
-  std::string path = directory;
-  if (path.empty() || path.back() != '/') path += '/';
-  path += name;
 
   // The disk work runs on the summary queue when there is one: one writer, in stop order,
-  // so a later file of the same name replaces an earlier one.
-  Task write = [log = platform_->log, scope = scope_, directory, path = std::move(path),
-                output = std::move(output)] {
-    if (auto error = CreateDirectories(directory, 0777)) {
+  // so a later file of the same name replaces an earlier one. The folders are opened
+  // relative to the log folder, so a symbolic link or a folder of another user planted on
+  // the way is refused rather than followed.
+  Task write = [log = platform_->log, counters = platform_->counters, root = platform_->log_dir,
+                maxFiles = platform_->max_summary_files, maxBytes = platform_->max_summary_bytes,
+                scope = scope_, directory, name, output = std::move(output)] {
+    FileDescriptor folder;
+    std::optional<Error> folderError = OpenOwnFolder(root, directory, kSummaryFolderMode, folder);
+    if (folderError) {
       QN_LOG(*log, scope.get(), LogLevel::kError,
-             "%s:%d:%s: can't create logging directory at %@: %@", directory, error->Description());
+             "%s:%d:%s: can't create logging directory at %@: %@", directory,
+             folderError->Description());
     }
     if (!output) return;  // the serialiser refused: nothing to write
-    if (auto error = WriteFileAtomically(path, *output)) {
+    std::optional<Error> writeError =
+        folderError
+            ? folderError
+            : WriteFileAtomicallyAt(folder.get(), directory, name, *output, kSummaryFileMode);
+    if (writeError) {
       QN_LOG(*log, scope.get(), LogLevel::kError, "%s:%d:%s: jsonOutput writeToURL: %@",
-             error->Description());
+             writeError->Description());
+      return;
+    }
+    const RemovedFiles removed = RemoveOldestFiles(folder.get(), ".json", maxFiles, maxBytes, name);
+    if (removed.files) {
+      Counters::Add(counters->summaryFilesRemoved, removed.files);
+      QN_LOG(*log, scope.get(), LogLevel::kDefault,
+             "%s:%d:%s: removed the %lu oldest summary files (%llu bytes) to keep at most %lu "
+             "files and %llu bytes in %@",
+             static_cast<unsigned long>(removed.files),
+             static_cast<unsigned long long>(removed.bytes), static_cast<unsigned long>(maxFiles),
+             static_cast<unsigned long long>(maxBytes), directory);
     }
   };
   if (platform_->summary_queue) {

@@ -176,9 +176,11 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   // and writes it as pretty JSON to
   // "<diagnostic_logs_dir>/<yyyyMMdd-HHmmssZ>-quenta-<host app or unknown>-<service name>.json".
   // A "/" in the host application name becomes "_" so the file stays in the directory.
-  // The text and the name are fixed here; the directory creation (mode 0777) and the atomic
-  // write run on the platform's summary queue (in the order sessions stop), or here when
-  // the platform has none. Failures are logged, never reported.
+  // The text and the name are fixed here; the folders (0750, made and opened relative to
+  // the log folder, refused when a symbolic link or another user's), the atomic write
+  // (0640) and the removal of the oldest files beyond the platform's limits run on the
+  // platform's summary queue (in the order sessions stop), or here when the platform has
+  // none. Failures are logged, never reported.
   void writeSummaryJson();
 
   // Properties.

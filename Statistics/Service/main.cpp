@@ -83,8 +83,9 @@ constexpr const char* kDescription =
 constexpr const char* kFooter = R"(
 Folders: with --home DIR, DIR/run (socket, notifications), DIR/state (store, defaults) and
 DIR/log (summary files). Without --home root uses /run/quenta, /var/lib/quenta and
-/var/log/quenta; other users $XDG_RUNTIME_DIR/quenta, $XDG_STATE_HOME/quenta and
-<state>/log.
+/var/log/quenta; other users $XDG_RUNTIME_DIR/quenta (without it they need --home),
+$XDG_STATE_HOME/quenta and <state>/log; under systemd the unit's folders. Each must belong
+to the daemon's user and be writable by no one else.
 Files: <state>/reports.db (the store), <state>/defaults/com.norvel.quenta.json (the
 defaults), <log>/DiagnosticLogs/Audio/Reporting (summary files, internal builds).
 
@@ -119,6 +120,8 @@ struct Limits {
   std::size_t max_parked_bytes = 8u << 20;
   std::size_t max_configuration_bytes = Platform{}.max_configuration_bytes;
   std::size_t max_configuration_bytes_total = Platform{}.max_configuration_bytes_total;
+  std::size_t max_summary_files = Platform::kDefaultMaxSummaryFiles;
+  std::size_t max_summary_bytes = Platform::kDefaultMaxSummaryBytes;
 };
 
 struct Options {
@@ -352,6 +355,9 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
   export_option("--device-id", exp.device, "This device's ID (default: from the machine ID)",
                 "QN_DEVICE_ID", "ID")
       ->check(token(""));
+  limit("--max-summary-files", limits.max_summary_files,
+        "Summary files kept in their folder (the oldest go first)");
+  limit("--max-summary-bytes", limits.max_summary_bytes, "Bytes of summary files kept");
   try {
     app.parse(argc, argv);
   } catch (const CLI::ParseError& e) {
@@ -427,11 +433,25 @@ void WaitForSummaryFiles(SerialQueue& queue, Log& log) {
 
 int Run(const Options& options) {
   const Paths paths = ResolvePaths(options.paths);
-  for (const auto& [dir, mode] :
-       {std::pair{paths.runtime_dir, mode_t{0755}}, std::pair{paths.state_dir, mode_t{0750}},
-        std::pair{paths.log_dir, mode_t{0750}}}) {
-    if (auto failure = CreateDirectories(dir, mode)) {
+  if (!paths.problem.empty()) {
+    std::fprintf(stderr, "%s: %s; give --home DIR\n", kProgram, paths.problem.c_str());
+    return 1;
+  }
+  // The folders are the daemon's own: one that another user owns or may write to (made
+  // first in a shared place, say) could hand the socket or the store to that user.
+  // With --home, the folder holding the three must be the daemon's own too.
+  std::vector<std::pair<std::string, mode_t>> folders{
+      {paths.runtime_dir, 0755}, {paths.state_dir, 0750}, {paths.log_dir, 0750}};
+  if (options.paths.home) folders.insert(folders.begin(), {*options.paths.home, 0755});
+  for (const auto& [dir, mode] : folders) {
+    std::optional<Error> failure = CreateDirectories(dir, mode);
+    if (failure) {
       std::fprintf(stderr, "%s: cannot create %s: %s\n", kProgram, dir.c_str(),
+                   failure->Description().c_str());
+      return 1;
+    }
+    if ((failure = CheckPrivateFolder(dir))) {
+      std::fprintf(stderr, "%s: refusing the folder %s: %s\n", kProgram, dir.c_str(),
                    failure->Description().c_str());
       return 1;
     }
@@ -482,7 +502,10 @@ int Run(const Options& options) {
   platform->dispatcher = NewLinuxDispatcher();
   platform->notify = NewLinuxNotify({.runtime_dir = paths.runtime_dir, .log = log});
   platform->defaults = NewLinuxDefaults({.state_dir = paths.state_dir, .log = log});
+  platform->log_dir = paths.log_dir;
   platform->diagnostic_logs_dir = paths.log_dir + "/DiagnosticLogs/Audio/Reporting";
+  platform->max_summary_files = options.limits.max_summary_files;
+  platform->max_summary_bytes = options.limits.max_summary_bytes;
   // Summary files that an earlier run was writing when it ended: nothing writes there yet.
   if (const std::size_t stale = RemoveTemporaryFiles(platform->diagnostic_logs_dir)) {
     QN_LOG(*log, nullptr, LogLevel::kDefault,

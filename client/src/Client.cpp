@@ -109,6 +109,9 @@ class Client::Impl : public std::enable_shared_from_this<Impl> {
   Impl() : socket_(io_) {}
 
   std::string Connect(const std::string& path) {
+    // DefaultSocketPath() is empty for a user other than root without XDG_RUNTIME_DIR: no
+    // socket in a shared folder that another user could have made.
+    if (path.empty()) return "no socket path (XDG_RUNTIME_DIR is not set; name the socket)";
     asio::error_code error;
     socket_.connect(Protocol::endpoint(path), error);
     if (error) return "cannot connect to " + path + ": " + error.message();

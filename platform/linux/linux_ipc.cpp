@@ -43,30 +43,7 @@ std::string ErrnoText(const std::string& what, int error) {
   return what + ": " + std::strerror(error);
 }
 
-// A file descriptor closed on destruction.
-class Fd {
- public:
-  Fd() = default;
-  explicit Fd(int fd) : fd_(fd) {}
-  Fd(Fd&& other) noexcept : fd_(std::exchange(other.fd_, -1)) {}
-  Fd& operator=(Fd&& other) noexcept {
-    if (this != &other) {
-      Reset();
-      fd_ = std::exchange(other.fd_, -1);
-    }
-    return *this;
-  }
-  ~Fd() { Reset(); }
-  int get() const { return fd_; }
-  int release() { return std::exchange(fd_, -1); }
-  void Reset() {
-    if (fd_ >= 0) ::close(fd_);
-    fd_ = -1;
-  }
-
- private:
-  int fd_ = -1;
-};
+using Fd = FileDescriptor;
 
 bool FillAddress(const std::string& path, sockaddr_un& address) {
   std::memset(&address, 0, sizeof address);
@@ -123,7 +100,7 @@ ListeningSocket BindPath(const std::string& path) {
   // Two daemons starting at once must not both decide the socket is stale and unlink each
   // other's: the lock file serialises the check-unlink-bind sequence (and is held for life).
   const std::string lock_path = path + ".lock";
-  result.lock = Fd(::open(lock_path.c_str(), O_RDWR | O_CREAT | O_CLOEXEC, 0600));
+  result.lock = Fd(::open(lock_path.c_str(), O_RDWR | O_CREAT | O_NOFOLLOW | O_CLOEXEC, 0600));
   if (result.lock.get() < 0) {
     result.error = ErrnoText("open " + lock_path, errno);
     return result;
@@ -167,14 +144,20 @@ ListeningSocket BindPath(const std::string& path) {
     result.error = ErrnoText("socket", errno);
     return result;
   }
-  if (::bind(result.fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address) != 0) {
-    result.error = ErrnoText("bind " + path, errno);
+  // The socket file gets mode 0660 as bind makes it, from the umask (bind takes the
+  // socket's mode less the umask), so its mode is never set by path afterwards. The umask
+  // is the process's: files other threads make during this one call get at most 0660.
+  const mode_t umask_before = ::umask(0117);
+  const int bound =
+      ::bind(result.fd.get(), reinterpret_cast<const sockaddr*>(&address), sizeof address);
+  const int bind_errno = errno;
+  ::umask(umask_before);
+  if (bound != 0) {
+    result.error = ErrnoText("bind " + path, bind_errno);
     return result;
   }
   if (::lstat(path.c_str(), &info) == 0) result.bound_inode = info.st_ino;
-  if (::chmod(path.c_str(), 0660) != 0) {
-    result.error = ErrnoText("chmod " + path, errno);
-  } else if (::listen(result.fd.get(), SOMAXCONN) != 0) {
+  if (::listen(result.fd.get(), SOMAXCONN) != 0) {
     result.error = ErrnoText("listen " + path, errno);
   }
   if (!result.error.empty()) {

@@ -10,13 +10,17 @@
 #include <mutex>
 #include <thread>
 
+#include "common/Format.h"
+
 namespace qn {
 namespace {
 
 // The kernel's comm is at most 15 characters plus the terminator; 16 is the hard cap.
 constexpr std::size_t kMaxCommBytes = 16;
 
-// Reads the comm file at `path`, trimmed of its trailing newline.
+// Reads the comm file at `path`, trimmed of its trailing newline. The name is the
+// process's own choice (prctl PR_SET_NAME), so its control characters are escaped here,
+// where every process name the daemon logs or stores comes from.
 std::optional<std::string> ReadComm(const char* path) {
   const int fd = ::open(path, O_RDONLY | O_CLOEXEC);
   if (fd < 0) return std::nullopt;
@@ -30,7 +34,7 @@ std::optional<std::string> ReadComm(const char* path) {
   std::size_t len = static_cast<std::size_t>(n);
   if (buf[len - 1] == '\n') --len;
   if (len > kMaxCommBytes) len = kMaxCommBytes;
-  return std::string(buf, len);
+  return EscapeControlCharacters(std::string_view(buf, len));
 }
 
 class LinuxProcess final : public Process {

@@ -2,6 +2,8 @@
 // and its summary file, clients leaving, killService, signals, the command line.
 #include <gmock/gmock.h>
 #include <gtest/gtest.h>
+#include <sys/prctl.h>
+#include <unistd.h>
 
 #include <algorithm>
 #include <filesystem>
@@ -16,10 +18,12 @@
 namespace qn::e2e {
 namespace {
 
+using ::testing::AllOf;
 using ::testing::Contains;
 using ::testing::ElementsAre;
 using ::testing::EndsWith;
 using ::testing::HasSubstr;
+using ::testing::Not;
 using Table = ReportingStoreRow::Table;
 
 constexpr const char* kUptimeEvent = "com.norvel.quenta.qnreportingclientuptime";
@@ -60,10 +64,15 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   auto started = StartOn(home, {"--driver-stats", stats.path(), "--internal-build"});
   Daemon& daemon = *started;
   ASSERT_TRUE(daemon.started());
+  // A client whose command name holds a newline: it shows escaped in the uptime line and
+  // row, never as a line of its own.
+  const std::string own_name = OwnCommandName();
+  prctl(PR_SET_NAME, "e2e\nFAKE: line");
   auto client = daemon.Connect();
   ASSERT_TRUE(client);
   EXPECT_TRUE(RepliedWithoutError(
       client->sendMessageSync(Value(Dictionary{{"k", "v"}}), 5, 1, std::nullopt)));
+  prctl(PR_SET_NAME, own_name.c_str());  // the name was read before that reply
 
   EXPECT_EQ(client->createReportingSessionSync(42), true);
   EXPECT_EQ(client->setServiceTypeSync(2, 42), true);
@@ -142,7 +151,9 @@ TEST(SessionFlowTest, WholeSessionLandsInTheStore) {
   auto uptime = AnalyticsNamed(rows, "com.norvel.quenta.qnreportingclientuptime");
   ASSERT_EQ(uptime.size(), 2u);  // the readiness probe, then this client
   const Value uptime_payload = Json(uptime[1].payload);
-  EXPECT_EQ(*Field(uptime_payload, "processName"), Value(OwnCommandName()));
+  EXPECT_EQ(*Field(uptime_payload, "processName"), Value("e2e\\nFAKE: line"));
+  EXPECT_THAT(daemon.process().Stderr(), AllOf(HasSubstr(" process=e2e\\nFAKE: line uptime_sec="),
+                                               Not(HasSubstr("\nFAKE: line"))));
   ASSERT_TRUE(Field(uptime_payload, "seconds"));
   EXPECT_GE(Field(uptime_payload, "seconds")->as_double().value_or(-1), 0.0);
 }
@@ -265,6 +276,31 @@ TEST(CommandLineTest, HelpExitsZeroBadArgumentsExitTwo) {
     ChildProcess process(QN_DAEMON_PATH, {bad}, dir.path());
     EXPECT_EQ(process.Wait(), Exited(2)) << bad;
     EXPECT_THAT(process.Stderr(), HasSubstr("qnreportingd: ")) << bad;
+  }
+}
+
+// A runtime folder that is not the daemon's own (another user's, or one others may write
+// to) could hand the socket to someone else: the daemon refuses it and exits with 1.
+TEST(CommandLineTest, ARuntimeFolderNotPrivateExitsOne) {
+  const struct {
+    const char* what;
+    uid_t owner;
+    std::filesystem::perms mode;
+  } cases[] = {
+      {"another user's", 65534, std::filesystem::perms::owner_all},
+      {"writable by others", geteuid(), std::filesystem::perms::all},
+  };
+  for (const auto& c : cases) {
+    if (c.owner != geteuid() && geteuid() != 0) continue;  // only root can give a folder away
+    testing::TempDir home;
+    const std::string run = home.File("run");
+    std::filesystem::create_directories(run);
+    std::filesystem::permissions(run, c.mode);
+    ASSERT_EQ(chown(run.c_str(), c.owner, static_cast<gid_t>(-1)), 0);
+    ChildProcess process(QN_DAEMON_PATH, {"--home", home.path()}, home.path());
+    EXPECT_EQ(process.Wait(), Exited(1)) << c.what;
+    EXPECT_THAT(process.Stderr(), HasSubstr("qnreportingd: refusing the folder " + run)) << c.what;
+    EXPECT_FALSE(std::filesystem::exists(run + "/reporting.sock")) << c.what;
   }
 }
 

@@ -338,12 +338,14 @@ TEST(CApiTest, ConnectFailureDescribesTheProblem) {
 TEST(PathsTest, HomeRootAndOtherUsersFolders) {
   PathEnvironment root;                  // uid 0
   root.xdg_runtime_dir = "/run/user/0";  // ignored for root
-  PathEnvironment user{.uid = 1000,
-                       .xdg_runtime_dir = "/run/user/1000",
-                       .xdg_state_home = "/home/u/.state",
-                       .home = "/home/u"};
-  PathEnvironment bare = user;  // without the XDG variables
+  PathEnvironment user;
+  user.uid = 1000, user.xdg_runtime_dir = "/run/user/1000", user.xdg_state_home = "/home/u/.state";
+  user.home = "/home/u";
+  PathEnvironment bare = user;  // without the XDG variables: no folder in /tmp
   bare.xdg_runtime_dir = bare.xdg_state_home = std::nullopt;
+  PathEnvironment unit = bare;  // a system user under systemd
+  unit.runtime_directory = "/run/quenta", unit.state_directory = "/var/lib/quenta";
+  unit.logs_directory = "/var/log/quenta";
   const struct {
     Paths paths;
     const char *runtime, *state, *log;
@@ -353,14 +355,17 @@ TEST(PathsTest, HomeRootAndOtherUsersFolders) {
       {ResolvePaths({}, root), "/run/quenta", "/var/lib/quenta", "/var/log/quenta"},
       {ResolvePaths({}, user), "/run/user/1000/quenta", "/home/u/.state/quenta",
        "/home/u/.state/quenta/log"},
-      {ResolvePaths({}, bare), "/tmp/quenta-1000", "/home/u/.local/state/quenta",
+      {ResolvePaths({}, bare), "", "/home/u/.local/state/quenta",
        "/home/u/.local/state/quenta/log"},
+      {ResolvePaths({}, unit), "/run/quenta", "/var/lib/quenta", "/var/log/quenta"},
   };
   for (const auto& row : rows) {
-    EXPECT_EQ(row.paths.runtime_dir, row.runtime);
+    const std::string runtime = row.runtime;
+    EXPECT_EQ(row.paths.runtime_dir, runtime);
     EXPECT_EQ(row.paths.state_dir, row.state);
     EXPECT_EQ(row.paths.log_dir, row.log);
-    EXPECT_EQ(row.paths.socket_path, std::string(row.runtime) + "/reporting.sock");
+    EXPECT_EQ(row.paths.socket_path, runtime.empty() ? "" : runtime + "/reporting.sock");
+    EXPECT_EQ(row.paths.problem.empty(), !runtime.empty()) << row.paths.problem;
   }
 }
 

@@ -1,10 +1,13 @@
 // What a session aggregates (messages, orientation changes) and the summary event and file
 // made of it at stop.
 #include <sys/stat.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <atomic>
 #include <filesystem>
 #include <fstream>
+#include <functional>
 #include <thread>
 
 #include "common/Json.h"
@@ -26,7 +29,10 @@ using namespace std::chrono_literals;
 // Summary files go to a temporary folder.
 class SummaryTest : public testing::SessionFixture {
  protected:
-  SummaryTest() { t_.platform->diagnostic_logs_dir = tmp_.File("DiagnosticLogs/Audio/Reporting"); }
+  SummaryTest() {
+    t_.platform->log_dir = tmp_.path();
+    t_.platform->diagnostic_logs_dir = tmp_.File("DiagnosticLogs/Audio/Reporting");
+  }
 
   std::vector<fs::path> SummaryFiles() const {
     std::vector<fs::path> files;
@@ -87,6 +93,9 @@ TEST_F(SummaryTest, SummaryJoinsValuesPerKeyAndGoesOutBeforeTheFlush) {
 
 TEST_F(SummaryTest, InternalBuildWritesPrettyJsonWithUserInfoFirstInsideItsFolder) {
   SetInternal(true);
+  // A folder an earlier version made for anyone to write to is narrowed to 0750.
+  fs::create_directories(tmp_.File("DiagnosticLogs"));
+  fs::permissions(tmp_.File("DiagnosticLogs"), fs::perms::all);
   auto session = NewSession(42, 0);
   session->setConfiguration(Payload({{"HostApplicationDisplayID", "org.example.app"}}));
   session->start();
@@ -110,10 +119,13 @@ TEST_F(SummaryTest, InternalBuildWritesPrettyJsonWithUserInfoFirstInsideItsFolde
   EXPECT_THAT(expected_text, HasSubstr("\n"));
 
   struct stat st {};
-  ASSERT_EQ(stat(t_.platform->diagnostic_logs_dir.c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0777u);
-  ASSERT_EQ(stat(tmp_.File("DiagnosticLogs").c_str(), &st), 0);
-  EXPECT_EQ(st.st_mode & 07777, 0777u);
+  for (const std::string& folder :
+       {t_.platform->diagnostic_logs_dir, tmp_.File("DiagnosticLogs")}) {
+    ASSERT_EQ(stat(folder.c_str(), &st), 0);
+    EXPECT_EQ(st.st_mode & 07777, 0750u) << folder;
+  }
+  ASSERT_EQ(stat(files[0].c_str(), &st), 0);
+  EXPECT_EQ(st.st_mode & 07777, 0640u);
   for (const auto& l : t_.log->Lines()) EXPECT_NE(l.level, LogLevel::kError) << l.text;
 
   // A host application name cannot lead out of the folder.
@@ -132,24 +144,95 @@ TEST_F(SummaryTest, CustomerBuildWritesNothing) {
   EXPECT_EQ(t_.livo->AllSessionMessages().size(), 2u);  // the summary event still went out
 }
 
-TEST_F(SummaryTest, BlockedDirectoryIsLoggedAndStopGoesOn) {
+// A folder on the way to the summary folder that is not the daemon's own: a file, or (made
+// by a child dropped to uid 65534, as a neighbour on the machine would) a symbolic link to
+// a folder elsewhere or a folder of that user. The write is refused, lands nowhere, both
+// errors are logged and the stop goes on.
+TEST_F(SummaryTest, FolderNotOurOwnIsRefusedAndStopGoesOn) {
   SetInternal(true);
-  { std::ofstream(tmp_.File("blocked")) << "x"; }
-  const std::string dir = tmp_.File("blocked/Reporting");
-  t_.platform->diagnostic_logs_dir = dir;
-  auto session = OneMessageSession(0);
-  auto dirLines = t_.log->Matching("can't create logging directory");
-  ASSERT_EQ(dirLines.size(), 1u);
-  // Both lines come from the file-writing lambda and name the method that made it.
-  EXPECT_THAT(dirLines[0], MatchesRegex("QNReportingSession\\.cpp:[0-9]+:QNReportingSession::"
-                                        "writeSummaryJson: can't create logging directory at " +
-                                        dir + ": .+"));
-  EXPECT_EQ(t_.log->Count(":QNReportingSession::writeSummaryJson: jsonOutput writeToURL: "), 1);
-  int errors = 0;
-  for (const auto& l : t_.log->Lines()) errors += l.level == LogLevel::kError;
-  EXPECT_EQ(errors, 2);
-  EXPECT_FALSE(session->started());
-  EXPECT_EQ(t_.livo->Sessions()[0].flushes, 1);
+  const std::string planted = tmp_.File("DiagnosticLogs"), elsewhere = tmp_.File("elsewhere");
+  fs::create_directories(elsewhere);
+  fs::permissions(tmp_.path(), fs::perms::all);  // the neighbour may write in the log folder
+  fs::permissions(elsewhere, fs::perms::all);
+  const auto asNobody = [](const std::function<int()>& plant) {
+    const pid_t child = fork();
+    if (child == 0) _exit(setgid(65534) == 0 && setuid(65534) == 0 && plant() == 0 ? 0 : 1);
+    int status = -1;
+    waitpid(child, &status, 0);
+    return status == 0;
+  };
+  const struct {
+    const char* what;
+    std::function<bool()> plant;
+    bool needsRoot;
+  } cases[] = {
+      {"a file", [&] { return std::ofstream(planted) << "x", true; }, false},
+      {"a symbolic link",
+       [&] { return asNobody([&] { return symlink(elsewhere.c_str(), planted.c_str()); }); }, true},
+      {"another user's folder",
+       [&] { return asNobody([&] { return mkdir(planted.c_str(), 0777); }); }, true},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.what);
+    if (c.needsRoot && geteuid() != 0) continue;
+    fs::remove_all(planted);
+    t_.log->Clear();
+    ASSERT_TRUE(c.plant());
+    auto session = OneMessageSession(0);
+    auto dirLines = t_.log->Matching("can't create logging directory");
+    ASSERT_EQ(dirLines.size(), 1u);
+    EXPECT_THAT(dirLines[0], MatchesRegex("QNReportingSession\\.cpp:[0-9]+:QNReportingSession::"
+                                          "writeSummaryJson: can't create logging directory at " +
+                                          t_.platform->diagnostic_logs_dir + ": .+"));
+    EXPECT_EQ(t_.log->Count(":QNReportingSession::writeSummaryJson: jsonOutput writeToURL: "), 1);
+    int errors = 0;
+    for (const auto& l : t_.log->Lines()) errors += l.level == LogLevel::kError;
+    EXPECT_EQ(errors, 2);
+    EXPECT_FALSE(session->started());
+    EXPECT_EQ(t_.livo->Sessions().back().flushes, 1);
+    EXPECT_TRUE(fs::is_empty(elsewhere));
+  }
+}
+
+// After each write the folder keeps at most its limits, the oldest files (by modification
+// time) removed first, never the file just written; hidden and other files are left alone.
+TEST_F(SummaryTest, OldestSummaryFilesGoBeyondTheLimits) {
+  SetInternal(true);
+  const std::string dir = t_.platform->diagnostic_logs_dir;
+  const struct {
+    std::size_t maxFiles;
+    std::uint64_t maxBytes;
+    std::vector<std::string> left;  // of the files there before
+  } cases[] = {
+      {2, 1u << 20, {"a.json"}},  // the newest; by name it would be c.json
+      {10, 1, {}},                // the new file alone is over the limit, and stays
+      {10, 1u << 20, {"a.json", "b.json", "c.json"}},
+  };
+  for (const auto& c : cases) {
+    fs::remove_all(tmp_.File("DiagnosticLogs"));
+    fs::create_directories(dir);
+    const auto now = fs::file_time_type::clock::now();
+    for (const auto& [name, age] : {std::pair{"c.json", 3}, {"a.json", 1}, {"b.json", 2}}) {
+      std::ofstream(dir + "/" + name) << "0123456789";
+      fs::last_write_time(dir + "/" + name, now - std::chrono::minutes(age));
+    }
+    std::ofstream(dir + "/.x.json.tmp-1") << "x";
+    std::ofstream(dir + "/notes.txt") << "x";
+    t_.platform->max_summary_files = c.maxFiles;
+    t_.platform->max_summary_bytes = c.maxBytes;
+    const auto removedBefore = Counters::Get(t_.platform->counters->summaryFilesRemoved);
+    OneMessageSession(0);
+    std::vector<::testing::Matcher<std::string>> left{".x.json.tmp-1", "notes.txt",
+                                                      EndsWith("-quenta-unknown-generic.json")};
+    left.insert(left.end(), c.left.begin(), c.left.end());
+    std::vector<std::string> names;
+    for (const auto& f : SummaryFiles()) names.push_back(f.filename().string());
+    EXPECT_THAT(names, ::testing::UnorderedElementsAreArray(left));
+    const auto removed = 3 - c.left.size();
+    EXPECT_EQ(Counters::Get(t_.platform->counters->summaryFilesRemoved), removedBefore + removed);
+    EXPECT_EQ(t_.log->Count("oldest summary files"), removed ? 1 : 0);
+    t_.log->Clear();
+  }
 }
 
 TEST_F(SummaryTest, ChangesFiledInSecondsUnregisteredAtStop) {

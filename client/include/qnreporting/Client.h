@@ -60,7 +60,8 @@ using ErrorCallback = std::function<void(const std::optional<ReplyError>&)>;
 using ValueCallback = std::function<void(const Value&)>;
 
 // The socket path a client uses by default: the one the daemon binds when started without
-// --home or --socket by the same user (root: /run/quenta/reporting.sock).
+// --home or --socket by the same user (root: /run/quenta/reporting.sock). Empty for a user
+// other than root without XDG_RUNTIME_DIR (there is no fallback in /tmp); Connect then fails.
 std::string DefaultSocketPath();
 
 // One connection to the service.
