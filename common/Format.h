@@ -16,11 +16,9 @@ namespace qn {
 // Values and objects with a Description() method are accepted.
 class FormatArg {
  public:
-  template <typename T,
-            std::enable_if_t<std::is_integral_v<T> && std::is_signed_v<T>, int> = 0>
+  template <typename T, std::enable_if_t<std::is_integral_v<T> && std::is_signed_v<T>, int> = 0>
   FormatArg(T n) : v_(static_cast<std::int64_t>(n)) {}
-  template <typename T,
-            std::enable_if_t<std::is_integral_v<T> && std::is_unsigned_v<T>, int> = 0>
+  template <typename T, std::enable_if_t<std::is_integral_v<T> && std::is_unsigned_v<T>, int> = 0>
   FormatArg(T n) : v_(static_cast<std::uint64_t>(n)) {}
   FormatArg(double d) : v_(d) {}
   FormatArg(const char* s) : v_(s ? std::string(s) : std::string("(null)")) {}

@@ -131,7 +131,7 @@ struct Options {
   std::optional<std::string> driver_stats;
   std::string debug_scopes;
   Limits limits;
-  std::string metrics_file;  // the counters for Prometheus too, when set
+  std::string metrics_file;       // the counters for Prometheus too, when set
   ReportingStore::Options store;  // its retention: --store-max-bytes, --store-max-age
   bool shared_sessions = false;
   NatsExportOptions export_nats;  // export is on when it names servers

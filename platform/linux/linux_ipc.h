@@ -102,8 +102,8 @@ struct LinuxIpcListenerResult {
 //
 // Flow control (see LinuxIpcOptions): a connection is read only while it has few enough
 // requests waiting in the service, its peer reads its replies, its uid and all uids stay
-// within their byte budgets, and, once it has sent a message, the store keeps up. A connection held back is simply not read; nothing it sent
-// is dropped.
+// within their byte budgets, and, once it has sent a message, the store keeps up. A connection held
+// back is simply not read; nothing it sent is dropped.
 //
 // REQUIRES: `log` is not null.
 LinuxIpcListenerResult NewLinuxIpcListener(const LinuxIpcOptions& options, std::shared_ptr<Log> log,

@@ -139,13 +139,13 @@ TEST(PrometheusTextTest, KnownFiguresAreNamedAndOthersStillAppear) {
                                 {"refused", Value(Dictionary{{"a\"b\\c\n", 1}})},
                                 {"connections_open", 2},
                                 {"pid", 77},
-                                {"export", Value(Dictionary{{"lag_rows", 7}, {"state", "up"}})}});
+                                {"later", Value(Dictionary{{"lag_rows", 7}, {"state", "up"}})}});
   for (const char* line :
        {"# TYPE qnreportingd_requests_total counter\n",
         "qnreportingd_requests_total{op=\"sendMessage\"} 3\n",
         "qnreportingd_refused_total{limit=\"a\\\"b\\\\c\\n\"} 1\n",
         "# TYPE qnreportingd_connections gauge\nqnreportingd_connections 2\n",
-        "# TYPE qnreportingd_export_lag_rows untyped\nqnreportingd_export_lag_rows 7\n"}) {
+        "# TYPE qnreportingd_later_lag_rows untyped\nqnreportingd_later_lag_rows 7\n"}) {
     EXPECT_NE(text.find(line), std::string::npos) << line << " in\n" << text;
   }
   EXPECT_EQ(text.find("77"), std::string::npos) << text;
