@@ -278,7 +278,8 @@ std::optional<Error> WriteFileAtomicallyAt(int dir_fd, const std::string& dir_pa
   return std::nullopt;
 }
 
-std::optional<Error> WriteFileAtomically(const std::string& path, std::string_view contents) {
+std::optional<Error> WriteFileAtomically(const std::string& path, std::string_view contents,
+                                         std::optional<mode_t> mode) {
   const std::size_t slash = path.rfind('/');
   const std::string dir = slash == std::string::npos ? "."
                           : slash == 0               ? "/"
@@ -287,7 +288,7 @@ std::optional<Error> WriteFileAtomically(const std::string& path, std::string_vi
   if (base.empty()) return ErrnoError("write " + path, EISDIR);
   FileDescriptor dir_fd(::open(dir.c_str(), O_RDONLY | O_DIRECTORY | O_CLOEXEC));
   if (dir_fd.get() < 0) return ErrnoError("open " + dir, errno);
-  return WriteFileAtomicallyAt(dir_fd.get(), dir, base, contents, std::nullopt);
+  return WriteFileAtomicallyAt(dir_fd.get(), dir, base, contents, mode);
 }
 
 std::string FormatLocalTime(Date date, std::string_view pattern) {

@@ -44,9 +44,11 @@ std::optional<Error> CreateDirectories(const std::string& path, mode_t mode);
 // Replaces the file at `path` with `contents` atomically: readers see the old file or the
 // whole new one, never a part. Writes a temporary file in the same directory, fsyncs it,
 // renames it over `path` and fsyncs the directory. A new file gets mode 0666 less the
-// umask. On failure no temporary file is left behind and the old file is untouched
-// (unless the failure is the final directory fsync, after the rename).
-std::optional<Error> WriteFileAtomically(const std::string& path, std::string_view contents);
+// umask, or exactly `mode` when one is given. On failure no temporary file is left behind
+// and the old file is untouched (unless the failure is the final directory fsync, after the
+// rename).
+std::optional<Error> WriteFileAtomically(const std::string& path, std::string_view contents,
+                                         std::optional<mode_t> mode = std::nullopt);
 
 // The same inside the open folder `dir_fd` (`dir_path` only names it in error texts); a
 // new file gets exactly `mode` whatever the umask (without one, 0666 less the umask).

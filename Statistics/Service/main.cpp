@@ -395,11 +395,10 @@ Dictionary StatsOf(const Counters& counters, const ReportingStore& store,
                          {"removed", Value(figures.retention_removed)},
                          {"lost", Value(figures.retention_lost)},
                          {"bytes_on_disk", Value(figures.bytes_on_disk)}};
-  if (figures.oldest_row_time) {  // in whole seconds
-    const auto now = std::chrono::system_clock::now().time_since_epoch();
-    store_stats.Set("oldest_row_age",
-                    Value(static_cast<std::int64_t>(std::chrono::duration<double>(now).count() -
-                                                    *figures.oldest_row_time)));
+  // The oldest row's time, not its age: the file then changes only when the store does
+  // (qnreport stats shows the age).
+  if (figures.oldest_row_time) {
+    store_stats.Set("oldest_row_time", Value(static_cast<std::int64_t>(*figures.oldest_row_time)));
   }
   stats.Set("store", Value(std::move(store_stats)));
   if (exporter) stats.Set("export", Value(exporter->Stats()));

@@ -2,6 +2,7 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
+#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -702,9 +703,14 @@ void LinuxConnection::OnPartialFrameTimer() {
     std::lock_guard lock(mu_);
     if (state_ != State::kOpen) return;
   }
-  // Whole frames went through since, or the bytes wait for the service, not for the peer.
+  // Whole frames went through since, or the bytes wait for the service, not for the peer. A
+  // connection held for a budget that others share waits for the service when the rest of
+  // its frame is in the socket, unread because of the hold.
+  int unread = 0;
   const bool waits_for_service =
-      hold_ == Hold::kRequests || hold_ == Hold::kReplies || hold_ == Hold::kStore;
+      hold_ == Hold::kRequests || hold_ == Hold::kReplies || hold_ == Hold::kStore ||
+      (hold_ == Hold::kBudget && ioctl(socket_.native_handle(), FIONREAD, &unread) == 0 &&
+       unread > 0);
   if (frames_read_ != frames_at_watch_ || waits_for_service) {
     WatchPartialFrame();
     return;

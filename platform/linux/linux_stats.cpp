@@ -56,9 +56,11 @@ std::optional<Error> LinuxStatsPublisher::Publish(const Dictionary& stats) {
   std::string text = ToJsonLenient(Value(stats), JsonStyle::kPretty);
   if (text == last_) return std::nullopt;
   text.push_back('\n');
-  std::optional<Error> error = WriteFileAtomically(path_, text);
+  // Readable by all: admins who are not the daemon's user run qnreport stats and top, and
+  // node_exporter reads the metrics (the daemon's umask would make both 0600).
+  std::optional<Error> error = WriteFileAtomically(path_, text, 0644);
   if (!error && !metrics_path_.empty()) {
-    error = WriteFileAtomically(metrics_path_, PrometheusText(stats));
+    error = WriteFileAtomically(metrics_path_, PrometheusText(stats), 0644);
   }
   text.pop_back();
   if (!error) last_ = std::move(text);

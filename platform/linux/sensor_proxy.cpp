@@ -31,7 +31,7 @@ constexpr const char* kPropertiesRule =
 
 // An sd_bus_error that frees itself, with the text to log.
 struct BusError {
-  sd_bus_error error = SD_BUS_ERROR_NULL;
+  sd_bus_error error{};  // SD_BUS_ERROR_NULL, which C++ compilers may refuse (a compound literal)
   ~BusError() { sd_bus_error_free(&error); }
   std::string Text(int r) const {
     return error.message ? error.message : std::string(std::strerror(-r));

@@ -393,6 +393,14 @@ int RunStats(const Paths& paths, bool json, std::ostream& out, std::ostream& err
   }
   std::vector<std::pair<std::string, std::string>> rows;
   FlattenStats(stats.stats, "", rows);
+  const Value* store = stats.stats.Find("store");
+  const Value* oldest =
+      store && store->as_dictionary() ? store->as_dictionary()->Find("oldest_row_time") : nullptr;
+  if (oldest && oldest->as_double()) {
+    const double age = Date::Now().seconds_since_1970 - *oldest->as_double();
+    rows.emplace_back("store.oldest_row_age",
+                      std::to_string(static_cast<std::int64_t>(age)) + " s");
+  }
   std::size_t width = 0;
   for (const auto& row : rows) width = std::max(width, row.first.size());
   for (const auto& [name, value] : rows) {
