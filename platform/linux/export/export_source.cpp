@@ -81,10 +81,6 @@ const char* ExportKindName(ExportKind kind) {
   return "";
 }
 
-void ExportSource::StatementDeleter::operator()(sqlite3_stmt* stmt) const {
-  sqlite3_finalize(stmt);
-}
-
 std::unique_ptr<ExportSource> ExportSource::Open(const std::string& path, std::string device,
                                                  std::optional<Error>* error) {
   sqlite3* db = nullptr;

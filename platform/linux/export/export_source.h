@@ -8,9 +8,7 @@
 #include <vector>
 
 #include "common/Error.h"
-
-struct sqlite3;
-struct sqlite3_stmt;
+#include "platform/linux/store/sqlite.h"
 
 namespace qn {
 
@@ -75,10 +73,7 @@ class ExportSource {
   ExportSource(sqlite3* db, std::string device);
 
  private:
-  struct StatementDeleter {
-    void operator()(sqlite3_stmt* stmt) const;
-  };
-  using Statement = std::unique_ptr<sqlite3_stmt, StatementDeleter>;
+  using Statement = store::Statement;
   std::optional<Error> Prepare(Statement& stmt, const char* sql);
   Error Failure(const std::string& what) const;
   void AppendBody(ExportKind kind, sqlite3_stmt* stmt, ExportRow& row);
