@@ -514,12 +514,13 @@ int Run(const Options& options) {
   platform->summary_queue = platform->dispatcher->CreateSerialQueue(
       "com.norvel.quenta.reporting.summaries", QualityOfService::kBackground);
   // killService exits at once; the summary files queued and what was handed to the store
-  // are written out first.
-  platform->process =
-      NewLinuxProcess([summaries = std::weak_ptr<SerialQueue>(platform->summary_queue),
-                       drain_store = store->DrainHook(), log] {
+  // are written out first, then the exporter saves how far it got (as at SIGTERM).
+  platform->process = NewLinuxProcess(
+      [summaries = std::weak_ptr<SerialQueue>(platform->summary_queue),
+       drain_store = store->DrainHook(), log, exporting = std::weak_ptr<NatsExporter>(exporter)] {
         if (auto queue = summaries.lock()) WaitForSummaryFiles(*queue, *log);
         drain_store();
+        if (auto running = exporting.lock()) running->Stop();
       });
   platform->device_info = NewLinuxDeviceInfo(
       {.path = options.device_info, .internal_build = options.internal_build, .log = log});
