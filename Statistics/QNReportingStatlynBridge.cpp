@@ -18,6 +18,7 @@ void QNReportingStatlynBridge::handleEvent(const Platform& platform, const Dicti
   std::shared_ptr<const Dictionary> userInfo = session ? session->userInfo() : nullptr;
   std::string host = QNReportingHostApplicationName(userInfo.get());
   std::shared_ptr<const Dictionary> payload;
+  std::size_t bytes = 0;  // counted by the event that made the copy, once
   if (shared && shared->payload && shared->host == host) {
     payload = shared->payload;
   } else {
@@ -28,6 +29,7 @@ void QNReportingStatlynBridge::handleEvent(const Platform& platform, const Dicti
     if (message) copy = *message;
     copy.Set("HostApplicationDisplayID", host);
     payload = std::make_shared<const Dictionary>(std::move(copy));
+    bytes = Value(payload).ApproximateBytes();
     if (shared) *shared = SharedPayload{std::move(host), payload};
   }
   // "com.norvel.quenta.%@.%@" of the two names, once per message: plain concatenation.
@@ -35,7 +37,8 @@ void QNReportingStatlynBridge::handleEvent(const Platform& platform, const Dicti
   name += QNReportingCategoryName(category);
   name += '.';
   name += QNReportingTypeName(type);
-  platform.analytics->SendEventLazy(name, [payload] { return Value(payload); });
+  platform.analytics->SendEventLazy(
+      name, [payload] { return Value(payload); }, bytes);
 }
 
 }  // namespace qn

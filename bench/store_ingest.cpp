@@ -148,9 +148,9 @@ double Store(const std::string& path, long messages, Events events) {
   const double cpu_start = CpuSeconds();
   for (long i = 0; i < messages; ++i) {
     if (events != Events::kNone) {
-      analytics->SendEventLazy("com.norvel.quenta.Bench.Stop", [&event_payloads, i] {
-        return event_payloads[static_cast<std::size_t>(i) & 1023];
-      });
+      analytics->SendEventLazy(
+          "com.norvel.quenta.Bench.Stop",
+          [&event_payloads, i] { return event_payloads[static_cast<std::size_t>(i) & 1023]; }, 0);
     }
     session->SendMessage(5, 2, payloads[static_cast<std::size_t>(i) & 1023], nullptr);
   }

@@ -32,6 +32,9 @@ struct Counters {
   // Times a connection stopped being read because its uid, or all uids, held a byte budget
   // of the IPC layer (index: platform/linux/linux_ipc.h's IpcBudget: request, frame, reply).
   std::array<Counter, 3> pausedForBudget{};
+  // Times a connection stopped being read because the service held too many bytes for its
+  // uid (index: common/HeldBytes.h's Kind: messages waiting for the store, parked messages).
+  std::array<Counter, 2> pausedForHeld{};
 
   // Limits: what was refused and why.
   Counter connectionsRefused{0};   // over the connection limit

@@ -70,6 +70,12 @@ inline constexpr std::int64_t kLastConnectionError = 10;
 // Whether only root and the daemon's own uid may make requests of `op` (killService:).
 inline bool IsPrivileged(Op op) { return op == Op::kKillService; }
 
+// Room to keep for the reply to a request of `op` while the service works on it, so that
+// requests already handed over cannot make more reply bytes than a budget allows: a whole
+// frame for getAllReporters (its ID list grows with the sessions), a short error reply's
+// worth for every other operation (their replies are a flag, a name or an error).
+inline std::size_t ReplyRoomOf(Op op) { return op == Op::kGetAllReporters ? kMaxBodyBytes : 256; }
+
 // Checks a decoded request against the operation table. On success returns the op and
 // request id and leaves the arguments (args[2..]) as they are; on failure returns the
 // error code and a message fit for the error frame.

@@ -6,6 +6,7 @@
 #include <memory>
 #include <string>
 
+#include "common/HeldBytes.h"
 #include "common/Protocol.h"
 #include "common/Value.h"
 
@@ -42,6 +43,10 @@ class IpcConnection {
   // The peer's process and user identifiers (SO_PEERCRED), fixed at accept.
   virtual pid_t PeerPid() const = 0;
   virtual uid_t PeerUid() const = 0;
+  // What the service holds for the peer's uid beyond the IPC layer's buffers: one account
+  // for every connection of that uid, kept while anything holds it (a reconnecting peer
+  // finds its bytes still counted). Never null.
+  virtual std::shared_ptr<HeldBytes> PeerHeldBytes() const = 0;
   // A one-line description for logs.
   virtual std::string Description() const = 0;
 

@@ -64,10 +64,12 @@ struct Platform {
   // The same for all sessions together (counted in counters->aggregatedBytes).
   std::size_t max_aggregated_bytes_total = kDefaultMaxAggregatedBytesTotal;
   static constexpr std::size_t kDefaultMaxAggregatedBytesTotal = 32u << 20;
-  // The configuration bytes (user info, Value::ApproximateBytes) one session keeps, and all
-  // sessions together (counted in counters->configurationBytes). A configuration that would
-  // pass either is acknowledged but not merged.
+  // The configuration bytes (user info, Value::ApproximateBytes) one session keeps, the
+  // sessions of one uid (counted in its HeldBytes), and all sessions together (counted in
+  // counters->configurationBytes). A configuration that would pass any is acknowledged but
+  // not merged.
   std::size_t max_configuration_bytes = 64u << 10;
+  std::size_t max_configuration_bytes_per_uid = 4u << 20;
   std::size_t max_configuration_bytes_total = 8u << 20;
 
   // Process-wide state that is computed once (the internal-build flag). It lives here so

@@ -102,21 +102,22 @@ std::vector<std::shared_ptr<QNReportingSession>> QNReportingSessionRegistry::Ali
 // QNReportingServerInstance
 
 std::shared_ptr<QNReportingServerInstance> QNReportingServerInstance::initWithPID(
-    pid_t pid, uid_t uid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
-    QNReportingServerContext context) {
+    pid_t pid, uid_t uid, std::shared_ptr<HeldBytes> heldBytes,
+    std::weak_ptr<QNReportingServiceDelegateProtocol> delegate, QNReportingServerContext context) {
   QN_LOG(context.log(), context.scope(), LogLevel::kDefault, "%s:%d:%s: new client with pid %lu",
          static_cast<unsigned long>(pid));
-  return std::make_shared<QNReportingServerInstance>(Token{}, pid, uid, std::move(delegate),
-                                                     std::move(context));
+  return std::make_shared<QNReportingServerInstance>(Token{}, pid, uid, std::move(heldBytes),
+                                                     std::move(delegate), std::move(context));
 }
 
 QNReportingServerInstance::QNReportingServerInstance(
-    Token, pid_t pid, uid_t uid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
-    QNReportingServerContext context)
+    Token, pid_t pid, uid_t uid, std::shared_ptr<HeldBytes> heldBytes,
+    std::weak_ptr<QNReportingServiceDelegateProtocol> delegate, QNReportingServerContext context)
     : context_(std::move(context)),
       delegate_(std::move(delegate)),
       processIdentifier_(pid),
-      peerUid_(uid) {}
+      peerUid_(uid),
+      heldBytes_(std::move(heldBytes)) {}
 
 std::optional<uid_t> QNReportingServerInstance::sessionScope() const {
   if (context_.sharedSessions || peerUid_ == 0) return std::nullopt;
@@ -162,8 +163,10 @@ template <typename Work>
 void QNReportingServerInstance::OnServerQueue(Work work) {
   // Requests arrive on the IPC thread; when the server queue is idle the request runs there
   // at once (in order, the queue held), which saves two thread hand-offs per request.
-  context_.serverQueue->AsyncOrRun(
-      [self = shared_from_this(), work = std::move(work)]() mutable { work(*self); });
+  context_.serverQueue->AsyncOrRun([self = shared_from_this(), work = std::move(work)]() mutable {
+    const HeldBytes::Charge charge(self->heldBytes_);
+    work(*self);
+  });
 }
 
 // ---------------------------------------------------------------------------------------

@@ -15,6 +15,7 @@
 #include "Statistics/Service/QNReportingServerContext.h"
 #include "Statistics/Service/QNReportingServiceDelegateProtocol.h"
 #include "Statistics/Service/QNReportingServiceProtocol.h"
+#include "common/HeldBytes.h"
 #include "common/Value.h"
 
 namespace qn {
@@ -73,9 +74,12 @@ class QNReportingServerInstance final
 
   // Makes the instance for peer `pid` of user `uid` (logs "new client with pid"), with an
   // empty session map. `context` supplies the platform, the server queue and the log scope.
+  // `heldBytes` (may be null) is the uid's account (IpcConnection::PeerHeldBytes): the
+  // client's requests run charged to it (HeldBytes::Charge), so what they make the daemon
+  // hold (store records, parked messages, its sessions' configurations) counts there.
   static std::shared_ptr<QNReportingServerInstance> initWithPID(
-      pid_t pid, uid_t uid, std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
-      QNReportingServerContext context);
+      pid_t pid, uid_t uid, std::shared_ptr<HeldBytes> heldBytes,
+      std::weak_ptr<QNReportingServiceDelegateProtocol> delegate, QNReportingServerContext context);
 
   // Logs "dealloc <pid> from the server client list"; the sessions go with the map.
   ~QNReportingServerInstance() override;
@@ -141,7 +145,7 @@ class QNReportingServerInstance final
 
  public:
   // Use initWithPID.
-  QNReportingServerInstance(Token, pid_t pid, uid_t uid,
+  QNReportingServerInstance(Token, pid_t pid, uid_t uid, std::shared_ptr<HeldBytes> heldBytes,
                             std::weak_ptr<QNReportingServiceDelegateProtocol> delegate,
                             QNReportingServerContext context);
 
@@ -154,6 +158,7 @@ class QNReportingServerInstance final
   const std::weak_ptr<QNReportingServiceDelegateProtocol> delegate_;
   const pid_t processIdentifier_;
   const uid_t peerUid_;
+  const std::shared_ptr<HeldBytes> heldBytes_;
 
   mutable std::mutex propertyLock_;               // guards the two properties below only
   std::optional<Date> clientStartDate_;           // GUARDED_BY(propertyLock_)

@@ -84,8 +84,8 @@ bool QNReportingServiceDelegate::ShouldAcceptNewConnection(
   // The instance logs its creation, and the connection guards itself, so both happen
   // outside the monitor, which is never held while another lock is taken.
   std::weak_ptr<QNReportingServiceDelegateProtocol> weakSelf = shared_from_this();
-  auto instance =
-      QNReportingServerInstance::initWithPID(pid, connection->PeerUid(), weakSelf, context_);
+  auto instance = QNReportingServerInstance::initWithPID(
+      pid, connection->PeerUid(), connection->PeerHeldBytes(), weakSelf, context_);
   std::shared_ptr<IpcExportedObject> exported;
   {
     std::lock_guard monitor(lock_);
@@ -153,8 +153,9 @@ void QNReportingServiceDelegate::ConnectionEnded(
         {"processName", *processName},
         {"seconds", uptime},
     });
-    context_.platform->analytics->SendEventLazy(kQNReportingClientUptimeEvent,
-                                                [payload] { return Value(payload); });
+    const std::size_t bytes = Value(payload).ApproximateBytes();
+    context_.platform->analytics->SendEventLazy(
+        kQNReportingClientUptimeEvent, [payload] { return Value(payload); }, bytes);
   } else {
     QN_LOG(context_.log(), context_.scope(), LogLevel::kDefault,
            "%s:%d:%s: clientProcessName is nil. clientpid=%d", pid);

@@ -124,6 +124,7 @@ QNReportingSession::QNReportingSession(Token, std::shared_ptr<const Platform> pl
                                        std::shared_ptr<const LogScope> scope,
                                        std::int64_t reporterID, Array processIdentifiers)
     : platform_(std::move(platform)),
+      heldBytes_(HeldBytes::Charge::Current()),
       scope_(std::move(scope)),
       processIdentifiers_(std::move(processIdentifiers)),
       livoReportingQueue_(
@@ -135,8 +136,7 @@ QNReportingSession::QNReportingSession(Token, std::shared_ptr<const Platform> pl
       nestedAggregatedPayloadData_(std::make_shared<QNReportingPayloadArray>()) {}
 
 QNReportingSession::~QNReportingSession() {
-  Counters::Add(platform_->counters->configurationBytes,
-                -static_cast<std::int64_t>(userInfoBytes_));
+  CountUserInfoBytes(0);
   TracePoint(*platform_, kTraceSessionDestroyed);
   SESSION_LOG(LogLevel::kInfo, "%s:%d:%s: deallocing this session %lli", reporterID());
 }
@@ -148,11 +148,14 @@ void QNReportingSession::MergeUserInfo(const Dictionary* entries, bool capped) {
   const std::size_t bytes = Value(std::shared_ptr<const Dictionary>(merged)).ApproximateBytes();
   Counters& counters = *platform_->counters;
   if (capped && bytes > userInfoBytes_) {
+    const std::size_t more = bytes - userInfoBytes_;
     const auto total = static_cast<std::size_t>(
         std::max<std::int64_t>(0, Counters::Get(counters.configurationBytes)));
+    const auto ofUid = static_cast<std::size_t>(
+        heldBytes_ ? std::max<std::int64_t>(0, heldBytes_->Get(HeldBytes::kConfiguration)) : 0);
     const bool sessionFull = bytes > platform_->max_configuration_bytes;
-    if (sessionFull ||
-        total + (bytes - userInfoBytes_) > platform_->max_configuration_bytes_total) {
+    const bool uidFull = heldBytes_ && ofUid + more > platform_->max_configuration_bytes_per_uid;
+    if (sessionFull || uidFull || total + more > platform_->max_configuration_bytes_total) {
       Counters::Add(counters.configurationCapped);
       if (!std::exchange(configurationCapped_, true)) {
         if (sessionFull) {
@@ -160,6 +163,12 @@ void QNReportingSession::MergeUserInfo(const Dictionary* entries, bool capped) {
                       "%s:%d:%s: session %lli would hold more than %zu bytes of configuration, the "
                       "most it keeps; later configurations are acknowledged but not merged",
                       reporterID(), platform_->max_configuration_bytes);
+        } else if (uidFull) {
+          SESSION_LOG(LogLevel::kError,
+                      "%s:%d:%s: the sessions of one user hold %zu bytes of configuration, the "
+                      "most they keep; later configurations of session %lli are acknowledged but "
+                      "not merged",
+                      platform_->max_configuration_bytes_per_uid, reporterID());
         } else {
           SESSION_LOG(LogLevel::kError,
                       "%s:%d:%s: the sessions hold %zu bytes of configuration in all, the most "
@@ -171,10 +180,16 @@ void QNReportingSession::MergeUserInfo(const Dictionary* entries, bool capped) {
       return;
     }
   }
-  Counters::Add(counters.configurationBytes,
-                static_cast<std::int64_t>(bytes) - static_cast<std::int64_t>(userInfoBytes_));
-  userInfoBytes_ = bytes;
+  CountUserInfoBytes(bytes);
   userInfo_.store(std::move(merged));
+}
+
+void QNReportingSession::CountUserInfoBytes(std::size_t bytes) {
+  const std::int64_t change =
+      static_cast<std::int64_t>(bytes) - static_cast<std::int64_t>(userInfoBytes_);
+  Counters::Add(platform_->counters->configurationBytes, change);
+  if (heldBytes_) heldBytes_->Add(HeldBytes::kConfiguration, change);
+  userInfoBytes_ = bytes;
 }
 
 void QNReportingSession::setUserInfo(std::shared_ptr<const Dictionary> info) {
@@ -436,10 +451,12 @@ void QNReportingSession::sendMessage(std::shared_ptr<const Dictionary> payload,
   const bool wasStarted = started();
   Counters::Add(counters.deliveriesQueued, 1);
   // An idle session queue delivers at once on this thread (the delivery only hands the
-  // message to the framework), in order, without a hand-off to another thread.
+  // message to the framework), in order, without a hand-off to another thread. The
+  // delivery is charged to whoever is charged for the send.
   livoReportingQueue_->AsyncOrRun([self = shared_from_this(), converted,
-                                   payload = std::move(payload), category, type,
-                                   wasStarted]() mutable {
+                                   payload = std::move(payload), category, type, wasStarted,
+                                   charged = HeldBytes::Charge::Current()]() mutable {
+    const HeldBytes::Charge charge(std::move(charged));
     Counters::Add(self->platform_->counters->deliveriesQueued, -1);
     self->Deliver(std::move(converted), std::move(payload), category, type, wasStarted);
   });
@@ -492,14 +509,20 @@ void QNReportingSession::sendSingleMessage(const std::shared_ptr<const Platform>
 
   // A delayed message is counted while it waits, so that the daemon stops reading senders
   // while too many bytes wait (docs/daemon.md, "max-parked-bytes").
+  // It counts for its sender's uid too (the account charged now), and its store record is
+  // charged to that account when it is sent.
   const std::int64_t parked =
       delay > 0 && payload ? static_cast<std::int64_t>(Value(payload).ApproximateBytes()) : 0;
+  std::shared_ptr<HeldBytes> charged = HeldBytes::Charge::Current();
   Counters::Add(platform->counters->parkedBytes, parked);
+  if (charged) charged->Add(HeldBytes::kParked, parked);
   platform->dispatcher->AsyncGlobal(
       QualityOfService::kBackground, std::chrono::seconds(delay),
       [platform, scope, payload = std::move(payload), category, type, serviceType, parked,
-       reply = std::move(reply)] {
+       charged = std::move(charged), reply = std::move(reply)] {
         Counters::Add(platform->counters->parkedBytes, -parked);
+        if (charged) charged->Add(HeldBytes::kParked, -parked);
+        const HeldBytes::Charge charge(charged);
         TracePoint(*platform, kTraceMessage);
         QN_LOG(*platform->log, scope.get(), LogLevel::kDebug, "%s:%d:%s: sending single message");
         Dictionary sessionInfo{{kLivoReportingSessionInfoClientType, kClientType},

@@ -10,6 +10,7 @@
 #include <string>
 
 #include "common/Error.h"
+#include "common/HeldBytes.h"
 #include "common/Value.h"
 #include "platform/platform.h"
 
@@ -93,7 +94,8 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   // counts and aggregation arrays, and its own serial queue
   // ("com.norvel.quenta.session.livoreporting", utility class). Logs the creation and
   // emits its trace point. Returns null when `platform` lacks a log or a dispatcher.
-  // `processIdentifiers` is kept, never read.
+  // `processIdentifiers` is kept, never read. The session's configuration counts in the
+  // HeldBytes account charged on the calling thread (its creator's uid), if any.
   static std::shared_ptr<QNReportingSession> initWithID(std::shared_ptr<const Platform> platform,
                                                         std::int64_t reporterID,
                                                         Array processIdentifiers);
@@ -107,8 +109,9 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   // Merges every entry of `configuration` into userInfo (later values replace earlier ones
   // under the same key); null changes nothing. Works in any state. userInfo is replaced by
   // a merged copy, so snapshots taken earlier stay as they were. A configuration that would
-  // take userInfo past the platform's max_configuration_bytes, or all sessions' user info
-  // past max_configuration_bytes_total, is not merged (counted; logged once per session).
+  // take userInfo past the platform's max_configuration_bytes, the creator's uid's sessions
+  // past max_configuration_bytes_per_uid, or all sessions' user info past
+  // max_configuration_bytes_total, is not merged (counted; logged once per session).
   // updateDefaults merges the same way, without the caps (the defaults are the daemon's).
   // REQUIRES: on the request handler's thread.
   void setConfiguration(const Dictionary* configuration) { MergeUserInfo(configuration, true); }
@@ -254,6 +257,8 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
   void RegisterOrientationCallbacks(const std::string& callbackID);
   void HandleOrientation(bool device, std::int32_t orientation);
   void MergeUserInfo(const Dictionary* entries, bool capped);
+  // Sets userInfoBytes_, counting the change in the counters and the creator's account.
+  void CountUserInfoBytes(std::size_t bytes);
   // Appends `item` of `bytes` unless that would take the array past `cap` bytes, or every
   // counted array together past `totalCap`.
   enum class AppendResult { kAppended, kGone, kSessionFull, kAllFull };
@@ -262,6 +267,7 @@ class QNReportingSession : public std::enable_shared_from_this<QNReportingSessio
                              std::size_t totalCap = SIZE_MAX);
 
   const std::shared_ptr<const Platform> platform_;
+  const std::shared_ptr<HeldBytes> heldBytes_;   // the creator's uid's; may be null
   const std::shared_ptr<const LogScope> scope_;  // "qnrr"; null = the default log
   const Array processIdentifiers_;
   const std::shared_ptr<SerialQueue> livoReportingQueue_;

@@ -117,8 +117,11 @@ struct Limits {
   std::array<IpcByteBudget, kIpcBudgetCount> ipc_budgets = LinuxIpcOptions{}.budgets;
   std::size_t partial_frame_timeout_s = LinuxIpcOptions{}.partial_frame_timeout_ms / 1000;
   std::size_t store_high_water_bytes = 16u << 20;
+  std::size_t max_store_bytes_per_uid = LinuxIpcOptions{}.max_store_bytes_per_uid;
   std::size_t max_parked_bytes = 8u << 20;
+  std::size_t max_parked_bytes_per_uid = LinuxIpcOptions{}.max_parked_bytes_per_uid;
   std::size_t max_configuration_bytes = Platform{}.max_configuration_bytes;
+  std::size_t max_configuration_bytes_per_uid = Platform{}.max_configuration_bytes_per_uid;
   std::size_t max_configuration_bytes_total = Platform{}.max_configuration_bytes_total;
   std::size_t max_summary_files = Platform::kDefaultMaxSummaryFiles;
   std::size_t max_summary_bytes = Platform::kDefaultMaxSummaryBytes;
@@ -287,10 +290,16 @@ std::optional<int> ParseCommandLine(int argc, char** argv, Options& options) {
         "Seconds a connection may hold a partial frame (at most 86400)", 86400);
   limit("--store-high-water-bytes", limits.store_high_water_bytes,
         "Payload bytes waiting for the store before senders are held back");
+  limit("--max-store-bytes-per-uid", limits.max_store_bytes_per_uid,
+        "The same for one user's messages (only that user's senders are held back)");
   limit("--max-parked-bytes", limits.max_parked_bytes,
         "Payload bytes of delayed single messages before senders are held back");
+  limit("--max-parked-bytes-per-uid", limits.max_parked_bytes_per_uid,
+        "The same for one user's messages");
   limit("--max-configuration-bytes", limits.max_configuration_bytes,
         "Configuration bytes a session keeps");
+  limit("--max-configuration-bytes-per-uid", limits.max_configuration_bytes_per_uid,
+        "The same for all sessions of one user");
   limit("--max-configuration-bytes-total", limits.max_configuration_bytes_total,
         "The same for all sessions together");
   // Export to NATS JetStream (docs/export.md). Each option may also come from the
@@ -495,6 +504,7 @@ int Run(const Options& options) {
   platform->max_aggregated_bytes = options.limits.max_aggregated_bytes;
   platform->max_aggregated_bytes_total = options.limits.max_aggregated_bytes_total;
   platform->max_configuration_bytes = options.limits.max_configuration_bytes;
+  platform->max_configuration_bytes_per_uid = options.limits.max_configuration_bytes_per_uid;
   platform->max_configuration_bytes_total = options.limits.max_configuration_bytes_total;
   platform->log = log;
   platform->trace = NewLinuxTrace();
@@ -562,6 +572,8 @@ int Run(const Options& options) {
   ipc_options.max_reporter_ids = options.limits.max_reporter_ids;
   ipc_options.max_connections_per_uid = options.limits.max_connections_per_uid;
   ipc_options.budgets = options.limits.ipc_budgets;
+  ipc_options.max_store_bytes_per_uid = options.limits.max_store_bytes_per_uid;
+  ipc_options.max_parked_bytes_per_uid = options.limits.max_parked_bytes_per_uid;
   ipc_options.partial_frame_timeout_ms =
       static_cast<int>(options.limits.partial_frame_timeout_s * 1000);
   // Messages waiting in the sessions' queues and in the store's queue (counted and in

@@ -192,6 +192,7 @@ class LinuxIpcListener;
 struct IpcUse {
   std::size_t connections = 0;  // io_context thread only
   std::array<std::atomic<std::size_t>, kIpcBudgetCount> bytes{};
+  std::shared_ptr<HeldBytes> held;  // a uid's: what the service holds for it; set at accept
 };
 
 // One accepted connection. Lives as long as its pending asio operations, the listener's
@@ -211,6 +212,7 @@ class LinuxConnection final : public IpcConnection,
 
   pid_t PeerPid() const override { return pid_; }
   uid_t PeerUid() const override { return uid_; }
+  std::shared_ptr<HeldBytes> PeerHeldBytes() const override { return uid_use_->held; }
   std::string Description() const override { return description_; }
 
   void SetExportedObject(std::shared_ptr<IpcExportedObject> object) override {
@@ -226,7 +228,8 @@ class LinuxConnection final : public IpcConnection,
 
   // Frames [request_id, result] and queues it. Any thread; dropped once the error frame
   // is queued or the connection ended.
-  void QueueReply(std::uint32_t request_id, Value result);
+  // `room` is what was kept for this reply (protocol::ReplyRoomOf) and is given back.
+  void QueueReply(std::uint32_t request_id, Value result, std::size_t room);
 
   // Sends the error frame at once and closes the connection once it is written (or after
   // the flush time-out): a connection refused at accept. io_context thread.
@@ -328,6 +331,9 @@ class LinuxConnection final : public IpcConnection,
   bool read_in_flight_ = false;
   Hold hold_ = Hold::kNone;
   IpcBudget held_budget_ = kIpcRequestBytes;  // which budget, while hold_ is kBudget
+  // While hold_ is kStore: the uid's bytes of this kind passed their limit (kKindCount:
+  // the store, or everyone's parked messages, is behind).
+  HeldBytes::Kind held_kind_ = HeldBytes::kKindCount;
   std::uint64_t frames_read_ = 0;
   std::uint64_t frames_at_watch_ = 0;  // frames_read_ when the partial frame timer started
   std::uint64_t frame_watch_ = 0;      // the partial frame timer's current run
@@ -347,6 +353,7 @@ class LinuxConnection final : public IpcConnection,
   std::string pending_;            // guarded by mu_: framed replies not yet handed to a write
   std::string writing_;            // the bytes of the write in flight (io thread while writing)
   std::size_t writing_bytes_ = 0;  // guarded by mu_: writing_.size() while a write is in flight
+  std::size_t reply_room_ = 0;     // guarded by mu_: kept for replies not yet made
   bool write_active_ = false;      // guarded by mu_: a write is in flight or posted
 };
 
@@ -431,6 +438,20 @@ class LinuxIpcListener final : public IpcListener {
   }
 
   // io_context thread.
+  std::shared_ptr<HeldBytes> HeldBytesOf(uid_t uid) {
+    std::weak_ptr<HeldBytes>& entry = held_[uid];
+    std::shared_ptr<HeldBytes> held = entry.lock();
+    if (!held) {
+      held = std::make_shared<HeldBytes>();
+      entry = held;
+    }
+    if (held_.size() > 2 * uses_.size() + 64) {
+      std::erase_if(held_, [](const auto& e) { return e.second.expired(); });
+    }
+    return held;
+  }
+
+  // io_context thread.
   void Forget(LinuxConnection* connection) {
     if (!connections_.erase(connection)) return;
     Counters::Add(counters_->connectionsOpen, -1);
@@ -471,7 +492,10 @@ class LinuxIpcListener final : public IpcListener {
       credentials.uid = static_cast<uid_t>(-1);
     }
     std::shared_ptr<IpcUse>& use = uses_[credentials.uid];
-    if (!use) use = std::make_shared<IpcUse>();
+    if (!use) {
+      use = std::make_shared<IpcUse>();
+      use->held = HeldBytesOf(credentials.uid);
+    }
     auto connection = std::make_shared<LinuxConnection>(*this, std::move(socket), credentials.pid,
                                                         credentials.uid, use);
     const bool over_limit = connections_.size() >= options_.max_connections;
@@ -545,6 +569,9 @@ class LinuxIpcListener final : public IpcListener {
   std::shared_ptr<IpcListenerDelegate> delegate_;
   std::unordered_map<LinuxConnection*, std::shared_ptr<LinuxConnection>> connections_;
   std::unordered_map<uid_t, std::shared_ptr<IpcUse>> uses_;  // uids with a connection open
+  // Every uid's HeldBytes while anything holds it, so a uid that reconnects finds the bytes
+  // the service still holds for it.
+  std::unordered_map<uid_t, std::weak_ptr<HeldBytes>> held_;
   const std::shared_ptr<IpcUse> total_use_ = std::make_shared<IpcUse>();
   int budget_holds_ = 0;
   bool budget_wake_posted_ = false;
@@ -606,7 +633,16 @@ LinuxConnection::Hold LinuxConnection::WhyHeld(bool reading) {
       return Hold::kBudget;
     }
   }
-  if (sends_messages_ && options_.message_intake_blocked && options_.message_intake_blocked()) {
+  if (!sends_messages_) return Hold::kNone;
+  const HeldBytes& held = *uid_use_->held;
+  held_kind_ =
+      held.Get(HeldBytes::kStore) >= static_cast<std::int64_t>(options_.max_store_bytes_per_uid)
+          ? HeldBytes::kStore
+      : held.Get(HeldBytes::kParked) >= static_cast<std::int64_t>(options_.max_parked_bytes_per_uid)
+          ? HeldBytes::kParked
+          : HeldBytes::kKindCount;
+  if (held_kind_ != HeldBytes::kKindCount ||
+      (options_.message_intake_blocked && options_.message_intake_blocked())) {
     return Hold::kStore;
   }
   return Hold::kNone;
@@ -644,10 +680,11 @@ void LinuxConnection::Pump() {
 void LinuxConnection::SetHold(Hold hold) {
   if (hold == hold_) return;
   if (hold != Hold::kNone) {
-    Counters::Add(hold == Hold::kRequests  ? counters_->pausedForRequests
-                  : hold == Hold::kReplies ? counters_->pausedForReplies
-                  : hold == Hold::kBudget  ? counters_->pausedForBudget[held_budget_]
-                                           : counters_->pausedForStore);
+    Counters::Add(hold == Hold::kRequests               ? counters_->pausedForRequests
+                  : hold == Hold::kReplies              ? counters_->pausedForReplies
+                  : hold == Hold::kBudget               ? counters_->pausedForBudget[held_budget_]
+                  : held_kind_ != HeldBytes::kKindCount ? counters_->pausedForHeld[held_kind_]
+                                                        : counters_->pausedForStore);
   }
   if (hold_ == Hold::kStore) listener_.CountStoreHold(-1);
   if (hold == Hold::kStore) listener_.CountStoreHold(1);
@@ -670,7 +707,8 @@ bool LinuxConnection::Count(IpcBudget budget, std::size_t bytes) {
 }
 
 void LinuxConnection::CountRepliesLocked() {
-  Count(kIpcReplyBytes, state_ == State::kEnded ? 0 : pending_.size() + writing_bytes_);
+  Count(kIpcReplyBytes,
+        state_ == State::kEnded ? 0 : pending_.size() + writing_bytes_ + reply_room_);
 }
 
 void LinuxConnection::Released() {
@@ -818,10 +856,19 @@ bool LinuxConnection::HandleFrames() {
     ++untaken_requests_;
     untaken_bytes_ += bytes;
     Count(kIpcRequestBytes, untaken_bytes_);
+    // The reply's room counts in the reply budget until the reply takes its place.
+    const std::size_t room = protocol::ReplyRoomOf(header.op);
+    {
+      std::lock_guard lock(mu_);
+      reply_room_ += room;
+      CountRepliesLocked();
+    }
     std::weak_ptr<LinuxConnection> weak = shared_from_this();
     const std::uint32_t request_id = header.request_id;
-    object_->HandleRequest(header.op, args, [weak, request_id](Value result) {
-      if (auto connection = weak.lock()) connection->QueueReply(request_id, std::move(result));
+    object_->HandleRequest(header.op, args, [weak, request_id, room](Value result) {
+      if (auto connection = weak.lock()) {
+        connection->QueueReply(request_id, std::move(result), room);
+      }
     });
     std::lock_guard lock(mu_);
     if (state_ != State::kOpen) return false;  // the exported object closed us, or overflow
@@ -899,15 +946,22 @@ void LinuxConnection::SendErrorFrame() {
   });
 }
 
-void LinuxConnection::QueueReply(std::uint32_t request_id, Value result) {
+void LinuxConnection::QueueReply(std::uint32_t request_id, Value result, std::size_t room) {
   std::string frame;
-  if (!AppendFrame(frame, Value(Array{Value(request_id), std::move(result)}))) {
+  const bool fits = AppendFrame(frame, Value(Array{Value(request_id), std::move(result)}));
+  std::lock_guard lock(mu_);
+  // A request answered twice gives its room back twice; the room never goes below zero.
+  reply_room_ -= std::min(room, reply_room_);
+  if (!fits) {
+    CountRepliesLocked();
     asio::post(*io_,
                [self = shared_from_this(), request_id] { self->OnReplyTooLarge(request_id); });
     return;
   }
-  std::lock_guard lock(mu_);
-  if (state_ != State::kOpen && state_ != State::kDraining) return;
+  if (state_ != State::kOpen && state_ != State::kDraining) {
+    CountRepliesLocked();
+    return;
+  }
   pending_ += frame;
   if (pending_.size() + writing_bytes_ > max_outgoing_bytes_) {
     pending_.clear();

@@ -57,6 +57,11 @@ struct LinuxIpcOptions {
   // A connection is closed when the replies its peer has not read pass this many bytes; it
   // is not read while they are an eighth of that or more.
   std::size_t max_outgoing_bytes = 8u << 20;
+  // While the service holds this many bytes or more for a peer's uid of messages waiting
+  // for the store, or of single messages waiting in delay timers (IpcConnection::
+  // PeerHeldBytes), that uid's connections that have sent a message are not read.
+  std::size_t max_store_bytes_per_uid = 4u << 20;
+  std::size_t max_parked_bytes_per_uid = 4u << 20;
   // While this returns true, connections that have sent a message are not read (the store
   // is behind). Called on the IPC thread before each frame; may be empty.
   std::function<bool()> message_intake_blocked;

@@ -196,8 +196,10 @@ bool ReportingStore::AddSingleMessage(Value session_info, Value user_info, std::
   return writer_->Push(std::move(r), false);
 }
 
-bool ReportingStore::AddAnalyticsEvent(std::string name, std::function<Value()> provider) {
+bool ReportingStore::AddAnalyticsEvent(std::string name, std::function<Value()> provider,
+                                       std::size_t held_bytes) {
   Record r = MakeRecord(RecordKind::kAnalytics);
+  r.bytes = held_bytes;
   r.extra = std::make_unique<RecordExtra>();
   r.extra->name = std::move(name);
   r.extra->provider = std::move(provider);

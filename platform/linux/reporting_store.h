@@ -136,7 +136,9 @@ class ReportingStore {
 
   // An analytics_events row. `provider` (may be empty: payload null) is called once, on the
   // writer thread, when the row is written; it is not called when the record is dropped.
-  bool AddAnalyticsEvent(std::string name, std::function<Value()> provider);
+  // `held_bytes` (what the provider keeps alive) counts in BacklogBytes until then.
+  bool AddAnalyticsEvent(std::string name, std::function<Value()> provider,
+                         std::size_t held_bytes = 0);
 
   // A powerlog_events row.
   bool AddPowerLogEvent(std::int32_t subsystem, std::string name, Value payload);
@@ -167,6 +169,8 @@ class ReportingStore {
   // ask before every request.
   std::uint64_t Backlog() const;
   // The approximate bytes (Value::ApproximateBytes) of those records' payloads. Lock-free.
+  // A record's bytes also count, until it is written, in the HeldBytes account (kStore)
+  // that was charged on the thread that handed it over (HeldBytes::Charge), if any.
   std::uint64_t BacklogBytes() const;
   // Whether the store still takes records (not closed).
   bool IsOpen() const;

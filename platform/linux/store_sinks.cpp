@@ -90,8 +90,9 @@ class StoreAnalytics final : public Analytics {
  public:
   explicit StoreAnalytics(std::shared_ptr<ReportingStore> store) : store_(std::move(store)) {}
 
-  void SendEventLazy(const std::string& name, PayloadProvider provider) override {
-    store_->AddAnalyticsEvent(name, std::move(provider));
+  void SendEventLazy(const std::string& name, PayloadProvider provider,
+                     std::size_t held_bytes) override {
+    store_->AddAnalyticsEvent(name, std::move(provider), held_bytes);
   }
 
  private:

@@ -21,6 +21,7 @@ class FakeIpcConnection final : public IpcConnection {
   explicit FakeIpcConnection(pid_t pid, uid_t uid = 1000) : pid_(pid), uid_(uid) {}
   pid_t PeerPid() const override { return pid_; }
   uid_t PeerUid() const override { return uid_; }
+  std::shared_ptr<HeldBytes> PeerHeldBytes() const override { return held_; }
   std::string Description() const override {
     return "<FakeIpcConnection pid=" + std::to_string(pid_) + ">";
   }
@@ -74,6 +75,7 @@ class FakeIpcConnection final : public IpcConnection {
  private:
   const pid_t pid_;
   const uid_t uid_;
+  const std::shared_ptr<HeldBytes> held_ = std::make_shared<HeldBytes>();
   std::mutex mu_;
   std::shared_ptr<IpcExportedObject> exported_;  // GUARDED_BY(mu_)
   std::function<void()> interruption_;           // GUARDED_BY(mu_)

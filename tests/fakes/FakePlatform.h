@@ -53,7 +53,8 @@ struct AnalyticsEvent {
 class FakeAnalytics final : public Analytics, public EventRecord<AnalyticsEvent> {
  public:
   using Event = AnalyticsEvent;
-  void SendEventLazy(const std::string& name, PayloadProvider provider) override {
+  void SendEventLazy(const std::string& name, PayloadProvider provider,
+                     std::size_t /*held_bytes*/) override {
     Record({name, provider ? provider() : Value()});
   }
   std::vector<Event> EventsNamed(const std::string& name) const {

@@ -157,25 +157,79 @@ TEST(LinuxIpcTest, AConnectionIsReadOnlyWhileFewRequestsWaitToBeTakenIn) {
   EXPECT_EQ(object->requests, 101);
 }
 
-// While the store is behind, connections that have sent messages are not read; others are.
+// While the store is behind, or the service holds too many of the uid's message bytes
+// (waiting for the store, or parked), connections that have sent messages are not read;
+// others are, and each hold counts under its reason.
 TEST(LinuxIpcTest, MessageSendersWaitWhileTheStoreIsBehind) {
-  std::atomic<bool> behind{false};
-  LinuxIpcOptions options;
-  options.message_intake_blocked = [&] { return behind.load(); };
-  ListenerHarness harness(nullptr, options);
-  RawConnection sender(harness.socket_path());
-  const std::string message = RawConnection::Frame(Value(Array{6, 1, Dictionary{}, 1, 1, Value()}));
-  ASSERT_TRUE(sender.Write(message));
-  ASSERT_EQ(sender.ReadFrame(), Value(Array{1, Value()}));
-  behind = true;
-  ASSERT_TRUE(sender.Write(ValidRequests(2, 3)));
-  RawConnection other(harness.socket_path());
-  ASSERT_TRUE(other.Write(ValidRequests(7, 7)));
-  EXPECT_TRUE(other.ReadFrame());
-  EXPECT_FALSE(sender.ReadFrame(std::chrono::milliseconds(100)));
-  behind = false;
-  EXPECT_TRUE(sender.ReadFrame());
-  EXPECT_TRUE(sender.ReadFrame());
+  enum Cause { kStoreBehind, kUidStoreBytes, kUidParkedBytes };
+  for (const Cause cause : {kStoreBehind, kUidStoreBytes, kUidParkedBytes}) {
+    SCOPED_TRACE(cause);
+    std::atomic<bool> behind{false};
+    LinuxIpcOptions options;
+    options.message_intake_blocked = [&] { return behind.load(); };
+    options.max_store_bytes_per_uid = options.max_parked_bytes_per_uid = 1000;
+    options.counters = std::make_shared<Counters>();
+    ListenerHarness harness(nullptr, options);
+    RawConnection sender(harness.socket_path());
+    const std::string message =
+        RawConnection::Frame(Value(Array{6, 1, Dictionary{}, 1, 1, Value()}));
+    ASSERT_TRUE(sender.Write(message));
+    ASSERT_EQ(sender.ReadFrame(), Value(Array{1, Value()}));
+    HeldBytes& held = *harness.delegate().accepted().at(0).held;
+    const auto kind = cause == kUidParkedBytes ? HeldBytes::kParked : HeldBytes::kStore;
+    const auto hold = [&](std::int64_t bytes) {
+      cause == kStoreBehind ? behind.store(bytes > 0) : held.Add(kind, bytes);
+    };
+    hold(1000);
+    ASSERT_TRUE(sender.Write(ValidRequests(2, 3)));
+    RawConnection other(harness.socket_path());
+    ASSERT_TRUE(other.Write(ValidRequests(7, 7)));
+    EXPECT_TRUE(other.ReadFrame());
+    EXPECT_FALSE(sender.ReadFrame(std::chrono::milliseconds(100)));
+    hold(-1000);
+    EXPECT_TRUE(sender.ReadFrame());
+    EXPECT_TRUE(sender.ReadFrame());
+    EXPECT_EQ(Counters::Get(cause == kStoreBehind ? options.counters->pausedForStore
+                                                  : options.counters->pausedForHeld[kind]),
+              1u);
+  }
+}
+
+// Room for a reply counts in the reply budget from the moment its request is handed over:
+// requests whose replies could be large are not all handed over at once, and those held
+// back follow once the replies are made.
+TEST(LinuxIpcTest, RepliesNotYetMadeCountInTheReplyBudget) {
+  std::mutex mu;
+  std::vector<IpcReply> unanswered;
+  ListenerHarness harness(
+      [&](Op, const Array&, IpcReply reply) {
+        std::lock_guard lock(mu);
+        unanswered.push_back(std::move(reply));
+      },
+      [] {
+        LinuxIpcOptions options;
+        options.budgets[kIpcReplyBytes].per_uid = 2 * protocol::ReplyRoomOf(Op::kGetAllReporters);
+        return options;
+      }());
+  RawConnection raw(harness.socket_path());
+  std::string requests;
+  for (std::uint32_t id = 1; id <= 10; ++id) requests += RawConnection::Frame(Value(Array{10, id}));
+  ASSERT_TRUE(raw.Write(requests));
+  ASSERT_TRUE(Eventually([&] { return !harness.delegate().accepted().empty(); }));
+  auto object = harness.delegate().accepted().at(0).object.lock();
+  ASSERT_TRUE(Eventually([&] { return object->requests == 2; }));
+  std::this_thread::sleep_for(std::chrono::milliseconds(100));  // time to (wrongly) read on
+  EXPECT_EQ(object->requests, 2);
+  for (std::uint32_t id = 1; id <= 10; ++id) {
+    ASSERT_TRUE(Eventually([&] {
+      std::lock_guard lock(mu);
+      for (auto& reply : unanswered) reply(Value(Array{1}));
+      unanswered.clear();
+      return object->requests == 10;
+    }));
+    const auto reply = raw.ReadFrame();
+    ASSERT_TRUE(reply && reply->as_array()->front() == Value(id));
+  }
 }
 
 // A reply too large for a frame is never dropped in silence: the connection gets the error

@@ -92,12 +92,13 @@ class FakeDelegate final : public IpcListenerDelegate {
   struct Accepted {
     std::shared_ptr<std::atomic<int>> invalidations = std::make_shared<std::atomic<int>>(0);
     std::weak_ptr<FakeExportedObject> object;
+    std::shared_ptr<HeldBytes> held;  // the connection's PeerHeldBytes
   };
   explicit FakeDelegate(FakeExportedObject::Handler handler = nullptr)
       : handler_(std::move(handler)) {}
   bool ShouldAcceptNewConnection(IpcListener&, std::shared_ptr<IpcConnection> c) override {
     auto object = std::make_shared<FakeExportedObject>(handler_);
-    Accepted entry{.object = object};
+    Accepted entry{.object = object, .held = c->PeerHeldBytes()};
     c->SetExportedObject(object);
     c->SetInvalidationHandler([count = entry.invalidations] { ++*count; });
     c->Resume();

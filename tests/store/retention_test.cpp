@@ -158,7 +158,8 @@ TEST_F(RetentionTest, EventsThatReferToAMessageGoWithIt) {
       const Dictionary message{{"n", i}};
       Dictionary event = message;
       event.Set("HostApplicationDisplayID", "App");
-      analytics->SendEventLazy("e", [event] { return Value(event); });
+      analytics->SendEventLazy(
+          "e", [event] { return Value(event); }, 0);
       store->AddSessionMessage(session, 1, 1, Value(message));
     }
     gate.Release();

@@ -159,7 +159,8 @@ TEST_F(SchemaTest, AnalyticsEventsThatRepeatAMessageReferToItAndReadBackTheSame)
   WriterGate gate;  // each event and its message land in one batch, the event first
   gate.Close(*store);
   for (const Case& c : cases) {
-    analytics->SendEventLazy(c.what, [event = c.event] { return Value(event); });
+    analytics->SendEventLazy(
+        c.what, [event = c.event] { return Value(event); }, 0);
     session->SendMessage(1, 1, Value(c.message), nullptr);
   }
   gate.Release();

@@ -268,12 +268,15 @@ TYPED_TEST(EventSinkContractTest, EachSinkRecordsItsEventsInOrder) {
   {
     // The payload lives only in the provider, as the analytics bridge hands it over.
     Value payload(Dictionary{{"HostApplicationDisplayID", "Unknown"}, {"volume", 0.5}});
-    this->sinks_.analytics->SendEventLazy("com.norvel.quenta.Volume.Stop", [payload, &calls] {
-      ++calls;
-      return payload;
-    });
+    this->sinks_.analytics->SendEventLazy(
+        "com.norvel.quenta.Volume.Stop",
+        [payload, &calls] {
+          ++calls;
+          return payload;
+        },
+        0);
   }
-  this->sinks_.analytics->SendEventLazy("empty", nullptr);
+  this->sinks_.analytics->SendEventLazy("empty", nullptr, 0);
   this->sinks_.enerdex->LogRegisteredEvent(
       28, "Vistrel_Haptics",
       Value(Dictionary{{"EngineOnDuration", 1.5}, {"ApplicationName", "Unknown"}}), Value());
@@ -303,10 +306,13 @@ class StoreSinksTest : public testing::StoreTest {
 // for the disk).
 TEST_F(StoreSinksTest, ProvidersRunOnTheWriterAndDiscoveryAnswersAtOnce) {
   std::thread::id provider_thread;
-  NewStoreAnalytics(store_)->SendEventLazy("e", [&] {
-    provider_thread = std::this_thread::get_id();
-    return Value();
-  });
+  NewStoreAnalytics(store_)->SendEventLazy(
+      "e",
+      [&] {
+        provider_thread = std::this_thread::get_id();
+        return Value();
+      },
+      0);
   store_->Drain();
   EXPECT_NE(provider_thread, std::thread::id());
   EXPECT_NE(provider_thread, std::this_thread::get_id());

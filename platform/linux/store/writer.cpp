@@ -188,7 +188,8 @@ void ReportingStoreWriter::Start() {
 // queue is full. Returns false when the record was not taken; a control record's
 // callback is then the caller's to run.
 bool ReportingStoreWriter::Push(Record&& record, bool control, std::int64_t* new_session_id) {
-  record.bytes = record.payload.ApproximateBytes();
+  record.bytes += record.payload.ApproximateBytes();
+  if (record.bytes > 0) record.charged = HeldBytes::Charge::Current();
   std::unique_lock lock(mu_);
   // Taken under the lock: session ids then follow the queue's order, which is the
   // commit order.
@@ -203,6 +204,9 @@ bool ReportingStoreWriter::Push(Record&& record, bool control, std::int64_t* new
   ++stats_.handed_over;
   backlog_.fetch_add(1, std::memory_order_relaxed);
   backlog_bytes_.fetch_add(queue_.back().bytes, std::memory_order_relaxed);
+  if (queue_.back().charged) {
+    queue_.back().charged->Add(HeldBytes::kStore, static_cast<std::int64_t>(queue_.back().bytes));
+  }
   const bool wake = writer_idle_ || (gathering_ && queue_.size() == kGatherRecords);
   writer_idle_ = false;
   lock.unlock();
@@ -304,7 +308,10 @@ void ReportingStoreWriter::Run() {
     const auto failed = static_cast<std::uint64_t>(
         std::count_if(batch.begin(), batch.end(), [](const Record& r) { return r.failed; }));
     std::uint64_t bytes = 0;
-    for (const Record& r : batch) bytes += r.bytes;
+    for (const Record& r : batch) {
+      bytes += r.bytes;
+      if (r.charged) r.charged->Add(HeldBytes::kStore, -static_cast<std::int64_t>(r.bytes));
+    }
     batch.clear();
     if (batch.capacity() > kKeptQueueCapacity) batch.shrink_to_fit();
     {

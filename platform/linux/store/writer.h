@@ -17,6 +17,7 @@
 #include <vector>
 
 #include "common/Error.h"
+#include "common/HeldBytes.h"
 #include "common/Value.h"
 #include "platform/linux/reporting_store.h"
 #include "platform/linux/store/checkpointer.h"
@@ -62,7 +63,10 @@ struct Record {
   bool failed = false;  // set by the writer when the record could not be written
   double time = 0;
   Value payload;
-  std::size_t bytes = 0;  // the payload's approximate size, counted in backlog_bytes_
+  // The approximate bytes the record holds (its payload's, plus what a provider keeps),
+  // counted in backlog_bytes_ and, when `charged`, in that account until written.
+  std::size_t bytes = 0;
+  std::shared_ptr<HeldBytes> charged;
   std::unique_ptr<RecordExtra> extra;
 };
 
