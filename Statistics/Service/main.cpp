@@ -110,7 +110,7 @@ struct Limits {
   std::size_t max_pending_requests = LinuxIpcOptions{}.max_pending_requests;
   std::size_t max_pending_bytes = LinuxIpcOptions{}.max_pending_request_bytes;
   std::size_t max_unread_reply_bytes = LinuxIpcOptions{}.max_outgoing_bytes;
-  std::size_t store_high_water = 4096;
+  std::size_t store_high_water = 1024;
   // Per uid and byte budgets (docs/daemon.md, "Who may do what").
   std::size_t max_reporter_ids = LinuxIpcOptions{}.max_reporter_ids;
   std::size_t max_connections_per_uid = LinuxIpcOptions{}.max_connections_per_uid;
