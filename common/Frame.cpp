@@ -32,6 +32,23 @@ void FrameDecoder::Feed(std::string_view bytes) {
   buffer_.append(bytes);
 }
 
+namespace {
+// The body length in the 4-byte header at `at`.
+std::uint32_t BodyLength(const char* at) {
+  const auto* header = reinterpret_cast<const unsigned char*>(at);
+  return (std::uint32_t{header[0]} << 24) | (std::uint32_t{header[1]} << 16) |
+         (std::uint32_t{header[2]} << 8) | std::uint32_t{header[3]};
+}
+}  // namespace
+
+std::size_t FrameDecoder::Missing() const {
+  if (error_ || buffered() < kFrameHeaderBytes) return 0;
+  const std::uint32_t length = BodyLength(buffer_.data() + consumed_);
+  if (length == 0 || length > protocol::kMaxBodyBytes) return 0;
+  const std::size_t whole = kFrameHeaderBytes + length;
+  return whole > buffered() ? whole - buffered() : 0;
+}
+
 std::optional<std::string_view> FrameDecoder::Next() {
   if (error_) return std::nullopt;
   if (consumed_ == buffer_.size()) {
@@ -43,9 +60,7 @@ std::optional<std::string_view> FrameDecoder::Next() {
     return std::nullopt;
   }
   if (buffered() < kFrameHeaderBytes) return std::nullopt;
-  const auto* header = reinterpret_cast<const unsigned char*>(buffer_.data() + consumed_);
-  const std::uint32_t length = (std::uint32_t{header[0]} << 24) | (std::uint32_t{header[1]} << 16) |
-                               (std::uint32_t{header[2]} << 8) | std::uint32_t{header[3]};
+  const std::uint32_t length = BodyLength(buffer_.data() + consumed_);
   if (length == 0 || length > protocol::kMaxBodyBytes) {
     error_ =
         protocol::RequestProblem{protocol::ConnectionError::kBadLength,

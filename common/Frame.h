@@ -44,6 +44,10 @@ class FrameDecoder {
   // Bytes held that were fed but not yet returned by Next (including a partial frame).
   std::size_t buffered() const { return buffer_.size() - consumed_; }
 
+  // Bytes still to come before the next frame is whole: 0 when it is whole, when its
+  // header has not fully arrived, or when its length is bad.
+  std::size_t Missing() const;
+
  private:
   void DropConsumed();
 

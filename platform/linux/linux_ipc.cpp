@@ -2,7 +2,6 @@
 
 #include <fcntl.h>
 #include <sys/file.h>
-#include <sys/ioctl.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/un.h>
@@ -282,6 +281,14 @@ class LinuxConnection final : public IpcConnection,
   void CountRepliesLocked();  // REQUIRES: mu_ held
   // Lets the connections held for a budget look again, after this one freed some.
   void Released();
+  // Counts the frame budget: the bytes read and not yet handed over, with the rest of an
+  // admitted frame in progress; a frame in progress not yet admitted counts nothing (it
+  // holds one read at most, as its connection is not read until then). A frame is admitted
+  // when its whole length fits its uid's and the total budget (or nothing else is counted
+  // there), so an admitted frame can always be read to its end and no set of half-read
+  // frames can hold a budget for ever.
+  void CountFrameBytes();
+  bool FrameAdmitted() const { return admitted_frame_ == frames_read_ + 1; }
   // Closes the connection when its read bytes hold no whole frame for too long.
   void WatchPartialFrame();
   void OnPartialFrameTimer();
@@ -335,6 +342,7 @@ class LinuxConnection final : public IpcConnection,
   // the store, or everyone's parked messages, is behind).
   HeldBytes::Kind held_kind_ = HeldBytes::kKindCount;
   std::uint64_t frames_read_ = 0;
+  std::uint64_t admitted_frame_ = 0;   // the number (frames_read_ + 1) of the frame admitted
   std::uint64_t frames_at_watch_ = 0;  // frames_read_ when the partial frame timer started
   std::uint64_t frame_watch_ = 0;      // the partial frame timer's current run
   bool frame_watched_ = false;
@@ -625,7 +633,13 @@ LinuxConnection::Hold LinuxConnection::WhyHeld(bool reading) {
     if (pending_.size() + writing_bytes_ >= pause_reply_bytes_) return Hold::kReplies;
   }
   for (std::size_t b = 0; b < kIpcBudgetCount; ++b) {
-    if (b == kIpcFrameBytes && !reading) continue;
+    if (b == kIpcFrameBytes && (!reading || decoder_.Missing() > 0)) {
+      // A frame in progress reads on to its end once admitted (its whole length is counted
+      // already) and waits until then.
+      if (!reading || FrameAdmitted()) continue;
+      held_budget_ = kIpcFrameBytes;
+      return Hold::kBudget;
+    }
     const IpcByteBudget& budget = options_.budgets[b];
     if (uid_use_->bytes[b].load(std::memory_order_relaxed) >= budget.per_uid ||
         total_use_->bytes[b].load(std::memory_order_relaxed) >= budget.total) {
@@ -658,7 +672,7 @@ void LinuxConnection::Pump() {
   const bool ok = HandleFrames();
   CloseBatch();
   if (!ok) return;
-  if (Count(kIpcFrameBytes, decoder_.buffered())) Released();
+  CountFrameBytes();
   WatchPartialFrame();
   if (yielded_) {
     asio::post(*io_, [self = shared_from_this()] { self->Pump(); });
@@ -719,6 +733,27 @@ void LinuxConnection::Released() {
   listener_.WakeBudgetHeld();
 }
 
+void LinuxConnection::CountFrameBytes() {
+  const std::size_t missing = decoder_.Missing();
+  if (missing > 0 && !FrameAdmitted()) {
+    // Everything buffered belongs to the frame in progress.
+    const std::size_t whole = decoder_.buffered() + missing;
+    const std::size_t mine = counted_[kIpcFrameBytes];
+    const IpcByteBudget& budget = options_.budgets[kIpcFrameBytes];
+    const auto fits = [&](const IpcUse& use, std::size_t limit) {
+      const std::size_t others = use.bytes[kIpcFrameBytes].load(std::memory_order_relaxed) - mine;
+      return others == 0 || others + whole <= limit;
+    };
+    if (fits(*uid_use_, budget.per_uid) && fits(*total_use_, budget.total)) {
+      admitted_frame_ = frames_read_ + 1;
+    }
+  }
+  const std::size_t bytes = missing == 0      ? decoder_.buffered()
+                            : FrameAdmitted() ? decoder_.buffered() + missing
+                                              : 0;
+  if (Count(kIpcFrameBytes, bytes)) Released();
+}
+
 void LinuxConnection::WatchPartialFrame() {
   if (decoder_.buffered() == 0) {
     if (frame_watched_) frame_timer_.cancel();
@@ -741,14 +776,11 @@ void LinuxConnection::OnPartialFrameTimer() {
     std::lock_guard lock(mu_);
     if (state_ != State::kOpen) return;
   }
-  // Whole frames went through since, or the bytes wait for the service, not for the peer. A
-  // connection held for a budget that others share waits for the service when the rest of
-  // its frame is in the socket, unread because of the hold.
-  int unread = 0;
+  // Whole frames went through since, or the bytes wait for the service, not for the peer
+  // (a frame waiting for admission among them). A peer that leaves its replies unread is
+  // not waiting for the service.
   const bool waits_for_service =
-      hold_ == Hold::kRequests || hold_ == Hold::kReplies || hold_ == Hold::kStore ||
-      (hold_ == Hold::kBudget && ioctl(socket_.native_handle(), FIONREAD, &unread) == 0 &&
-       unread > 0);
+      hold_ == Hold::kRequests || hold_ == Hold::kStore || hold_ == Hold::kBudget;
   if (frames_read_ != frames_at_watch_ || waits_for_service) {
     WatchPartialFrame();
     return;

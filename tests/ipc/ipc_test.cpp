@@ -232,6 +232,50 @@ TEST(LinuxIpcTest, RepliesNotYetMadeCountInTheReplyBudget) {
   }
 }
 
+// Half-read frames cannot hold the frame budget for ever: a frame is read to its end once
+// its whole length fits the budget, others wait their turn (not timed out meanwhile), and a
+// peer that stalls inside an admitted frame is timed out.
+TEST(LinuxIpcTest, FramesInProgressFinishWithinTheFrameBudget) {
+  LinuxIpcOptions options;
+  options.budgets[kIpcFrameBytes].per_uid = 3 * protocol::kMaxBodyBytes / 2;
+  options.partial_frame_timeout_ms = 1000;
+  ListenerHarness harness(nullptr, options);
+  const auto request = [](std::uint32_t id) {
+    return RawConnection::Frame(
+        Value(Array{4, id, Dictionary{{"k", std::string(1'000'000, 'x')}}, 1}));
+  };
+  RawConnection stalled(harness.socket_path());
+  ASSERT_TRUE(stalled.Write(request(1).substr(0, 100'000)));
+  ASSERT_TRUE(Eventually([&] { return harness.delegate().accepted().size() == 1; }));
+  std::this_thread::sleep_for(std::chrono::milliseconds(50));  // admitted before the others
+  // Two whole frames, written a piece at a time in turn, so that both are half read at once.
+  RawConnection writers[] = {RawConnection(harness.socket_path()),
+                             RawConnection(harness.socket_path())};
+  std::thread interleave([&] {
+    std::string left[] = {request(2), request(3)};
+    const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
+    while ((!left[0].empty() || !left[1].empty()) && std::chrono::steady_clock::now() < deadline) {
+      for (int i = 0; i < 2; ++i) {
+        const ssize_t n =
+            ::send(writers[i].fd(), left[i].data(), std::min<std::size_t>(left[i].size(), 65536),
+                   MSG_DONTWAIT | MSG_NOSIGNAL);
+        if (n > 0) left[i].erase(0, static_cast<std::size_t>(n));
+      }
+      std::this_thread::sleep_for(std::chrono::microseconds(100));
+    }
+  });
+  const auto error = stalled.ReadFrame();
+  ASSERT_TRUE(error && error->as_array() && error->as_array()->at(1).as_dictionary());
+  EXPECT_EQ(*error->as_array()->at(1).as_dictionary()->Find("code"),
+            Value(static_cast<std::int64_t>(ConnectionError::kBadMessagePack)));
+  for (std::uint32_t i = 0; i < 2; ++i) {
+    const auto reply = writers[i].ReadFrame(std::chrono::seconds(10));
+    EXPECT_EQ(reply, Value(Array{i + 2, true}))
+        << i << " " << (reply ? reply->Description() : "none");
+  }
+  interleave.join();
+}
+
 // A reply too large for a frame is never dropped in silence: the connection gets the error
 // frame (code 9) after the replies before it, and is closed.
 TEST(LinuxIpcTest, AReplyTooLargeForAFrameClosesWithTheErrorFrame) {
