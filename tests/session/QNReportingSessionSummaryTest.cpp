@@ -339,5 +339,49 @@ TEST_F(SummaryTest, PayloadsBeyondTheAggregationCapAreDeliveredButNotSummarised)
   }
 }
 
+// A configuration that would take its session, the sessions of its creator's uid, or all
+// sessions past their cap is acknowledged but not merged; one uid's cap does not hold back
+// the sessions of another.
+TEST_F(SummaryTest, ConfigurationsBeyondACapAreNotMerged) {
+  const std::size_t one = Value(Dictionary{{"k1", 1}}).ApproximateBytes();
+  const std::size_t two = Value(Dictionary{{"k1", 1}, {"k2", 2}}).ApproximateBytes();
+  const Counters& counters = *t_.platform->counters;
+  struct {
+    std::size_t Platform::*cap;
+    std::size_t value;
+    bool firstMerges, secondMerges, otherUidMerges;  // the last configuration of each
+    std::uint64_t capped;
+  } cases[] = {
+      {&Platform::max_configuration_bytes, two - 1, false, false, true, 2},
+      {&Platform::max_configuration_bytes_per_uid, two + one, true, false, true, 1},
+      {&Platform::max_configuration_bytes_total, two + one, true, false, false, 2},
+  };
+  for (const auto& c : cases) {
+    SCOPED_TRACE(c.value);
+    const auto held = static_cast<std::size_t>(Counters::Get(counters.configurationBytes));
+    (*t_.platform).*c.cap =
+        c.value + (c.cap == &Platform::max_configuration_bytes_total ? held : 0);
+    const std::uint64_t capped = Counters::Get(counters.configurationCapped);
+    const auto uid = std::make_shared<HeldBytes>(), other = std::make_shared<HeldBytes>();
+    const auto created = [&](const std::shared_ptr<HeldBytes>& account, std::int64_t id) {
+      const HeldBytes::Charge charge(account);
+      return NewSession(id, 3);
+    };
+    auto first = created(uid, 1), second = created(uid, 2), third = created(other, 3);
+    first->setConfiguration(Payload({{"k1", 1}}));
+    first->setConfiguration(Payload({{"k2", 2}}));
+    second->setConfiguration(Payload({{"k1", 1}}));
+    second->setConfiguration(Payload({{"k2", 2}}));
+    third->setConfiguration(Payload({{"k1", 1}}));
+    EXPECT_EQ(first->userInfo()->Contains("k2"), c.firstMerges);
+    EXPECT_EQ(second->userInfo()->Contains("k2"), c.secondMerges);
+    EXPECT_EQ(third->userInfo()->Contains("k1"), c.otherUidMerges);
+    EXPECT_EQ(Counters::Get(counters.configurationCapped), capped + c.capped);
+    EXPECT_EQ(uid->Get(HeldBytes::kConfiguration),
+              static_cast<std::int64_t>((c.firstMerges ? two : one) + one));
+    (*t_.platform).*c.cap = SIZE_MAX;
+  }
+}
+
 }  // namespace
 }  // namespace qn
