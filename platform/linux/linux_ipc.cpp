@@ -746,6 +746,9 @@ void LinuxConnection::CountFrameBytes() {
     };
     if (fits(*uid_use_, budget.per_uid) && fits(*total_use_, budget.total)) {
       admitted_frame_ = frames_read_ + 1;
+      // The peer's time for the frame starts now: the wait for admission was the daemon's.
+      if (frame_watched_) frame_timer_.cancel();
+      frame_watched_ = false;
     }
   }
   const std::size_t bytes = missing == 0      ? decoder_.buffered()

@@ -255,13 +255,15 @@ TEST(LinuxIpcTest, FramesInProgressFinishWithinTheFrameBudget) {
     std::string left[] = {request(2), request(3)};
     const auto deadline = std::chrono::steady_clock::now() + std::chrono::seconds(10);
     while ((!left[0].empty() || !left[1].empty()) && std::chrono::steady_clock::now() < deadline) {
+      bool sent = false;
       for (int i = 0; i < 2; ++i) {
         const ssize_t n =
             ::send(writers[i].fd(), left[i].data(), std::min<std::size_t>(left[i].size(), 65536),
                    MSG_DONTWAIT | MSG_NOSIGNAL);
         if (n > 0) left[i].erase(0, static_cast<std::size_t>(n));
+        sent = sent || n > 0;
       }
-      std::this_thread::sleep_for(std::chrono::microseconds(100));
+      if (!sent) std::this_thread::sleep_for(std::chrono::microseconds(100));
     }
   });
   const auto error = stalled.ReadFrame();
