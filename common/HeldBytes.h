@@ -28,10 +28,12 @@ class HeldBytes {
   }
   std::int64_t Get(Kind kind) const { return bytes_[kind].load(std::memory_order_relaxed); }
 
-  // Charges the store records handed over on this thread, while it lives, to `account`
-  // (may be null: nobody's). The store sinks take the current account when they hand a
-  // record over and give its bytes back once the record is written, so the service only
-  // has to say whose work it is doing around a delivery. Nests: the innermost wins.
+  // Charges the work done on this thread, while it lives, to `account` (may be null:
+  // nobody's): the store takes the current account with each record handed over and gives
+  // the bytes back once the record is written; a parked single message and the
+  // configuration of a session created now count there too; work queued for later carries
+  // the charge along. So the service only says whose request it is serving. Nests: the
+  // innermost wins.
   class Charge {
    public:
     explicit Charge(std::shared_ptr<HeldBytes> account);
