@@ -211,12 +211,12 @@ TEST(QnreportShellTest, OneConnectionEveryReplyAsAJsonLine) {
     }
     testing::FakeExportedObject::DefaultReply(op, args, reply);
   });
+  std::ostringstream out;  // outlives the client, whose late replies may still print to it
   auto client = client::Client::Connect(harness.socket_path());
   ASSERT_TRUE(client);
   std::istringstream in(
       "create 42\ntype 42 2\nbogus\nname 0\nsend {\"route\": \"speaker\"} 5 1 42\nwait\n"
       "valid 42\nreporters\n");
-  std::ostringstream out;
   EXPECT_EQ(RunShell(*client, in, out, std::chrono::seconds(20)), 0);
   // The error line is printed when its line is read; the replies when they arrive.
   std::istringstream printed(out.str());
